@@ -1,0 +1,114 @@
+#include "Daemon/support/QRNError.h"
+#include "Daemon/support/Value.h"
+#include "common/LogCapture.h"
+
+#include <gtest/gtest.h>
+
+#include <unordered_set>
+
+using namespace quarn;
+
+TEST(Value, TypedAccessorsAnswerNoneOnWrongType) {
+    Value s("text");
+    EXPECT_FALSE(s.asUInt64());
+    EXPECT_FALSE(s.asBool());
+    EXPECT_EQ(s.asDictionary(), nullptr);
+    EXPECT_EQ(s.asArray(), nullptr);
+    EXPECT_EQ(s.get("key"), nullptr);
+    ASSERT_NE(s.asString(), nullptr);
+    EXPECT_EQ(*s.asString(), "text");
+
+    // Integers convert between signedness only where the value fits.
+    EXPECT_EQ(Value(-1).asUInt64(), std::nullopt);
+    EXPECT_EQ(Value(7).asUInt64(), 7u);
+    EXPECT_EQ(Value(UINT64_MAX).asInt64(), std::nullopt);
+    EXPECT_EQ(Value(2.5).asUInt64(), std::nullopt);
+    EXPECT_EQ(Value(true).asUInt64(), std::nullopt);
+    EXPECT_EQ(Value(3u).asDouble(), 3.0);
+    EXPECT_TRUE(Value(3u).isNumber());
+    EXPECT_FALSE(Value(true).isNumber());
+}
+
+TEST(Value, EqualityAndHashAgree) {
+    EXPECT_EQ(Value(5), Value(5u));
+    EXPECT_EQ(Value(5).hash(), Value(5u).hash());
+    EXPECT_NE(Value(5), Value(5.0));
+    EXPECT_NE(Value(1), Value(true));
+    EXPECT_NE(Value("a"), Value(Value::Data{'a'}));
+
+    UUID u = UUID::random();
+    Value a = Value::Dictionary{{"k", Value::Array{1, "two", u, Date{42}}}, {"d", Value::Data{1, 2}}};
+    Value b = Value::Dictionary{{"d", Value::Data{1, 2}}, {"k", Value::Array{1u, "two", u, Date{42}}}};
+    EXPECT_EQ(a, b);
+    EXPECT_EQ(a.hash(), b.hash());
+    std::unordered_set<Value> set{a, b, Value("x")};
+    EXPECT_EQ(set.size(), 2u);
+
+    b.mutableDictionary()["k"].append(3);
+    EXPECT_NE(a, b);
+}
+
+TEST(Value, CopiesAreIndependent) {
+    Value a = Value::dictionary();
+    a.set("x", 1);
+    Value b = a;
+    b.set("x", 2);
+    b.set("y", Value::Array{});
+    EXPECT_EQ(*a.get("x"), Value(1));
+    EXPECT_EQ(a.get("y"), nullptr);
+    EXPECT_EQ(*b.get("x"), Value(2));
+    EXPECT_TRUE(b.erase("y"));
+    EXPECT_FALSE(b.erase("y"));
+    EXPECT_EQ(a.size(), 1u);
+}
+
+TEST(Value, DescriptionIsDeterministicAndReadable) {
+    Value v = Value::Dictionary{{"b", Value::Array{1, "s"}}, {"a", true}, {"c", Value::Dictionary{}}};
+    EXPECT_EQ(v.description(), "{\n    \"a\" = true;\n    \"b\" = (\n        1,\n        \"s\"\n    );\n"
+                               "    \"c\" = {};\n}");
+    EXPECT_EQ(Value().description(), "(null)");
+    EXPECT_EQ(Value(Value::Data{0xde, 0xad}).description(), "<dead>");
+}
+
+TEST(UUID, ParseAndCanonicalForm) {
+    auto u = UUID::parse("e621e1f8-c36c-495a-93fc-0c247a3e6e5f");
+    ASSERT_TRUE(u);
+    EXPECT_EQ(u->string(), "E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
+    EXPECT_EQ(UUID::parse(u->string()), u);
+    EXPECT_FALSE(UUID::parse("E621E1F8C36C495A93FC0C247A3E6E5F"));
+    EXPECT_FALSE(UUID::parse("E621E1F8-C36C-495A-93FC-0C247A3E6E5"));
+    EXPECT_FALSE(UUID::parse("G621E1F8-C36C-495A-93FC-0C247A3E6E5F"));
+    EXPECT_FALSE(UUID::parse(""));
+    EXPECT_NE(UUID::random(), UUID::random());
+    EXPECT_TRUE(UUID().isNil());
+    EXPECT_FALSE(UUID::random().isNil());
+}
+
+TEST(QRNError, CarriesFunctionLineAndLogsOnce) {
+    test::LogCapture capture;
+    Error inner = QRN_POSIX_ERROR(ENOENT, "stat of [{}] failed: {}", "/x", "No such file");
+    Error outer = QRN_ERROR_UNDERLYING(inner, kQRNErrorMoveDirFailed, "Failed to move dir: {} to: {}",
+                                       "/a", "/b");
+    EXPECT_TRUE(inner.isPOSIX(ENOENT));
+    EXPECT_TRUE(outer.isQRN(kQRNErrorMoveDirFailed));
+    EXPECT_EQ(outer.qrnCode(99), 4u);
+    EXPECT_EQ(inner.qrnCode(99), 99u);
+    EXPECT_EQ(outer.message, "Failed to move dir: /a to: /b");
+    EXPECT_NE(outer.function.find("CarriesFunctionLineAndLogsOnce"), std::string::npos);
+    EXPECT_GT(outer.line, 0);
+    ASSERT_TRUE(outer.underlying);
+    EXPECT_EQ(outer.underlying->code, ENOENT);
+    EXPECT_EQ(capture.count("Failed to move dir: /a to: /b"), 1u) << capture.all();
+    EXPECT_TRUE(capture.contains(std::to_string(outer.line) + ": Failed to move dir: /a to: /b ("));
+    EXPECT_NE(outer.description().find("QRNErrorDomain"), std::string::npos);
+    EXPECT_STREQ(QRNErrorCodeName(21), "ContainerNotFound");
+    EXPECT_STREQ(QRNErrorCodeName(2), "Unknown");
+}
+
+TEST(QRNError, QualifiedFunctionName) {
+    EXPECT_EQ(qualifiedFunctionName("quarn::Result<int> quarn::A::f(int, std::map<int, int>)"),
+              "quarn::A::f");
+    EXPECT_EQ(qualifiedFunctionName("void f()"), "f");
+    EXPECT_EQ(qualifiedFunctionName("static std::vector<std::pair<int, int> > quarn::B::g() const"),
+              "quarn::B::g");
+}
