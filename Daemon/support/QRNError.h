@@ -106,6 +106,9 @@ struct Error {
 
 template <class T> using Result = Expected<T, Error>;
 using Status = Expected<void, Error>;
+// For operations that report a bare QRNErrorDomain code (never 1 on failure).
+template <class T> using CodeResult = Expected<T, std::uint64_t>;
+#define QRN_CODE(code) ::quarn::Unexpected<std::uint64_t>(static_cast<std::uint64_t>(code))
 
 // "quarn::QRNFileManager::removeItemAtURL" from a __PRETTY_FUNCTION__.
 std::string qualifiedFunctionName(std::string_view prettyFunction);

@@ -1,5 +1,6 @@
 #include "TempRoot.h"
 
+#include "Daemon/platform/LinuxPlatform.h"
 #include "Daemon/platform/Paths.h"
 
 #include <fstream>
@@ -29,6 +30,7 @@ TempRoot::TempRoot(Options options) {
     std::filesystem::create_directories(*this / "/private/var/mobile");
     if (options.installContext) {
         context_ = std::make_shared<QRNDaemonContext>(root_);
+        installLinuxPlatform(*context_);
         QRNDaemonContext::setCurrent(context_);
     }
 }
