@@ -1,5 +1,6 @@
 #include "Daemon/platform/LinuxPlatform.h"
 
+#include "Daemon/platform/LinuxAccounts.h"
 #include "Daemon/platform/Paths.h"
 #include "Daemon/support/QRNDaemonContext.h"
 
@@ -8,7 +9,9 @@
 namespace quarn {
 
 void installLinuxPlatform(QRNDaemonContext& context) {
-    context.install(std::make_shared<Paths>(context.rootPrefix()));
+    const Paths paths(context.rootPrefix());
+    context.install(std::make_shared<Paths>(paths));
+    context.install<Accounts>(std::make_shared<LinuxAccounts>(paths));
 }
 
 } // namespace quarn
