@@ -1,0 +1,180 @@
+#pragma once
+// The one place where the daemon touches the file system below the level of
+// containers: containment checks, directory creation with mode, owner and
+// protection class, removal (clearing the immutable flag where it blocks),
+// moves and copies with a copy-then-remove fallback across file systems,
+// temporary directories, ACLs of system containers, ownership, protection
+// classes and disk usage.
+//
+// Stateless apart from its Env (the system-call seam), so it may be called
+// from any thread. Paths are absolute and already below the root prefix.
+// Trees are walked by descriptor and symbolic links are never followed.
+//
+// The operations are spread over files by concern:
+// QRNFileManager.cpp (construction, existence, home directory),
+// +Create, +Remove, +Copy, +Move, +Traverse, +Listing, +Containment, +ACL,
+// +Ownership, +Protection, +DiskUsage.
+
+#include "Daemon/support/QRNError.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace quarn {
+
+class Env;
+class QRNDaemonContext;
+
+class QRNFileManager {
+public:
+    // A data protection class that means "leave the class alone".
+    static constexpr int kProtectionClassUnchanged = -1;
+    static constexpr std::string_view kDefaultTemporaryPrefix = "temp.";
+
+    // The short forms of createDirectoryAtURL take one of these so that an
+    // owner can never be taken for a class or the other way round.
+    struct Owner {
+        uid_t uid;
+    };
+    struct ProtectionClass {
+        int value;
+    };
+
+    // One entry of a listing: a path inside the listed directory.
+    struct Item {
+        std::filesystem::path url;
+        bool isDirectory = false;
+    };
+
+    // One entry of a traversal, in walk order. Directories come twice: before
+    // their contents (DirectoryPreOrder) and after (DirectoryPostOrder).
+    // Mount points of other file systems are reported but not entered.
+    struct TraversalEntry {
+        enum class Kind { DirectoryPreOrder, DirectoryPostOrder, File, Symlink, Other };
+        Kind kind = Kind::File;
+        std::filesystem::path path; // full path
+        std::string name;           // last component
+        int level = 0;              // 0 for the root of the walk
+        struct stat status {};      // lstat of the entry
+        // Open directory holding the entry (AT_FDCWD for the root, whose
+        // `path` is then used): calls by (parentFd, name) never follow a link.
+        int parentFd = AT_FDCWD;
+        bool isDirectory() const {
+            return kind == Kind::DirectoryPreOrder || kind == Kind::DirectoryPostOrder;
+        }
+    };
+    // Returning an error stops the walk; the traversal then fails with it.
+    using TraversalBlock = std::function<Status(const TraversalEntry&)>;
+
+    // Uses the context's installed Env, or the system's when none is.
+    explicit QRNFileManager(QRNDaemonContext& context);
+    QRNFileManager(QRNDaemonContext& context, std::shared_ptr<Env> env);
+
+    // The current daemon context's instance.
+    static QRNFileManager& defaultManager();
+
+    Env& env() const { return *env_; }
+
+    // --- Removal, creation, moves and copies -------------------------------
+
+    // Recursive removal; a missing item is success.
+    Status removeItemAtURL(const std::filesystem::path& url);
+
+    Status createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories,
+                                mode_t mode, uid_t owner, int protectionClass);
+    Status createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories,
+                                mode_t mode, Owner owner);
+    Status createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories,
+                                mode_t mode, ProtectionClass protectionClass);
+    Status createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories,
+                                mode_t mode);
+
+    Status moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst);
+    Status moveItemIfExistsAtURL(const std::filesystem::path& src,
+                                 const std::filesystem::path& dst);
+    Status _moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst,
+                          bool failIfSrcMissing);
+
+    // The destination must not exist; a copy that fails part way is removed.
+    Status copyItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst);
+    Status copyItemIfExistsAtURL(const std::filesystem::path& src,
+                                 const std::filesystem::path& dst);
+    Status _copyItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst,
+                          bool failIfSrcMissing);
+
+    Result<std::filesystem::path>
+    createTemporaryDirectoryInDirectoryURL(const std::filesystem::path& directory,
+                                           std::string_view namePrefix);
+    Result<std::filesystem::path>
+    createTemporaryDirectoryInDirectoryURL(const std::filesystem::path& directory);
+
+    // --- Walking and listing ------------------------------------------------
+
+    Status _traverseDirectory(const std::filesystem::path& url, const TraversalBlock& block);
+
+    // The entries of one directory; names beginning with "." are left out.
+    Result<std::vector<Item>> urlsForItemsInDirectoryAtURL(const std::filesystem::path& url);
+
+    // lstat-based: a dangling link exists.
+    bool itemExistsAtURL(const std::filesystem::path& url);
+    bool itemDoesNotExistAtURL(const std::filesystem::path& url);
+
+    // Writes the tree to the log; changes nothing.
+    void printDirectoryStructureAtURL(const std::filesystem::path& url);
+
+    // --- Containment ----------------------------------------------------------
+
+    // The real location of `suspicious` if it lies inside `base`, else nothing.
+    std::optional<std::filesystem::path> realPathForURL(const std::filesystem::path& suspicious,
+                                                        const std::filesystem::path& base);
+    // Depth walk over a link target: the ending depth, or nothing when the
+    // running depth falls below `startingDepth`.
+    std::optional<int> _validateSymlink(std::string_view path, int startingDepth);
+    std::optional<std::filesystem::path> _realPathForURL(const std::filesystem::path& url,
+                                                         bool allowNonExistentPathComponents);
+    std::optional<std::filesystem::path>
+    _realPathWhatExistsInPath(const std::filesystem::path& url);
+
+    // --- ACLs and ownership ---------------------------------------------------
+
+    Status setTopLevelSystemContainerACLAtURL(const std::filesystem::path& url);
+    Status standardizeACLsAtURL(const std::filesystem::path& url, bool isSystemContainer);
+    Status standardizeACLsForSystemContainerAtURL(const std::filesystem::path& url);
+    Status standardizeAllSystemContainerACLsAtURL(const std::filesystem::path& url);
+    Status standardizeOwnershipAtURL(const std::filesystem::path& url, uid_t uid, gid_t gid);
+
+    // --- Data protection --------------------------------------------------------
+
+    Result<int> dataProtectionClassOfItemAtURL(const std::filesystem::path& url);
+    // With a predicate, the current class is read first and nothing changes
+    // (successfully) when the predicate answers false.
+    Status setDataProtectionClassOfItemAtURL(const std::filesystem::path& url, int protectionClass,
+                                             std::function<bool(int)> predicate = nullptr);
+
+    // --- Disk usage (bytes; negative on failure) -------------------------------
+
+    std::int64_t fastDiskUsageForURL(const std::filesystem::path& url);
+    std::int64_t diskUsageForURL(const std::filesystem::path& url);
+
+    // --- Accounts ---------------------------------------------------------------
+
+    // The user's home directory, real path; "/private/var/mobile" below the
+    // root when the user is unknown.
+    static std::filesystem::path homeDirectoryURLForPOSIXUID(uid_t uid);
+
+private:
+    QRNDaemonContext* context_;
+    std::shared_ptr<Env> env_;
+};
+
+} // namespace quarn

@@ -1,0 +1,22 @@
+#pragma once
+// Helpers shared by the file manager tests: building small trees and reading
+// back what the file manager left on disk.
+
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace quarn::test {
+
+void writeFile(const std::filesystem::path& path, std::string_view contents);
+std::string readFile(const std::filesystem::path& path);
+struct stat lstatOf(const std::filesystem::path& path);
+bool existsNoFollow(const std::filesystem::path& path);
+std::optional<std::string> xattrOf(const std::filesystem::path& path, const char* name);
+// The attribute holding the data protection class, as root writes it.
+inline constexpr const char* kProtectionClassAttribute = "trusted.quarn.protection_class";
+
+} // namespace quarn::test
