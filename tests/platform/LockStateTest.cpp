@@ -1,0 +1,172 @@
+#include "Daemon/platform/LinuxLockState.h"
+
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <fstream>
+#include <mutex>
+#include <vector>
+
+using namespace quarn;
+
+namespace {
+
+// Collects the states a watch reports, for tests to wait on.
+class Reports {
+public:
+    LockState::Callback callback() {
+        return [this](std::int32_t state) {
+            std::lock_guard guard(mutex_);
+            states_.push_back(state);
+            changed_.notify_all();
+        };
+    }
+
+    // Waits (generously) until `count` states arrived; returns them all.
+    std::vector<std::int32_t> waitFor(std::size_t count) {
+        std::unique_lock lock(mutex_);
+        changed_.wait_for(lock, std::chrono::seconds(20), [&] { return states_.size() >= count; });
+        return states_;
+    }
+
+    std::vector<std::int32_t> seen() {
+        std::lock_guard guard(mutex_);
+        return states_;
+    }
+
+private:
+    std::mutex mutex_; // guards states_
+    std::condition_variable changed_;
+    std::vector<std::int32_t> states_;
+};
+
+class LockStateTest : public quarn::test::TempRootTest {
+protected:
+    std::filesystem::path runDirectory() const { return Paths(root_.path()).runDirectory(); }
+    std::filesystem::path file() const { return runDirectory() / "lockstate"; }
+
+    void writeInPlace(const std::string& text) const {
+        std::filesystem::create_directories(runDirectory());
+        std::ofstream(file(), std::ios::trunc) << text;
+    }
+    void writeByRename(const std::string& text) const {
+        const auto temp = runDirectory() / "lockstate.new";
+        std::ofstream(temp, std::ios::trunc) << text;
+        std::filesystem::rename(temp, file());
+    }
+};
+
+using V = std::vector<std::int32_t>;
+
+} // namespace
+
+TEST(LockStateParsing, DecimalStatesOnly) {
+    EXPECT_EQ(LinuxLockState::parseState("0"), 0);
+    EXPECT_EQ(LinuxLockState::parseState("1\n"), 1);
+    EXPECT_EQ(LinuxLockState::parseState("  3 \r\n"), 3);
+    EXPECT_EQ(LinuxLockState::parseState("-2"), -2);
+    for (const char* bad : {"", "\n", "locked", "1x", "+1", "0x1", "1 0", "2147483648"}) {
+        EXPECT_FALSE(LinuxLockState::parseState(bad)) << '"' << bad << '"';
+    }
+}
+
+TEST_F(LockStateTest, StateFollowsTheFile) {
+    auto& lock = root_.context().instance<LockState>();
+    EXPECT_EQ(lock.state(), LockState::kUnlocked); // no file, no run directory
+    EXPECT_FALSE(lock.isLocked());
+
+    writeInPlace("1\n");
+    EXPECT_EQ(lock.state(), LockState::kLocked);
+    EXPECT_TRUE(lock.isLocked());
+
+    writeInPlace("2");
+    EXPECT_EQ(lock.state(), 2);
+    EXPECT_FALSE(lock.isLocked());
+
+    writeInPlace("garbage");
+    EXPECT_EQ(lock.state(), LinuxLockState::kUnreadable);
+    EXPECT_FALSE(lock.isLocked());
+
+    // A link planted in place of the file is not believed.
+    std::filesystem::remove(file());
+    root_.writeFile("/elsewhere", "1");
+    std::filesystem::create_symlink(root_ / "/elsewhere", file());
+    EXPECT_EQ(lock.state(), LinuxLockState::kUnreadable);
+}
+
+TEST_F(LockStateTest, WatchSeesWritesRenamesAndRemoval) {
+    LinuxLockState lock{Paths(root_.path())};
+    Reports reports;
+    ASSERT_TRUE(lock.startWatching(reports.callback())); // makes the run directory
+
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(1), V{1});
+    writeInPlace("1"); // no change: not reported
+    root_.writeFile("/private/var/run/quarnd/unrelated", "0");
+    writeByRename("0");
+    EXPECT_EQ(reports.waitFor(2), (V{1, 0}));
+    writeByRename("2");
+    EXPECT_EQ(reports.waitFor(3), (V{1, 0, 2}));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(4), (V{1, 0, 2, 1}));
+    std::filesystem::remove(file());
+    EXPECT_EQ(reports.waitFor(5), (V{1, 0, 2, 1, 0}));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(6), (V{1, 0, 2, 1, 0, 1}));
+    std::filesystem::rename(file(), runDirectory() / "moved-away");
+    EXPECT_EQ(reports.waitFor(7), (V{1, 0, 2, 1, 0, 1, 0}));
+}
+
+TEST_F(LockStateTest, StoppedWatchesAreSilentAndRestartsWork) {
+    LinuxLockState lock{Paths(root_.path())};
+    writeInPlace("1");
+    Reports first;
+    ASSERT_TRUE(lock.startWatching(first.callback()));
+    writeInPlace("0"); // the state at the start (1) is not reported, the change is
+    EXPECT_EQ(first.waitFor(1), V{0});
+
+    Reports second;
+    ASSERT_TRUE(lock.startWatching(second.callback())); // replaces the first watch
+    writeInPlace("1");
+    EXPECT_EQ(second.waitFor(1), V{1});
+    lock.stopWatching();
+    lock.stopWatching(); // twice is harmless
+
+    Reports third;
+    ASSERT_TRUE(lock.startWatching(third.callback()));
+    writeInPlace("0");
+    EXPECT_EQ(third.waitFor(1), V{0});
+    // The earlier watches were joined before their replacement started.
+    EXPECT_EQ(first.seen(), V{0});
+    EXPECT_EQ(second.seen(), V{1});
+}
+
+TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
+    auto lock = std::make_unique<LinuxLockState>(Paths(root_.path()));
+    Reports reports;
+    auto record = reports.callback();
+    ASSERT_TRUE(lock->startWatching([&](std::int32_t state) {
+        lock->stopWatching(); // must neither deadlock nor crash
+        record(state);
+    }));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(1), V{1});
+
+    ASSERT_TRUE(lock->startWatching(reports.callback()));
+    lock.reset(); // with a live watch: the thread must be gone before the object
+    writeInPlace("0");
+    EXPECT_EQ(reports.seen(), V{1});
+}
+
+TEST_F(LockStateTest, LosingTheRunDirectoryReportsUnlocked) {
+    LinuxLockState lock{Paths(root_.path())};
+    writeInPlace("1");
+    Reports reports;
+    ASSERT_TRUE(lock.startWatching(reports.callback()));
+    std::filesystem::remove_all(runDirectory());
+    EXPECT_EQ(reports.waitFor(1), V{0});
+    EXPECT_FALSE(lock.isLocked());
+}
