@@ -46,8 +46,12 @@ TEST_F(AccountsOnTempRoot, FindsTheRootsOwnUsersWithHomesBelowTheRoot) {
     ASSERT_TRUE(byUID);
     EXPECT_EQ(byUID->name, "mobile");
     // uid 0 of the temp root, not of the host.
-    EXPECT_EQ(installed.userByUID(0)->homeDirectory, root_.path() / "private/var/root");
-    EXPECT_EQ(installed.userByName("_installd")->uid, 33u);
+    auto root = installed.userByUID(0);
+    ASSERT_TRUE(root);
+    EXPECT_EQ(root->homeDirectory, root_.path() / "private/var/root");
+    auto installer = installed.userByName("_installd");
+    ASSERT_TRUE(installer);
+    EXPECT_EQ(installer->uid, 33u);
 
     EXPECT_FALSE(installed.userByName("nobody-here"));
     EXPECT_FALSE(installed.userByUID(4242));
