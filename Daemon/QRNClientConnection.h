@@ -1,0 +1,174 @@
+#pragma once
+// One object per request that carries the client's rights and performs the
+// container operations on its behalf; one shared, privileged instance does
+// the daemon's own boot and upcall work.
+//
+// The operations are spread over files by concern:
+// QRNClientConnection.cpp (construction, rights),
+// +Create (create or look up a container), +Lookup (lookup rights and the
+// smaller read operations), +DeathRow (death row, new directory UUIDs),
+// +Complete (running the request's queued commands).
+
+#include "Daemon/QRNClientIdentity.h"
+#include "Daemon/model/QRNContainerIdentity.h"
+#include "Daemon/model/QRNUserIdentity.h"
+#include "Daemon/support/QRNError.h"
+#include "Daemon/support/Value.h"
+
+#include <sys/types.h>
+
+#include <atomic>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace quarn {
+
+class QRNCommandQueue;
+class QRNDaemonContext;
+class QRNMetadata;
+class Queue;
+using QRNMetadataPtr = std::shared_ptr<const QRNMetadata>;
+
+class QRNClientConnection {
+public:
+    using IdentifierSet = std::set<std::string, std::less<>>;
+    using IdentifierSetPtr = std::shared_ptr<const IdentifierSet>;
+
+    // The rights the request layer settled for this client. `lookup` is the
+    // dictionary of the lookup entitlement (or none); `entitledWipeIdentifiers`
+    // the identifiers whose data containers the client may wipe (or none).
+    QRNClientConnection(QRNClientIdentityPtr clientIdentity, bool entitled, bool allowOtherIdLookup,
+                        bool unrestricted, std::optional<Value> lookup,
+                        std::optional<std::vector<std::string>> entitledWipeIdentifiers,
+                        std::shared_ptr<QRNCommandQueue> commandQueue);
+    // The context's privileged connection (anonymous privileged identity,
+    // every right, its own command queue).
+    explicit QRNClientConnection(QRNDaemonContext& context);
+    ~QRNClientConnection();
+    QRNClientConnection(const QRNClientConnection&) = delete;
+    QRNClientConnection& operator=(const QRNClientConnection&) = delete;
+
+    // The current daemon context's privileged connection.
+    static QRNClientConnection& sharedClientConnection();
+    // A privileged connection acting for one user identity.
+    static std::shared_ptr<QRNClientConnection>
+    privilegedClientConnectionWithUserIdentity(QRNUserIdentityPtr userIdentity);
+
+    // --- Rights -----------------------------------------------------------
+
+    const QRNClientIdentityPtr& clientIdentity() const { return clientIdentity_; }
+    // The client's bundle identifier; empty without a client identity.
+    const std::string& clientBundleIdentifier() const;
+    QRNUserIdentityPtr userIdentity() const;
+    bool entitled() const { return entitled_; }
+    bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
+    bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
+    bool unrestricted() const { return unrestricted_; }
+    const std::optional<Value>& lookup() const { return lookup_; }
+    const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const {
+        return entitledWipeIdentifiers_;
+    }
+    const std::shared_ptr<QRNCommandQueue>& commandQueue() const { return commandQueue_; }
+
+    void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
+    void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
+    void setUnrestricted(bool unrestricted) { unrestricted_ = unrestricted; }
+
+    // Whether the lookup entitlement lists `identifier` for the class.
+    bool isEntitledForLookupWithClass(std::uint64_t containerClass, std::string_view identifier);
+    // The identifiers the lookup entitlement grants for the class, made on
+    // first use per class; none for an invalid class or without entitlement.
+    IdentifierSetPtr _lookupForContainerClass(std::uint64_t containerClass);
+    // The string members of an array; anything else gives an empty set.
+    static IdentifierSet _setOfStringsFromArray(const Value& array);
+
+    // --- Create or look up ------------------------------------------------
+
+    // The container's metadata, created on disk when asked and absent.
+    // `existed` (when given) tells whether it was found rather than made now.
+    CodeResult<QRNMetadataPtr>
+    createOrLookupContainerWithContainerIdentity(const QRNContainerIdentityPtr& identity,
+                                                 bool createIfNecessary, bool transient,
+                                                 bool useLocking, bool* existed = nullptr);
+
+    Status _createTopLevelContainerDirectory(const std::filesystem::path& url,
+                                             std::uint64_t containerClass, uid_t owner);
+    CodeResult<void> _createSubDirectories(const std::filesystem::path& containerURL,
+                                           const QRNMetadata& metadata);
+    std::int32_t _dataProtectionClassForContainerMetadata(const QRNMetadata& metadata);
+
+    // --- Death row and directory UUIDs ------------------------------------
+
+    // Moves the item into its own unique directory on death row; a missing
+    // item is success and starts nothing.
+    Status _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
+                                    bool startDeletionThread);
+    // Destroys everything on death row in the background; the completion
+    // (may be empty) hears the pass's error.
+    void
+    deleteContainersOnDeathRowWithCompletion(std::function<void(std::optional<Error>)> completion);
+    Status _removeItemOrMoveToTempAtURL(const std::filesystem::path& url);
+    CodeResult<void>
+    regenerateDirectoryUUIDWithContainerIdentity(const QRNContainerIdentityPtr& identity);
+    void _regenerateAllSystemContainerPaths();
+
+    // Runs the commands queued during the request; may overwrite `error`.
+    bool completeWithError(std::uint64_t& error);
+
+    // Process-wide serial queues: moves into death row, the deletion pass,
+    // other background work.
+    static std::shared_ptr<Queue> _sharedDeathrowQueue();
+    static std::shared_ptr<Queue> _sharedDeathrowBackgroundQueue();
+    static std::shared_ptr<Queue> _sharedBackgroundQueue();
+
+private:
+    struct CreateAttempt;
+
+    CodeResult<QRNMetadataPtr> _createOrLookup(const QRNContainerIdentityPtr& identity,
+                                               bool createIfNecessary, bool transient,
+                                               bool useLocking, bool& existed);
+    CodeResult<void> _checkAccess(const QRNContainerIdentity& identity);
+    CodeResult<void> _checkSystemContainerAccess(const QRNContainerIdentity& identity);
+    CodeResult<QRNMetadataPtr> _lookupUnderReadLock(const QRNContainerIdentityPtr& identity,
+                                                    bool useLocking, bool& existed);
+    CodeResult<QRNMetadataPtr> _lookupUnderWriteLock(const QRNContainerIdentityPtr& identity,
+                                                     bool transient, bool& existed);
+    CodeResult<QRNMetadataPtr> _createContainer(const QRNContainerIdentityPtr& identity,
+                                                bool transient, CreateAttempt& attempt);
+    CodeResult<std::shared_ptr<QRNMetadata>> _buildInStaging(const QRNContainerIdentity& identity,
+                                                             CreateAttempt& attempt);
+    std::optional<std::filesystem::path> _liveURL(const QRNContainerIdentity& identity,
+                                                  bool transient, const std::string& uuidString);
+    void _cleanUpStaging(CreateAttempt& attempt);
+
+    const QRNClientIdentityPtr clientIdentity_;
+    const bool entitled_;
+    // Rights a request may widen while it runs; atomics, since handlers may
+    // read them from the command queue's thread.
+    std::atomic<bool> allowOtherIdLookup_;
+    std::atomic<bool> allowGroupIdLookup_{false};
+    std::atomic<bool> unrestricted_;
+    const std::optional<Value> lookup_;
+    const std::optional<std::vector<std::string>> entitledWipeIdentifiers_;
+    const std::shared_ptr<QRNCommandQueue> commandQueue_;
+    // References to the process-wide queues, kept for the connection's life.
+    std::shared_ptr<Queue> deathrowQueue_;
+    std::shared_ptr<Queue> deathrowBackgroundQueue_;
+    std::shared_ptr<Queue> backgroundQueue_;
+
+    // Guards lookupCache_ only.
+    std::mutex lookupCacheMutex_;
+    // Class short name -> identifiers of the lookup entitlement.
+    std::map<std::string, IdentifierSetPtr, std::less<>> lookupCache_;
+};
+
+} // namespace quarn
