@@ -48,3 +48,65 @@ std::optional<std::string> xattrOf(const std::filesystem::path& path, const char
 }
 
 } // namespace quarn::test
+
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+namespace quarn::test {
+
+int setImmutable(const std::filesystem::path& path, bool immutable) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    if (fd < 0) {
+        return errno;
+    }
+    int flags = 0;
+    int err = 0;
+    if (::ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0) {
+        err = errno;
+    } else {
+        flags = immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+        if (::ioctl(fd, FS_IOC_SETFLAGS, &flags) != 0) {
+            err = errno;
+        }
+    }
+    ::close(fd);
+    return err;
+}
+
+long countEntries(const std::filesystem::path& dir) {
+    std::error_code ec;
+    if (!existsNoFollow(dir)) {
+        return -1;
+    }
+    long n = 0;
+    for (auto it = std::filesystem::recursive_directory_iterator(dir, ec);
+         it != std::filesystem::recursive_directory_iterator(); it.increment(ec)) {
+        ++n;
+    }
+    return n;
+}
+
+OtherFileSystemDirectory::OtherFileSystemDirectory() {
+    struct stat shm {};
+    struct stat tmp {};
+    if (::stat("/dev/shm", &shm) != 0 ||
+        ::stat(std::filesystem::temp_directory_path().c_str(), &tmp) != 0 ||
+        shm.st_dev == tmp.st_dev) {
+        return;
+    }
+    std::string tmpl = "/dev/shm/quarn-test.XXXXXX";
+    if (::mkdtemp(tmpl.data())) {
+        path_ = tmpl;
+    }
+}
+
+OtherFileSystemDirectory::~OtherFileSystemDirectory() {
+    if (!path_.empty()) {
+        std::error_code ec;
+        std::filesystem::remove_all(path_, ec);
+    }
+}
+
+} // namespace quarn::test

@@ -20,3 +20,23 @@ std::optional<std::string> xattrOf(const std::filesystem::path& path, const char
 inline constexpr const char* kProtectionClassAttribute = "trusted.quarn.protection_class";
 
 } // namespace quarn::test
+
+namespace quarn::test {
+
+// Sets or clears FS_IMMUTABLE_FL; answers the errno (0 on success).
+int setImmutable(const std::filesystem::path& path, bool immutable);
+// Entries below `dir` (not counting it); -1 when it is missing.
+long countEntries(const std::filesystem::path& dir);
+// A directory on another file system than the temporary roots (tmpfs in
+// /dev/shm), removed at the end of the scope; empty when there is none.
+class OtherFileSystemDirectory {
+public:
+    OtherFileSystemDirectory();
+    ~OtherFileSystemDirectory();
+    const std::filesystem::path& path() const { return path_; }
+
+private:
+    std::filesystem::path path_;
+};
+
+} // namespace quarn::test

@@ -1,0 +1,301 @@
+#include "Daemon/fs/TreeCopier.h"
+
+#include "Daemon/fs/EnvFd.h"
+
+#include <cerrno>
+#include <climits>
+#include <fcntl.h>
+#include <string_view>
+#include <vector>
+
+namespace quarn {
+
+namespace {
+
+constexpr int kReadFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK;
+
+bool isDot(const char* name) {
+    return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
+}
+
+// The destination cannot hold this (kind of) data: not a reason to fail.
+bool unsupported(int err) {
+    return err == ENOTSUP || err == EOPNOTSUPP;
+}
+
+// The call cannot be used between these two files; another way may work.
+bool tryAnotherWay(int err) {
+    return err == EXDEV || err == EINVAL || err == ENOSYS || err == ENOTTY || unsupported(err);
+}
+
+} // namespace
+
+int TreeCopier::copy(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName) {
+    depth0_ = true;
+    madeDestination_ = false;
+    return copyEntry(srcParentFd, srcName, dstParentFd, dstName);
+}
+
+int TreeCopier::copyEntry(int srcParentFd, const char* srcName, int dstParentFd,
+                          const char* dstName) {
+    auto st = env_.fstatat(srcParentFd, srcName, AT_SYMLINK_NOFOLLOW);
+    if (!st) {
+        return st.error();
+    }
+    if (!depth0_ && S_ISDIR(st->st_mode) && st->st_dev == dstRootDev_ &&
+        st->st_ino == dstRootIno_) {
+        return 0; // the copy itself, inside its own source
+    }
+    switch (st->st_mode & S_IFMT) {
+    case S_IFDIR:
+        return copyDirectory(srcParentFd, srcName, dstParentFd, dstName, *st);
+    case S_IFREG:
+        return copyFile(srcParentFd, srcName, dstParentFd, dstName, *st);
+    case S_IFLNK:
+        return copySymlink(srcParentFd, srcName, dstParentFd, dstName, *st);
+    default:
+        return copyNode(dstParentFd, dstName, *st);
+    }
+}
+
+int TreeCopier::copyDirectory(int srcParentFd, const char* srcName, int dstParentFd,
+                              const char* dstName, const struct stat& st) {
+    // Made private first: the real mode comes after the contents.
+    if (auto made = env_.mkdirat(dstParentFd, dstName, 0700); !made) {
+        return made.error();
+    }
+    const bool root = depth0_;
+    madeDestination_ = madeDestination_ || root;
+    depth0_ = false;
+    auto src = env_.openat(srcParentFd, srcName, kReadFlags | O_DIRECTORY);
+    if (!src) {
+        return src.error();
+    }
+    EnvFd srcDir(env_, *src);
+    auto dst = env_.openat(dstParentFd, dstName, kReadFlags | O_DIRECTORY);
+    if (!dst) {
+        return dst.error();
+    }
+    EnvFd dstDir(env_, *dst);
+    if (root) {
+        auto dstStat = env_.fstat(dstDir.get());
+        if (!dstStat) {
+            return dstStat.error();
+        }
+        dstRootDev_ = dstStat->st_dev;
+        dstRootIno_ = dstStat->st_ino;
+    }
+    if (int err = copyChildren(srcDir.get(), dstDir.get())) {
+        return err;
+    }
+    if (int err = copyExtendedAttributes(srcDir.get(), dstDir.get())) {
+        return err;
+    }
+    return applyOwnerModeTimes(dstDir.get(), st);
+}
+
+int TreeCopier::copyChildren(int srcFd, int dstFd) {
+    // A second descriptor for the stream: the first stays usable for
+    // attribute reads after the stream is closed.
+    auto listFd = env_.openat(srcFd, ".", O_RDONLY | O_DIRECTORY);
+    if (!listFd) {
+        return listFd.error();
+    }
+    EnvFd list(env_, *listFd);
+    if (auto stream = list.openDirectoryStream(); !stream) {
+        return stream.error();
+    }
+    for (;;) {
+        auto entry = env_.readdir(list.dir());
+        if (!entry) {
+            return entry.error();
+        }
+        if (*entry == nullptr) {
+            break;
+        }
+        const char* name = (*entry)->d_name;
+        if (isDot(name)) {
+            continue;
+        }
+        if (int err = copyEntry(srcFd, name, dstFd, name)) {
+            return err;
+        }
+    }
+    auto closed = list.close();
+    return closed ? 0 : closed.error();
+}
+
+int TreeCopier::copyFile(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,
+                         const struct stat& st) {
+    auto src = env_.openat(srcParentFd, srcName, kReadFlags);
+    if (!src) {
+        return src.error();
+    }
+    EnvFd srcFile(env_, *src);
+    auto dst = env_.openat(dstParentFd, dstName, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW,
+                           S_IRUSR | S_IWUSR);
+    if (!dst) {
+        return dst.error();
+    }
+    madeDestination_ = madeDestination_ || depth0_;
+    depth0_ = false;
+    EnvFd dstFile(env_, *dst);
+    if (st.st_size > 0) {
+        if (int err = copyData(srcFile.get(), dstFile.get())) {
+            return err;
+        }
+    }
+    if (int err = copyExtendedAttributes(srcFile.get(), dstFile.get())) {
+        return err;
+    }
+    if (int err = applyOwnerModeTimes(dstFile.get(), st)) {
+        return err;
+    }
+    auto closed = dstFile.close(); // a delayed write error shows here
+    return closed ? 0 : closed.error();
+}
+
+int TreeCopier::copyData(int srcFd, int dstFd) {
+    if (cloneWorks_) {
+        auto cloned = env_.cloneFile(dstFd, srcFd);
+        if (cloned) {
+            return 0;
+        }
+        if (!tryAnotherWay(cloned.error())) {
+            return cloned.error();
+        }
+        cloneWorks_ = false;
+    }
+    if (copyRangeWorks_) {
+        bool first = true;
+        for (;;) {
+            auto copied = env_.copyFileRange(srcFd, dstFd, std::size_t{1} << 30);
+            if (copied && *copied == 0) {
+                return 0;
+            }
+            if (!copied) {
+                if (!first || !tryAnotherWay(copied.error())) {
+                    return copied.error();
+                }
+                copyRangeWorks_ = false;
+                break;
+            }
+            first = false;
+        }
+    }
+    return copyByReading(srcFd, dstFd);
+}
+
+int TreeCopier::copyByReading(int srcFd, int dstFd) {
+    std::vector<char> buffer(std::size_t{1} << 20);
+    for (;;) {
+        auto n = env_.read(srcFd, buffer.data(), buffer.size());
+        if (!n) {
+            return n.error();
+        }
+        if (*n == 0) {
+            return 0;
+        }
+        std::size_t done = 0;
+        while (done < *n) {
+            auto written = env_.write(dstFd, buffer.data() + done, *n - done);
+            if (!written) {
+                return written.error();
+            }
+            done += *written;
+        }
+    }
+}
+
+int TreeCopier::copySymlink(int srcParentFd, const char* srcName, int dstParentFd,
+                            const char* dstName, const struct stat& st) {
+    auto target = env_.readlinkat(srcParentFd, srcName, PATH_MAX);
+    if (!target) {
+        return target.error();
+    }
+    if (auto made = env_.symlinkat(target->c_str(), dstParentFd, dstName); !made) {
+        return made.error();
+    }
+    madeDestination_ = madeDestination_ || depth0_;
+    depth0_ = false;
+    // Links carry no mode of their own on Linux; owner and times they do.
+    if (auto owned = env_.fchownat(dstParentFd, dstName, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW);
+        !owned) {
+        return owned.error();
+    }
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    auto timed = env_.utimensat(dstParentFd, dstName, times, AT_SYMLINK_NOFOLLOW);
+    return timed ? 0 : timed.error();
+}
+
+int TreeCopier::copyNode(int dstParentFd, const char* dstName, const struct stat& st) {
+    // Fifos, sockets and devices: made anew, never opened (that could block
+    // or act on a device).
+    if (auto made = env_.mknodat(dstParentFd, dstName, st.st_mode & (S_IFMT | 07777), st.st_rdev);
+        !made) {
+        return made.error();
+    }
+    madeDestination_ = madeDestination_ || depth0_;
+    depth0_ = false;
+    if (auto owned = env_.fchownat(dstParentFd, dstName, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW);
+        !owned) {
+        return owned.error();
+    }
+    if (auto moded = env_.fchmodat(dstParentFd, dstName, st.st_mode & 07777, 0); !moded) {
+        return moded.error();
+    }
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    auto timed = env_.utimensat(dstParentFd, dstName, times, AT_SYMLINK_NOFOLLOW);
+    return timed ? 0 : timed.error();
+}
+
+int TreeCopier::copyExtendedAttributes(int srcFd, int dstFd) {
+    auto size = env_.flistxattr(srcFd, nullptr, 0);
+    if (!size) {
+        return unsupported(size.error()) ? 0 : size.error();
+    }
+    if (*size == 0) {
+        return 0;
+    }
+    std::vector<char> names(*size);
+    auto listed = env_.flistxattr(srcFd, names.data(), names.size());
+    if (!listed) {
+        return listed.error();
+    }
+    for (std::size_t at = 0; at < *listed;) {
+        const char* name = names.data() + at;
+        at += std::string_view(name).size() + 1;
+        if (int err = copyAttribute(srcFd, dstFd, name)) {
+            return err;
+        }
+    }
+    return 0;
+}
+
+int TreeCopier::copyAttribute(int srcFd, int dstFd, const char* name) {
+    auto size = env_.fgetxattr(srcFd, name, nullptr, 0);
+    if (!size) {
+        return size.error() == ENODATA ? 0 : size.error(); // removed meanwhile
+    }
+    std::vector<char> value(*size);
+    auto got = env_.fgetxattr(srcFd, name, value.data(), value.size());
+    if (!got) {
+        return got.error();
+    }
+    auto set = env_.fsetxattr(dstFd, name, value.data(), *got, 0);
+    return !set && !unsupported(set.error()) ? set.error() : 0;
+}
+
+int TreeCopier::applyOwnerModeTimes(int dstFd, const struct stat& st) {
+    if (auto owned = env_.fchown(dstFd, st.st_uid, st.st_gid); !owned) {
+        return owned.error();
+    }
+    if (auto moded = env_.fchmod(dstFd, st.st_mode & 07777); !moded) {
+        return moded.error();
+    }
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    auto timed = env_.futimens(dstFd, times);
+    return timed ? 0 : timed.error();
+}
+
+} // namespace quarn
