@@ -1,10 +1,13 @@
 #include "Daemon/platform/LinuxPlatform.h"
 
+#include "Daemon/platform/ContainerLibrary.h"
 #include "Daemon/platform/LinuxAccounts.h"
 #include "Daemon/platform/LinuxHostConfig.h"
 #include "Daemon/platform/LinuxLockState.h"
+#include "Daemon/platform/LinuxNotifications.h"
 #include "Daemon/platform/LinuxOsVariant.h"
 #include "Daemon/platform/Paths.h"
+#include "Daemon/platform/SandboxKernel.h"
 #include "Daemon/support/QRNDaemonContext.h"
 
 #include <memory>
@@ -18,6 +21,9 @@ void installLinuxPlatform(QRNDaemonContext& context) {
     context.install<OsVariant>(std::make_shared<LinuxOsVariant>(paths));
     context.install<HostConfig>(std::make_shared<LinuxHostConfig>(paths));
     context.install<LockState>(std::make_shared<LinuxLockState>(paths));
+    context.install<ContainerLibrary>(std::make_shared<LinuxContainerLibrary>());
+    context.install<SandboxKernel>(std::make_shared<InMemorySandboxKernel>());
+    context.install<Notifications>(std::make_shared<LinuxNotifications>(paths));
 }
 
 } // namespace quarn

@@ -1,0 +1,163 @@
+#include "Daemon/platform/LinuxNotifications.h"
+
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <string>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <thread>
+#include <unistd.h>
+#include <vector>
+
+using namespace quarn;
+
+namespace {
+
+std::vector<std::string> linesOf(const std::filesystem::path& file) {
+    std::ifstream in(file);
+    std::vector<std::string> lines;
+    for (std::string line; std::getline(in, line);) {
+        lines.push_back(line);
+    }
+    return lines;
+}
+
+class NotificationsTest : public quarn::test::TempRootTest {
+protected:
+    LinuxNotifications notifications_{Paths(root_.path())};
+    std::filesystem::path fileFor(std::string_view name) const {
+        return notifications_.directory() / name;
+    }
+};
+
+TEST_F(NotificationsTest, PostsAppendOneTimestampedLinePerPostInAFileNamedAfterTheNotification) {
+    const auto name = Notifications::kUserInvalidated;
+    ASSERT_FALSE(std::filesystem::exists(Paths(root_.path()).runDirectory()));
+
+    ASSERT_TRUE(notifications_.post(name));
+    ASSERT_TRUE(notifications_.post(name));
+    ASSERT_TRUE(notifications_.post(Notifications::kCleanupComplete));
+
+    EXPECT_EQ(notifications_.directory(), root_ / "/private/var/run/quarnd/notifications");
+    const auto lines = linesOf(fileFor(name));
+    ASSERT_EQ(lines.size(), 2u);
+    for (const auto& line : lines) {
+        // "YYYY-MM-DDTHH:MM:SS.ffffffZ name"
+        ASSERT_GT(line.size(), 28u);
+        EXPECT_EQ(line[4], '-');
+        EXPECT_EQ(line[10], 'T');
+        EXPECT_EQ(line[19], '.');
+        EXPECT_EQ(line.substr(26, 2), "Z ");
+        EXPECT_EQ(line.substr(28), name);
+    }
+    EXPECT_EQ(linesOf(fileFor(Notifications::kCleanupComplete)).size(), 1u);
+}
+
+TEST_F(NotificationsTest, NamesThatAreNoPlainFileNamesAreRefused) {
+    for (std::string_view bad :
+         {"", ".hidden", "..", "a/b", "../../etc/passwd", "name with space", "new\nline"}) {
+        auto posted = notifications_.post(bad);
+        ASSERT_FALSE(posted) << bad;
+        EXPECT_TRUE(posted.error().isPOSIX(EINVAL)) << bad;
+    }
+    EXPECT_FALSE(notifications_.post(std::string(Notifications::kMaxNameLength + 1, 'a')));
+    EXPECT_TRUE(notifications_.post(std::string(Notifications::kMaxNameLength, 'a')));
+}
+
+TEST_F(NotificationsTest, PlantedLinksAreNotFollowed) {
+    const auto elsewhere = root_ / "/elsewhere";
+    std::filesystem::create_directories(elsewhere);
+    std::filesystem::create_directories(notifications_.directory().parent_path());
+
+    // The directory itself is a link.
+    std::filesystem::create_directory_symlink(elsewhere, notifications_.directory());
+    EXPECT_FALSE(notifications_.post(Notifications::kCleanupComplete));
+    EXPECT_TRUE(std::filesystem::is_empty(elsewhere));
+
+    // The file is a link to a file the daemon must not append to.
+    std::filesystem::remove(notifications_.directory());
+    std::filesystem::create_directories(notifications_.directory());
+    root_.writeFile("/elsewhere/victim", "untouched\n");
+    std::filesystem::create_symlink(elsewhere / "victim", fileFor(Notifications::kCleanupComplete));
+    auto posted = notifications_.post(Notifications::kCleanupComplete);
+    ASSERT_FALSE(posted);
+    EXPECT_TRUE(posted.error().isPOSIX(ELOOP));
+    EXPECT_EQ(linesOf(elsewhere / "victim"), std::vector<std::string>{"untouched"});
+}
+
+TEST_F(NotificationsTest, ConcurrentPostsNeverInterleave) {
+    constexpr int kThreads = 4;
+    constexpr int kPosts = 50;
+    std::vector<std::thread> threads;
+    for (int t = 0; t < kThreads; ++t) {
+        threads.emplace_back([&] {
+            for (int i = 0; i < kPosts; ++i) {
+                EXPECT_TRUE(notifications_.post(Notifications::kRebootCleanupComplete));
+            }
+        });
+    }
+    for (auto& thread : threads) {
+        thread.join();
+    }
+    const auto lines = linesOf(fileFor(Notifications::kRebootCleanupComplete));
+    ASSERT_EQ(lines.size(), static_cast<std::size_t>(kThreads * kPosts));
+    for (const auto& line : lines) {
+        EXPECT_EQ(line.substr(line.find(' ') + 1), Notifications::kRebootCleanupComplete);
+    }
+}
+
+// Stands in for the service manager: a datagram socket named by
+// NOTIFY_SOCKET for the duration of the test.
+class FakeServiceManager {
+public:
+    FakeServiceManager() {
+        path_ =
+            std::filesystem::temp_directory_path() / ("quarn-notify." + std::to_string(getpid()));
+        fd_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        sockaddr_un addr{};
+        addr.sun_family = AF_UNIX;
+        std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path_.c_str());
+        std::filesystem::remove(path_);
+        bound_ = ::bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+        ::setenv("NOTIFY_SOCKET", path_.c_str(), 1);
+    }
+    ~FakeServiceManager() {
+        ::unsetenv("NOTIFY_SOCKET");
+        ::close(fd_);
+        std::filesystem::remove(path_);
+    }
+    bool bound() const { return bound_; }
+    std::string receive() {
+        char buffer[512];
+        const ssize_t n = ::recv(fd_, buffer, sizeof buffer, MSG_DONTWAIT);
+        return n > 0 ? std::string(buffer, static_cast<std::size_t>(n)) : std::string();
+    }
+
+private:
+    std::filesystem::path path_;
+    int fd_ = -1;
+    bool bound_ = false;
+};
+
+TEST_F(NotificationsTest, UnderAServiceManagerAPostBecomesTheStatusLine) {
+    FakeServiceManager manager;
+    ASSERT_TRUE(manager.bound());
+    ASSERT_TRUE(notifications_.post(Notifications::kUserInvalidated));
+    EXPECT_EQ(manager.receive(), "STATUS=Posted com.orvex.quarnd.user-invalidated");
+
+    // A refused post tells the manager nothing.
+    EXPECT_FALSE(notifications_.post("a/b"));
+    EXPECT_EQ(manager.receive(), "");
+}
+
+TEST_F(NotificationsTest, ThePlatformInstallsTheFileBackedPoster) {
+    auto& installed = root_.context().instance<Notifications>();
+    ASSERT_TRUE(installed.post(Notifications::kUserInvalidated));
+    EXPECT_EQ(linesOf(fileFor(Notifications::kUserInvalidated)).size(), 1u);
+}
+
+} // namespace
