@@ -2,12 +2,12 @@
 
 #include "Daemon/fs/EnvFd.h"
 #include "Daemon/fs/QRNFileManager.h"
+#include "Daemon/support/ProtectionClassAttribute.h"
 
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
 #include <string>
-#include <unistd.h>
 
 namespace quarn {
 
@@ -60,14 +60,15 @@ int existingDirectoryError(Env& env, const std::filesystem::path& url) {
     return S_ISDIR(st->st_mode) ? 0 : ENOTDIR;
 }
 
-// The extended attribute that holds an item's data protection class.
-const char* protectionClassAttributeName() {
-    return geteuid() == 0 ? "trusted.quarn.protection_class" : "user.quarn.protection_class";
-}
-
+// Written through the Env (not the attribute helper's own call) so that
+// fault injection reaches it; same attribute and decimal text.
 SysStatus setProtectionClassOfDirectory(Env& env, int fd, int protectionClass) {
+    if (protectionClass < 0) {
+        return SysError(EINVAL);
+    }
     const std::string value = std::to_string(protectionClass);
-    return env.fsetxattr(fd, protectionClassAttributeName(), value.data(), value.size(), 0);
+    return env.fsetxattr(fd, ProtectionClassAttribute::attributeName(), value.data(), value.size(),
+                         0);
 }
 
 } // namespace

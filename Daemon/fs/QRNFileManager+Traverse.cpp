@@ -4,6 +4,7 @@
 #include "Daemon/fs/TreeWalker.h"
 #include "Daemon/platform/Accounts.h"
 #include "Daemon/support/QRNDaemonContext.h"
+#include "Daemon/support/Signpost.h"
 
 #include <cstring>
 #include <map>
@@ -12,6 +13,7 @@ namespace quarn {
 
 Status QRNFileManager::_traverseDirectory(const std::filesystem::path& url,
                                           const TraversalBlock& block) {
+    Signpost signpost(LogCategory::Fs, "TraversingDirectory", url.string());
     std::optional<Error> blockError;
     TreeWalker walker(*env_);
     auto failure = walker.walk(url, [&](const TraversalEntry& entry) {
@@ -22,6 +24,7 @@ Status QRNFileManager::_traverseDirectory(const std::filesystem::path& url,
         }
         return true;
     });
+    signpost.end(fmt::format("{} nodes", walker.nodeCount()));
     if (blockError) {
         return QRN_UNEXPECTED(*blockError);
     }
