@@ -1,0 +1,77 @@
+#pragma once
+// The metadata file at the root of every container: whose it is, its
+// identifier, class, UUID and free-form info. The container cache is
+// rebuilt from these files, and every operation that finds a container on
+// disk validates its metadata before trusting it.
+
+#include "Daemon/model/QRNConcreteContainerIdentity.h"
+#include "Daemon/support/QRNError.h"
+#include "Daemon/support/Value.h"
+
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace quarn {
+
+class QRNMetadata;
+using QRNMetadataPtr = std::shared_ptr<const QRNMetadata>;
+
+class QRNMetadata {
+public:
+    static constexpr std::string_view kFileName = ".com.orvex.quarn_store.metadata.plist";
+    static constexpr std::string_view kIdentifierKey = "QRNMetadataIdentifier";
+    static constexpr std::string_view kUUIDKey = "QRNMetadataUUID";
+    static constexpr std::string_view kContentClassKey = "QRNMetadataContentClass";
+    static constexpr std::string_view kUserIdentityKey = "QRNMetadataUserIdentity";
+    static constexpr std::string_view kInfoKey = "QRNMetadataInfo";
+    static constexpr std::string_view kUserManagedAssetsDirNameKey =
+        "QRNMetadataUserManagedAssetsDirName";
+    static constexpr std::string_view kVersionKey = "QRNMetadataVersion";
+    // Read only: the owner uid that older files carry.
+    static constexpr std::string_view kLegacyPersonaKey = "QRNMetadataPersona";
+    static constexpr std::string_view kVersion = "2";
+
+    // `info` is a dictionary or none; `url` the container directory.
+    QRNMetadata(QRNConcreteContainerIdentityPtr containerIdentity, Value info,
+                std::filesystem::path url, std::optional<std::string> userManagedAssetsDirName);
+
+    // Writes the file at `url` (the metadata file's own URL) through a
+    // temporary file in the staging directory of the record's user and
+    // class, moved over the final file. Code 34 on failure; the old file
+    // is then left as it was.
+    Status writeMetadataToFileURL(const std::filesystem::path& url) const;
+
+    // Reads and validates the metadata file at `url` against the identity
+    // the caller expects. With `checkClassPath` the container must also lie
+    // in the class directory the layout gives. Code 12 (unreadable) or 29
+    // (invalid content).
+    static CodeResult<QRNMetadataPtr>
+    readAndValidateMetadataAtFileUrl(const std::filesystem::path& url,
+                                     const QRNUserIdentityPtr& userIdentity, bool checkClassPath);
+
+    const QRNConcreteContainerIdentityPtr& containerIdentity() const { return containerIdentity_; }
+    const QRNUserIdentityPtr& userIdentity() const { return containerIdentity_->userIdentity(); }
+    const UUID& uuid() const { return containerIdentity_->uuid(); }
+    std::uint64_t containerClass() const { return containerIdentity_->containerClass(); }
+    const std::string& identifier() const { return containerIdentity_->identifier(); }
+    const Value& info() const { return info_; }
+    const std::filesystem::path& url() const { return url_; }
+    const std::optional<std::string>& userManagedAssetsDirName() const {
+        return userManagedAssetsDirName_;
+    }
+
+    // The dictionary the file holds.
+    Value dictionary() const;
+    std::string description() const;
+
+private:
+    QRNConcreteContainerIdentityPtr containerIdentity_;
+    Value info_;
+    std::filesystem::path url_;
+    std::optional<std::string> userManagedAssetsDirName_;
+};
+
+} // namespace quarn

@@ -1,0 +1,314 @@
+#include "Daemon/model/QRNMetadata.h"
+#include "Daemon/model/QRNGlobalConfiguration.h"
+#include "Daemon/model/QRNUserIdentitySharedCache.h"
+#include "Daemon/support/PropertyList.h"
+#include "common/LogCapture.h"
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+#include <plist/plist.h>
+
+#include <sys/xattr.h>
+
+#include <fstream>
+#include <iterator>
+
+using namespace quarn;
+using quarn::test::LogCapture;
+
+namespace {
+
+std::vector<char> bytesOf(const std::filesystem::path& p) {
+    std::ifstream in(p, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+class QRNMetadataTest : public quarn::test::TempRootTest {
+protected:
+    QRNGlobalConfiguration& config() { return QRNGlobalConfiguration::sharedInstance(); }
+    QRNUserIdentityPtr mobile() { return QRNUserIdentitySharedCache::defaultUserIdentity(); }
+    QRNUserIdentityPtr user(std::uint32_t uid) {
+        return QRNUserIdentity::initWithUID(uid, uid, root_ / "/private/var/mobile", std::nullopt,
+                                            kQRNPersonaTypePersonal, uid);
+    }
+    // A container directory of the class where the layout puts it.
+    std::filesystem::path containerDir(const QRNUserIdentityPtr& u, std::uint64_t cls,
+                                       const UUID& uuid) {
+        auto dir = *config().containerDirectoryURLForUserIdentity(u, cls, false) / uuid.string();
+        std::filesystem::create_directories(dir);
+        return dir;
+    }
+    QRNMetadata record(const QRNUserIdentityPtr& u, std::uint64_t cls, const UUID& uuid,
+                       const std::filesystem::path& dir, Value info = Value(),
+                       std::optional<std::string> assets = std::nullopt) {
+        auto identity = *QRNConcreteContainerIdentity::containerIdentityWithUUID(
+            uuid, u, "com.example.app", cls);
+        return QRNMetadata(identity, std::move(info), dir, std::move(assets));
+    }
+    // A valid file for `u`'s app data container, rewritten with `edit` applied.
+    std::filesystem::path fileWith(const QRNUserIdentityPtr& u,
+                                   const std::function<void(Value&)>& edit) {
+        const UUID uuid = UUID::random();
+        auto dir = containerDir(u, 2, uuid);
+        Value dict = record(u, 2, uuid, dir).dictionary();
+        edit(dict);
+        auto url = dir / QRNMetadata::kFileName;
+        EXPECT_TRUE(QRN_writeToURL(dict, url));
+        return url;
+    }
+    std::uint64_t failureOf(const std::filesystem::path& url, const QRNUserIdentityPtr& u,
+                            bool checkClassPath = true) {
+        auto r = QRNMetadata::readAndValidateMetadataAtFileUrl(url, u, checkClassPath);
+        EXPECT_FALSE(r);
+        return r ? 0 : r.error();
+    }
+};
+
+} // namespace
+
+TEST_F(QRNMetadataTest, RoundTripThroughABinaryPropertyList) {
+    const UUID uuid = UUID::random();
+    auto dir = containerDir(mobile(), 2, uuid);
+    Value info = Value::dictionary();
+    info.set("Key", "value");
+    auto written = record(mobile(), 2, uuid, dir, info, "Assets");
+    auto url = dir / QRNMetadata::kFileName;
+    ASSERT_TRUE(written.writeMetadataToFileURL(url));
+
+    // Any standard reader opens it: binary, one dictionary of the seven keys.
+    auto bytes = bytesOf(url);
+    ASSERT_GE(bytes.size(), 8u);
+    EXPECT_EQ(std::string(bytes.data(), 8), "bplist00");
+    plist_t node = nullptr;
+    plist_from_bin(bytes.data(), static_cast<std::uint32_t>(bytes.size()), &node);
+    ASSERT_NE(node, nullptr);
+    EXPECT_EQ(plist_get_node_type(node), PLIST_DICT);
+    EXPECT_EQ(plist_dict_get_size(node), 7u);
+    char* version = nullptr;
+    plist_get_string_val(plist_dict_get_item(node, "QRNMetadataVersion"), &version);
+    EXPECT_STREQ(version, "2");
+    free(version);
+    char* uuidString = nullptr;
+    plist_get_string_val(plist_dict_get_item(node, "QRNMetadataUUID"), &uuidString);
+    EXPECT_EQ(std::string(uuidString), uuid.string());
+    free(uuidString);
+    plist_free(node);
+
+    // Readable whatever the lock state; nothing left in staging.
+    char cls[8] = {};
+    EXPECT_EQ(getxattr(url.c_str(), "trusted.quarn.protection_class", cls, sizeof(cls) - 1), 1);
+    EXPECT_STREQ(cls, "4");
+    EXPECT_TRUE(
+        std::filesystem::is_empty(*config().stagingDirectoryURLForUserIdentity(mobile(), 2)));
+
+    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), true);
+    ASSERT_TRUE(read);
+    const QRNMetadata& m = **read;
+    EXPECT_EQ(m.uuid(), uuid);
+    EXPECT_EQ(m.identifier(), "com.example.app");
+    EXPECT_EQ(m.containerClass(), 2u);
+    EXPECT_EQ(m.info(), info);
+    EXPECT_EQ(m.userManagedAssetsDirName(), std::optional<std::string>("Assets"));
+    EXPECT_EQ(m.url(), dir);
+    EXPECT_TRUE(m.userIdentity()->isEqual(*mobile()));
+    EXPECT_TRUE(m.containerIdentity()->isEqual(*written.containerIdentity()));
+    EXPECT_EQ(m.dictionary(), written.dictionary());
+}
+
+// The temporary file goes to the staging directory of the record's user and
+// class; a failed write or move reports code 34 and leaves the old file.
+TEST_F(QRNMetadataTest, WriteFailuresKeepTheOldFile) {
+    LogCapture log;
+    const UUID uuid = UUID::random();
+    auto dir = containerDir(mobile(), 7, uuid);
+    auto url = dir / QRNMetadata::kFileName;
+    ASSERT_TRUE(record(mobile(), 7, uuid, dir).writeMetadataToFileURL(url));
+    const auto before = bytesOf(url);
+
+    auto temporary = *config().stagingDirectoryURLForUserIdentity(mobile(), 7) /
+                     ("temp_metadata-" + uuid.string() + ".plist");
+    std::filesystem::create_directories(temporary / "blocker");
+    Value info = Value::dictionary();
+    info.set("changed", true);
+    auto failed = record(mobile(), 7, uuid, dir, info).writeMetadataToFileURL(url);
+    ASSERT_FALSE(failed);
+    EXPECT_TRUE(failed.error().isQRN(kQRNErrorWriteStateFileFailed));
+    EXPECT_TRUE(
+        log.contains("Failed to write metadata dictionary to URL " + temporary.string() + " : "))
+        << log.all();
+    EXPECT_EQ(bytesOf(url), before);
+    std::filesystem::remove_all(temporary);
+
+    // A global class stages in the global staging directory; a missing
+    // destination directory makes the move fail.
+    const UUID other = UUID::random();
+    auto missing = root_ / "/private/var/containers/Bundle/Application/gone";
+    failed = record(mobile(), 1, other, missing).writeMetadataToFileURL(missing / "m.plist");
+    ASSERT_FALSE(failed);
+    EXPECT_TRUE(failed.error().isQRN(kQRNErrorWriteStateFileFailed));
+    const auto globalTemp =
+        config().stagingDirectory() / ("temp_metadata-" + other.string() + ".plist");
+    EXPECT_TRUE(log.contains("Failed to move metadata from staging: " + globalTemp.string() +
+                             " to final: " + (missing / "m.plist").string()));
+    EXPECT_FALSE(std::filesystem::exists(globalTemp));
+}
+
+// Each invalid entry is refused with its own message, in the order the
+// entries are checked.
+TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
+    LogCapture log;
+    struct Case {
+        const char* name;
+        std::function<void(Value&)> edit;
+        const char* message;
+    };
+    Value array = Value::array();
+    array.append("x");
+    const std::vector<Case> cases = {
+        {"identifier", [](Value& d) { d.set("QRNMetadataIdentifier", 5u); },
+         "Invalid metadata Identifier: 5 at "},
+        {"order",
+         [](Value& d) { d.erase("QRNMetadataIdentifier"), d.set("QRNMetadataContentClass", 0u); },
+         "Invalid metadata Identifier: (null) at "},
+        {"uuid type", [](Value& d) { d.erase("QRNMetadataUUID"); },
+         "Invalid metadata UUID String: (null) at "},
+        {"uuid text", [](Value& d) { d.set("QRNMetadataUUID", "not-a-uuid"); },
+         "Invalid metadata UUID: not-a-uuid at "},
+        {"class type", [](Value& d) { d.set("QRNMetadataContentClass", "2"); },
+         "Invalid metadata Class: "},
+        {"class 0", [](Value& d) { d.set("QRNMetadataContentClass", 0u); },
+         "Invalid metadata Content Class: 0 at "},
+        {"class 14", [](Value& d) { d.set("QRNMetadataContentClass", 14u); },
+         "Invalid metadata Content Class: 14 at "},
+        {"class negative", [](Value& d) { d.set("QRNMetadataContentClass", -2); },
+         "Invalid metadata Content Class: -2 at "},
+        {"identity type", [](Value& d) { d.set("QRNMetadataUserIdentity", "501"); },
+         "Invalid metadata User Identity: "},
+        {"identity version",
+         [](Value& d) {
+             Value u = *d.get("QRNMetadataUserIdentity");
+             u.set("version", "3");
+             d.set("QRNMetadataUserIdentity", u);
+         },
+         "Could not create user identity from "},
+        {"identity persona type",
+         [](Value& d) {
+             Value u = *d.get("QRNMetadataUserIdentity");
+             u.set("type", 3u);
+             d.set("QRNMetadataUserIdentity", u);
+         },
+         ": 75"},
+        {"identity other user",
+         [](Value& d) {
+             Value u = *d.get("QRNMetadataUserIdentity");
+             u.set("posixUID", 777u);
+             d.set("QRNMetadataUserIdentity", u);
+         },
+         "Incorrect User Identity: "},
+        {"info", [&](Value& d) { d.set("QRNMetadataInfo", array); }, "Invalid metadata Info: "},
+        {"assets", [](Value& d) { d.set("QRNMetadataUserManagedAssetsDirName", 1u); },
+         "Invalid metadata User Managed Dir Name String: 1 at "},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        log.clear();
+        auto url = fileWith(mobile(), c.edit);
+        EXPECT_EQ(failureOf(url, mobile()), kQRNErrorInvalidMetadata);
+        EXPECT_TRUE(log.contains(c.message)) << log.all();
+    }
+}
+
+TEST_F(QRNMetadataTest, UnreadableFilesGiveCode12) {
+    LogCapture log;
+    auto dir = containerDir(mobile(), 2, UUID::random());
+    auto url = dir / QRNMetadata::kFileName;
+    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+    EXPECT_TRUE(log.contains("Failed to read metadata at URL " + url.string()));
+
+    Value array = Value::array();
+    array.append("x");
+    ASSERT_TRUE(binaryPropertyList(array));
+    auto bytes = *binaryPropertyList(array);
+    std::ofstream(url, std::ios::binary)
+        .write(reinterpret_cast<const char*>(bytes.data()),
+               static_cast<std::streamsize>(bytes.size()));
+    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+
+    std::ofstream(url, std::ios::binary | std::ios::trunc) << "bplist00 and then garbage";
+    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+}
+
+// A file without a stored identity belongs to whoever the caller expects;
+// one with a stored identity must match.
+TEST_F(QRNMetadataTest, UserIdentityFromFileOrCaller) {
+    auto other = user(600);
+    auto url = fileWith(other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); });
+    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, other, true);
+    ASSERT_TRUE(read);
+    EXPECT_EQ((*read)->userIdentity(), other);
+    EXPECT_EQ((*read)->containerIdentity()->userIdentity(), other);
+
+    auto mobileFile = fileWith(mobile(), [](Value&) {});
+    EXPECT_EQ(failureOf(mobileFile, other, false), kQRNErrorInvalidMetadata);
+}
+
+// The legacy owner entry is checked against the expected identity's owner
+// for the class, except for the default identity.
+TEST_F(QRNMetadataTest, LegacyOwnerEntry) {
+    LogCapture log;
+    auto other = user(600);
+    auto good = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", 600u); });
+    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(good, other, true));
+    auto bad = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", 601u); });
+    EXPECT_EQ(failureOf(bad, other), kQRNErrorInvalidMetadata);
+    EXPECT_TRUE(log.contains("Incorrect UserId: 601, expecting: 600 for com.example.app at "))
+        << log.all();
+    auto notNumber = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", "600"); });
+    EXPECT_EQ(failureOf(notNumber, other), kQRNErrorInvalidMetadata);
+
+    auto renumbered = fileWith(mobile(), [](Value& d) { d.set("QRNMetadataPersona", 999u); });
+    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(renumbered, mobile(), true));
+}
+
+TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
+    LogCapture log;
+    const UUID uuid = UUID::random();
+    // An app data container that sits in the app group directory.
+    auto dir = containerDir(mobile(), 7, uuid);
+    auto url = dir / QRNMetadata::kFileName;
+    ASSERT_TRUE(record(mobile(), 2, uuid, dir).writeMetadataToFileURL(url));
+    EXPECT_EQ(failureOf(url, mobile(), true), kQRNErrorInvalidMetadata);
+    EXPECT_TRUE(
+        log.contains("Invalid metadata-URLs should match: " + dir.parent_path().string() + " : " +
+                     (*config().containerDirectoryURLForUserIdentity(mobile(), 2, false)).string()))
+        << log.all();
+    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), false));
+
+    // Global classes are checked against the shared containers directory.
+    const UUID bundleUUID = UUID::random();
+    auto bundleDir = containerDir(mobile(), 1, bundleUUID);
+    ASSERT_TRUE(record(mobile(), 1, bundleUUID, bundleDir)
+                    .writeMetadataToFileURL(bundleDir / QRNMetadata::kFileName));
+    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(bundleDir / QRNMetadata::kFileName,
+                                                              mobile(), true));
+}
+
+TEST_F(QRNMetadataTest, XMLFilesAreRead) {
+    const UUID uuid = UUID::random();
+    auto dir = containerDir(mobile(), 12, uuid);
+    std::ofstream(dir / QRNMetadata::kFileName) << R"(<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+<key>QRNMetadataIdentifier</key><string>com.orvex.devicesettings</string>
+<key>QRNMetadataUUID</key><string>)" << uuid.string()
+                                                << R"(</string>
+<key>QRNMetadataContentClass</key><integer>12</integer>
+<key>QRNMetadataPersona</key><integer>0</integer>
+</dict></plist>)";
+    auto read =
+        QRNMetadata::readAndValidateMetadataAtFileUrl(dir / QRNMetadata::kFileName, mobile(), true);
+    ASSERT_TRUE(read);
+    EXPECT_EQ((*read)->identifier(), "com.orvex.devicesettings");
+    EXPECT_EQ((*read)->containerClass(), 12u);
+    EXPECT_TRUE((*read)->info().isNone());
+    EXPECT_FALSE((*read)->userManagedAssetsDirName());
+}
