@@ -2,6 +2,7 @@
 
 #include "Daemon/platform/ContainerLibrary.h"
 #include "Daemon/platform/LinuxAccounts.h"
+#include "Daemon/platform/LinuxFeatures.h"
 #include "Daemon/platform/LinuxHostConfig.h"
 #include "Daemon/platform/LinuxLockState.h"
 #include "Daemon/platform/LinuxNotifications.h"
@@ -19,6 +20,7 @@ void installLinuxPlatform(QRNDaemonContext& context) {
     context.install(std::make_shared<Paths>(paths));
     context.install<Accounts>(std::make_shared<LinuxAccounts>(paths));
     context.install<OsVariant>(std::make_shared<LinuxOsVariant>(paths));
+    context.install<Features>(std::make_shared<LinuxFeatures>(paths));
     context.install<HostConfig>(std::make_shared<LinuxHostConfig>(paths));
     context.install<LockState>(std::make_shared<LinuxLockState>(paths));
     context.install<ContainerLibrary>(std::make_shared<LinuxContainerLibrary>());
