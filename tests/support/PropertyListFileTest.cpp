@@ -1,0 +1,142 @@
+#include "Daemon/support/PropertyList.h"
+#include "Daemon/support/ProtectionClassAttribute.h"
+
+#include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <set>
+
+using namespace quarn;
+namespace fs = std::filesystem;
+
+namespace {
+
+class PropertyListFileTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::string tmpl = (fs::temp_directory_path() / "quarn-plist.XXXXXX").string();
+        ASSERT_NE(mkdtemp(tmpl.data()), nullptr);
+        dir_ = tmpl;
+    }
+    void TearDown() override { fs::remove_all(dir_); }
+
+    std::set<std::string> entries() const {
+        std::set<std::string> names;
+        for (const auto& e : fs::directory_iterator(dir_)) {
+            names.insert(e.path().filename().string());
+        }
+        return names;
+    }
+    std::string contents(const fs::path& p) const {
+        std::ifstream in(p, std::ios::binary);
+        return std::string(std::istreambuf_iterator<char>(in), {});
+    }
+    void write(const fs::path& p, std::string_view text) const {
+        std::ofstream(p, std::ios::binary) << text;
+    }
+    static int protectionClassOf(const fs::path& p) {
+        int fd = open(p.c_str(), O_RDONLY | O_CLOEXEC);
+        int cls = ProtectionClassAttribute::getProtectionClass(fd).value_or(-1);
+        close(fd);
+        return cls;
+    }
+
+    fs::path dir_;
+    Value dict_ = Value::Dictionary{{"QRNMetadataVersion", "2"}, {"Class", 2u}};
+};
+
+} // namespace
+
+TEST_F(PropertyListFileTest, AtomicWriteReplacesTheFileAndLeavesNothingBehind) {
+    fs::path file = dir_ / "state.plist";
+    write(file, "old contents");
+    WriteOptions all{.atomic = true, .lowestProtection = true, .fsync = true};
+    ASSERT_TRUE(QRN_writeToURL(dict_, file, all));
+    EXPECT_EQ(entries(), std::set<std::string>{"state.plist"});
+    EXPECT_EQ(contents(file).substr(0, 8), "bplist00");
+    EXPECT_EQ(protectionClassOf(file), ProtectionClassAttribute::kLowestClass);
+    auto back = QRN_dictionaryWithContentsOfURL(file);
+    ASSERT_TRUE(back);
+    EXPECT_EQ(*back, dict_);
+}
+
+TEST_F(PropertyListFileTest, InPlaceWriteKeepsOtherOptions) {
+    fs::path file = dir_ / "metadata.plist";
+    write(file, std::string(10000, 'x')); // longer than the new contents: truncated
+    ASSERT_TRUE(QRN_writeToURL(dict_, file, {.lowestProtection = true}));
+    EXPECT_EQ(QRN_dictionaryWithContentsOfURL(file).value_or(Value()), dict_);
+    EXPECT_EQ(protectionClassOf(file), ProtectionClassAttribute::kLowestClass);
+    ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / "plain.plist"));
+    EXPECT_EQ(protectionClassOf(dir_ / "plain.plist"), ProtectionClassAttribute::kNoClass);
+}
+
+TEST_F(PropertyListFileTest, FailedWritesLeaveTheOldFileAlone) {
+    fs::path file = dir_ / "keep.plist";
+    write(file, "old");
+    Value unwritable = Value::Dictionary{{"bad", std::string("a\0b", 3)}};
+    for (bool atomic : {false, true}) {
+        auto r = QRN_writeToURL(unwritable, file, {.atomic = atomic});
+        ASSERT_FALSE(r);
+        EXPECT_EQ(r.error().code, kGeneralErrorPropertyListWriteInvalid);
+        auto notDictionary = QRN_writeToURL(Value::Array{1u}, file, {.atomic = atomic});
+        ASSERT_FALSE(notDictionary);
+        EXPECT_EQ(contents(file), "old");
+    }
+    // The rename fails onto a directory: the temporary file goes away.
+    fs::create_directories(dir_ / "occupied" / "child");
+    auto r = QRN_writeToURL(dict_, dir_ / "occupied", {.atomic = true});
+    ASSERT_FALSE(r);
+    EXPECT_EQ(r.error().domain, Error::Domain::POSIX);
+    EXPECT_EQ(entries(), (std::set<std::string>{"keep.plist", "occupied"}));
+    // A missing directory is a POSIX error either way.
+    for (bool atomic : {false, true}) {
+        auto missing = QRN_writeToURL(dict_, dir_ / "nowhere" / "f.plist", {.atomic = atomic});
+        ASSERT_FALSE(missing);
+        EXPECT_TRUE(missing.error().isPOSIX(ENOENT)) << missing.error().message;
+    }
+}
+
+TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
+    auto codeOf = [](const Result<Value>& r) {
+        return r ? std::make_pair(Error::Domain::QRN, std::int64_t(0))
+                 : std::make_pair(r.error().domain, r.error().code);
+    };
+    using P = std::pair<Error::Domain, std::int64_t>;
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "missing")),
+              P(Error::Domain::POSIX, ENOENT));
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_)), P(Error::Domain::POSIX, EISDIR));
+
+    ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / "real.plist"));
+    fs::create_symlink(dir_ / "real.plist", dir_ / "link.plist");
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "link.plist")),
+              P(Error::Domain::POSIX, ELOOP));
+    ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0); // must not block
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "fifo")),
+              P(Error::Domain::POSIX, EINVAL));
+
+    write(dir_ / "array.plist", "<plist><array><integer>1</integer></array></plist>");
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "array.plist")),
+              P(Error::Domain::General, kGeneralErrorFileReadCorrupt));
+    for (std::string_view junk : {"", "garbage", "bplist00garbage"}) {
+        write(dir_ / "junk.plist", junk);
+        EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "junk.plist")),
+                  P(Error::Domain::General, kGeneralErrorPropertyListReadCorrupt));
+    }
+    write(dir_ / "xml.plist", "<plist><dict><key>Class</key><integer>2</integer>"
+                              "<key>QRNMetadataVersion</key><string>2</string></dict></plist>");
+    EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / "xml.plist").value_or(Value()), dict_);
+}
+
+TEST(PropertyListPaths, DotDotOnlyAsAWholeComponent) {
+    for (auto p : {"..", "../a", "/a/../b", "a/..", "a//../b", "/.."}) {
+        EXPECT_TRUE(containsDotDotPathComponents(p)) << p;
+    }
+    for (auto p : {"", ".", "/", "a..b", "...", "a/.../b", "..a", "a..", "/a/b/", "./a"}) {
+        EXPECT_FALSE(containsDotDotPathComponents(p)) << p;
+    }
+}
