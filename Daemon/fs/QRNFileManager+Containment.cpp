@@ -39,9 +39,7 @@ bool startsWith(std::string_view text, std::string_view prefix) {
 // The "/private" rule on the device's view of `path`.
 std::string withoutPrivatePrefix(const fs::path& rootPrefix, const std::string& path) {
     const std::string root = rootPrefix == "/" ? std::string() : rootPrefix.string();
-    if (startsWith(path, root) &&
-        startsWith(std::string_view(path).substr(root.size()), kPrivate) &&
-        path.size() > root.size() + kPrivate.size() && path[root.size() + kPrivate.size()] == '/') {
+    if (startsWith(path, root + std::string(kPrivate) + "/")) {
         return root + path.substr(root.size() + kPrivate.size());
     }
     return path;

@@ -19,7 +19,6 @@ namespace fs = std::filesystem;
 class OwnershipTest : public TempRootTest {
 protected:
     void SetUp() override {
-        previousUmask_ = ::umask(0);
         make(tree(), 0700);
         make(tree() / "sub", 0700);
         make(tree() / "sub" / "deeper", 0555);
@@ -31,8 +30,6 @@ protected:
         file(root_ / "/outside", 0600);
         fs::create_symlink(root_ / "/outside", tree() / "sub" / "link");
     }
-    void TearDown() override { ::umask(previousUmask_); }
-
     void make(const fs::path& p, mode_t mode) {
         fs::create_directories(p);
         ::chmod(p.c_str(), mode);
@@ -44,8 +41,6 @@ protected:
     fs::path tree() { return root_ / "/private/var/mobile/Containers/Data/A"; }
     fs::path metadata() { return tree() / ".com.orvex.quarn_store.metadata.plist"; }
     QRNFileManager& manager() { return QRNFileManager::defaultManager(); }
-
-    mode_t previousUmask_ = 0;
 };
 
 TEST_F(OwnershipTest, OwnerAndModeAreForcedOverTheTree) {
