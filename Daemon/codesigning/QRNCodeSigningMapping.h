@@ -1,0 +1,48 @@
+#pragma once
+// Which entitlements, group containers and system containers belong to a
+// code-signing identifier. The current daemon context owns the one instance.
+//
+// This is the mapping as it answers over an empty code-signing database: no
+// identifier has entitlements, a parent or a system container, and there is
+// never anything to register or remove. The database-backed mapping keeps
+// these signatures and fills in the bodies.
+
+#include "Daemon/support/Value.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace quarn {
+
+class QRNCommandQueue;
+class QRNDaemonContext;
+
+class QRNCodeSigningMapping {
+public:
+    explicit QRNCodeSigningMapping(QRNDaemonContext& context);
+    QRNCodeSigningMapping(const QRNCodeSigningMapping&) = delete;
+    QRNCodeSigningMapping& operator=(const QRNCodeSigningMapping&) = delete;
+
+    static QRNCodeSigningMapping& sharedInstance();
+
+    // The "com.orvex.Quarn.Entitlements" dictionary of the identifier's record.
+    std::optional<Value> entitlementsForIdentifier(std::string_view identifier);
+    // Whether the identifier's entitlements grant it a system container.
+    bool identifierHasSystemContainer(std::string_view identifier);
+    std::optional<std::string> parentIdentifierForChildIdentifier(std::string_view identifier);
+    std::vector<std::string> childBundleIdentifiersForParentIdentifier(std::string_view identifier);
+
+    // Both answer a QRNErrorDomain code, 1 meaning success; deletions they
+    // cause are inserted into `commandQueue`.
+    std::uint64_t removeCodeSigningDictionariesForIdentifierAndItsChildren(
+        const std::string& identifier, const std::shared_ptr<QRNCommandQueue>& commandQueue);
+    std::uint64_t
+    processCallerRegisteredEntitlements(const Value& entitlements, const std::string& identifier,
+                                        const std::shared_ptr<QRNCommandQueue>& commandQueue);
+};
+
+} // namespace quarn
