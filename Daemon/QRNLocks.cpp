@@ -2,6 +2,7 @@
 
 #include "Daemon/support/Log.h"
 #include "Daemon/support/QRNDaemonContext.h"
+#include "Daemon/support/Signpost.h"
 
 #include <fmt/format.h>
 
@@ -36,6 +37,15 @@ const char* modeName(bool writing) {
     return writing ? "writing" : "reading";
 }
 
+// The identifier argument of a wait signpost; only built when it is logged.
+std::string waitDetail(const Value& identifier) {
+    if (!Log::isEnabled(spdlog::level::debug)) {
+        return {};
+    }
+    const auto* one = identifier.asString();
+    return fmt::format(" uuid={} ", one ? *one : identifier.description());
+}
+
 } // namespace
 
 // `condition` is evaluated exactly once, also for its side effects.
@@ -51,6 +61,8 @@ struct QRNLocks::LockRecord {
     std::uint64_t users = 1; // guarded by QRNLocks::mutex_
     // Mirrors `lock` (0 free, -1 writer, n readers) to check the bookkeeping.
     std::atomic<std::int32_t> lockState{0};
+    // One interval per hold; guarded by QRNLocks::mutex_.
+    std::vector<Signpost> heldSignposts;
 };
 
 QRNLocks::QRNLocks() = default;
@@ -61,18 +73,24 @@ QRNLocks& QRNLocks::shared() {
 }
 
 void QRNLocks::read_lock_identifier(const Value& identifier) {
+    Signpost waiting(LogCategory::Locking, "WaitingForReadLockWithIdentifier",
+                     waitDetail(identifier));
     _lock_identifier(identifier, false);
 }
 
 void QRNLocks::write_lock_identifier(const Value& identifier) {
+    Signpost waiting(LogCategory::Locking, "WaitingForWriteLockWithIdentifier",
+                     waitDetail(identifier));
     _lock_identifier(identifier, true);
 }
 
 void QRNLocks::read_lock_all_identifiers() {
+    Signpost waiting(LogCategory::Locking, "WaitingForGlobalReadLock");
     _lock_all_identifiers(false);
 }
 
 void QRNLocks::write_lock_all_identifiers() {
+    Signpost waiting(LogCategory::Locking, "WaitingForGlobalWriteLock");
     _lock_all_identifiers(true);
 }
 
@@ -164,6 +182,11 @@ void QRNLocks::take_one_lock(const std::string& identifier, bool writing) {
         QRN_LOCKS_ASSERT(record->lockState.fetch_add(1) >= 0,
                          "atomic_fetch_add(&lockPtr->lockState, 1) >= 0");
     }
+    {
+        Guard guard(mutex_);
+        record->heldSignposts.emplace_back(
+            LogCategory::Locking, writing ? "WriteLockWithIdentifier" : "ReadLockWithIdentifier");
+    }
     QRN_LOG_DEBUG(LogCategory::Locking, "Got lock on identifier {}", identifier);
 }
 
@@ -176,6 +199,9 @@ void QRNLocks::unlock_one_lock(const std::string& identifier) {
     const std::int32_t state = record.lockState.load();
     QRN_LOCKS_ASSERT(state != 0, "atomic_load(&lockPtr->lockState) != 0");
     const bool writeHold = state == -1;
+    if (!record.heldSignposts.empty()) {
+        record.heldSignposts.pop_back(); // ends the hold's interval
+    }
     if (!writeHold) {
         QRN_LOCKS_ASSERT(record.lockState.fetch_sub(1) > 0,
                          "atomic_fetch_sub(&lockPtr->lockState, 1) > 0");
@@ -222,11 +248,13 @@ void QRNLocks::_lock_all_identifiers(bool writing) {
             _lock_wait(guard, allQuiet_);
         }
         allReaderWriterState_ = -1;
+        globalSignposts_.emplace_back(LogCategory::Locking, "GlobalWriteLock");
     } else {
         while (identifierWriterCount_ > 0 || allReaderWriterState_ == -1) {
             _lock_wait(guard, noIdentifierWriter_);
         }
         ++allReaderWriterState_;
+        globalSignposts_.emplace_back(LogCategory::Locking, "GlobalReadLock");
     }
     QRN_LOG_DEBUG(LogCategory::Locking, "Locked all identifiers for {}", modeName(writing));
 }
@@ -234,6 +262,9 @@ void QRNLocks::_lock_all_identifiers(bool writing) {
 void QRNLocks::unlock_all_identifiers() {
     {
         Guard guard(mutex_);
+        if (!globalSignposts_.empty()) {
+            globalSignposts_.pop_back(); // ends the hold's interval
+        }
         if (allReaderWriterState_ != -1) {
             QRN_LOCKS_ASSERT(allReaderWriterState_ > 0, "gQRNLocks.allReaderWriterState > 0");
             --allReaderWriterState_;

@@ -22,6 +22,7 @@
 // is plain bookkeeping and may be released by any thread.
 // Broken bookkeeping (unlocking what is not held) stops the process.
 
+#include "Daemon/support/Signpost.h"
 #include "Daemon/support/Value.h"
 
 #include <atomic>
@@ -132,6 +133,8 @@ private:
     std::uint32_t identifierReaderCount_ QRN_GUARDED_BY(mutex_) = 0;
     std::uint32_t identifierWriterCount_ QRN_GUARDED_BY(mutex_) = 0;
     std::uint64_t conditionWaiters_ QRN_GUARDED_BY(mutex_) = 0;
+    // One interval per global hold.
+    std::vector<Signpost> globalSignposts_ QRN_GUARDED_BY(mutex_);
     std::condition_variable allQuiet_;           // a global writer waits for it
     std::condition_variable noIdentifierWriter_; // global readers wait for it
     std::condition_variable globalFree_;         // identifier writers wait for it

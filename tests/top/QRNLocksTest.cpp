@@ -1,5 +1,6 @@
 #include "Daemon/QRNLocks.h"
 
+#include "common/LogCapture.h"
 #include "common/TempRoot.h"
 
 #include <gtest/gtest.h>
@@ -131,6 +132,32 @@ TEST(QRNLocksIdentifiers, RecordLivesExactlyWhileUsed) {
     EXPECT_EQ(locks.snapshot().records["x"].users, 1u);
     unlock_identifier("x");
     expectIdle(locks);
+}
+
+TEST(QRNLocksIdentifiers, HoldsAreMarkedFromLockToUnlock) {
+    QRNLocks locks;
+    test::LogCapture log;
+    auto marks = [&](std::string_view name, std::string_view phase) {
+        std::size_t n = 0;
+        for (const auto& line : log.messages()) {
+            n += line.starts_with(std::string(name) + " [") && line.find(phase) != line.npos;
+        }
+        return n;
+    };
+    locks.read_lock_identifier("x");
+    locks.read_lock_identifier(ids({"x", "y"}));
+    locks.read_lock_all_identifiers();
+    EXPECT_EQ(marks("ReadLockWithIdentifier", "] begin"), 3u) << log.all();
+    EXPECT_EQ(marks("GlobalReadLock", "] begin"), 1u);
+    EXPECT_EQ(marks("WaitingForReadLockWithIdentifier", "] end"), 2u);
+    EXPECT_TRUE(log.contains("uuid=x")) << log.all();
+    EXPECT_EQ(marks("ReadLockWithIdentifier", "] end"), 0u);
+    locks.unlock_identifier("x");
+    EXPECT_EQ(marks("ReadLockWithIdentifier", "] end"), 1u);
+    locks.unlock_identifier(ids({"x", "y"}));
+    locks.unlock_all_identifiers();
+    EXPECT_EQ(marks("ReadLockWithIdentifier", "] end"), 3u);
+    EXPECT_EQ(marks("GlobalReadLock", "] end"), 1u);
 }
 
 TEST(QRNLocksGlobal, WriterWaitsForIdentifierHoldersAndHoldsOffNewOnes) {
