@@ -110,3 +110,26 @@ OtherFileSystemDirectory::~OtherFileSystemDirectory() {
 }
 
 } // namespace quarn::test
+
+namespace quarn::test {
+
+void makeDeepTree(const std::filesystem::path& top, int depth) {
+    std::filesystem::create_directories(top);
+    int fd = ::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    const std::string name(40, 'n');
+    for (int i = 0; i < depth; ++i) {
+        ASSERT_EQ(::mkdirat(fd, name.c_str(), 0755), 0) << "level " << i;
+        int next = ::openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+        ::close(fd);
+        ASSERT_GE(next, 0);
+        fd = next;
+    }
+    int file = ::openat(fd, "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    ASSERT_GE(file, 0);
+    ASSERT_EQ(::write(file, "deep", 4), 4);
+    ::close(file);
+    ::close(fd);
+}
+
+} // namespace quarn::test

@@ -40,3 +40,11 @@ private:
 };
 
 } // namespace quarn::test
+
+namespace quarn::test {
+
+// A chain of `depth` nested directories with long names and a file at the
+// bottom, made by descriptor: its full path is longer than PATH_MAX.
+void makeDeepTree(const std::filesystem::path& top, int depth);
+
+} // namespace quarn::test

@@ -9,6 +9,8 @@
 #include <gtest/gtest.h>
 
 #include <acl/libacl.h>
+#include <climits>
+#include <fcntl.h>
 #include <random>
 #include <sys/acl.h>
 #include <sys/stat.h>
@@ -233,6 +235,31 @@ TEST_F(MoveCopyTest, FailedCopyRemovesWhatItMade) {
     ASSERT_FALSE(copied);
     EXPECT_FALSE(existsNoFollow(dir() / "dst"));
     EXPECT_TRUE(existsNoFollow(src / "sub" / "small"));
+}
+
+TEST_F(MoveCopyTest, TreesDeeperThanAPathCanBeAreCopiedAndWalked) {
+    makeDeepTree(dir() / "deep", 150);
+    ASSERT_TRUE(manager_->copyItemAtURL(dir() / "deep", dir() / "copy"));
+    int directories = 0;
+    std::string bottom;
+    auto walked = manager_->_traverseDirectory(
+        dir() / "copy", [&](const QRNFileManager::TraversalEntry& entry) -> Status {
+            directories += entry.kind == QRNFileManager::TraversalEntry::Kind::DirectoryPreOrder;
+            if (entry.name == "bottom") {
+                char buffer[8] = {};
+                int fd = ::openat(entry.parentFd, "bottom", O_RDONLY | O_CLOEXEC);
+                EXPECT_EQ(::read(fd, buffer, sizeof buffer), 4);
+                ::close(fd);
+                bottom = buffer;
+                EXPECT_GT(entry.path.string().size(), std::size_t{PATH_MAX});
+            }
+            return {};
+        });
+    ASSERT_TRUE(walked) << walked.error().description();
+    EXPECT_EQ(directories, 151);
+    EXPECT_EQ(bottom, "deep");
+    EXPECT_TRUE(manager_->removeItemAtURL(dir() / "copy"));
+    EXPECT_TRUE(manager_->removeItemAtURL(dir() / "deep"));
 }
 
 TEST_F(MoveCopyTest, CopyIntoItsOwnSubdirectoryEnds) {

@@ -105,6 +105,13 @@ TEST_F(RemoveTest, TenThousandEntriesAreAllRemoved) {
     EXPECT_EQ(env_->count(EnvCall::Unlink), 10101u);
 }
 
+TEST_F(RemoveTest, TreesDeeperThanAPathCanBeAreRemoved) {
+    auto top = dir() / "deep";
+    makeDeepTree(top, 150); // about 6000 characters of path
+    ASSERT_TRUE(manager_->removeItemAtURL(top));
+    EXPECT_FALSE(existsNoFollow(top));
+}
+
 TEST_F(RemoveTest, ImmutableEntriesHaveTheFlagClearedAndAreRemoved) {
     auto top = makeTree();
     fs::create_directories(top / "frozen" / "inner");
