@@ -6,6 +6,10 @@
 //
 // Each call returns its value or the errno it failed with (SysResult). EINTR
 // is retried inside; descriptors are always opened close-on-exec.
+//
+// The file manager takes the Env installed in its daemon context
+// (`context.install<Env>(...)`, before the manager is first used) and the
+// system's own (LinuxEnv) when none is.
 
 #include "Daemon/support/Expected.h"
 
