@@ -36,7 +36,7 @@ inline constexpr std::int64_t kGeneralErrorPropertyListReadCorrupt = 3840;
 inline constexpr std::int64_t kGeneralErrorPropertyListWriteInvalid = 3852;
 
 // Files larger than this are refused (EFBIG) rather than read into memory.
-inline constexpr std::size_t kMaxPropertyListFileSize = 64u << 20;
+inline constexpr std::size_t kMaxPropertyListFileSize = 16u << 20;
 
 struct PropertyListDeleter {
     void operator()(plist_t node) const { plist_free(node); }

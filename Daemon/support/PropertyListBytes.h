@@ -22,7 +22,7 @@ namespace quarn {
 
 struct PropertyListLimits {
     std::size_t maxDepth = 256;        // nested objects, the top one included
-    std::size_t maxObjects = 1u << 20; // objects after expansion (XML: elements)
+    std::size_t maxObjects = 1u << 18; // objects after expansion (XML: elements)
 };
 
 bool isBinaryPropertyList(std::span<const std::uint8_t> bytes);

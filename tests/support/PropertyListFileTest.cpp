@@ -119,6 +119,11 @@ TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
     EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "fifo")),
               P(Error::Domain::POSIX, EINVAL));
 
+    write(dir_ / "huge.plist", ""); // refused by size, before anything is read
+    fs::resize_file(dir_ / "huge.plist", kMaxPropertyListFileSize + 1);
+    EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "huge.plist")),
+              P(Error::Domain::POSIX, EFBIG));
+
     write(dir_ / "array.plist", "<plist><array><integer>1</integer></array></plist>");
     EXPECT_EQ(codeOf(QRN_dictionaryWithContentsOfURL(dir_ / "array.plist")),
               P(Error::Domain::General, kGeneralErrorFileReadCorrupt));
