@@ -1,0 +1,208 @@
+#pragma once
+// The containers on disk, per user and class, so that a lookup need not scan
+// a class directory each time: for each (user, class) an identifier ->
+// validated metadata map, built lazily from the class directory on first use
+// and dropped again when the user identity is invalidated. Permanent and
+// transient containers are kept apart.
+//
+// The cache also keeps the kernel sandbox's container mapping in step with
+// the permanent data and group containers it knows, so processes can be
+// confined to them, and may read that mapping back to answer a lookup
+// without scanning a class directory at all.
+//
+// The code-signing mapping is not an input: nothing here consults it, and it
+// lives in a layer above this one.
+//
+// The operations are spread over files by concern: QRNContainerCache.cpp
+// (lookups, insertion, removal, invalidation), +Build (scanning a class
+// directory), +Sandbox (the kernel sandbox mapping and its read-back).
+
+#include "Daemon/model/QRNContainerIdentity.h"
+#include "Daemon/model/QRNMetadata.h"
+#include "Daemon/model/QRNUserIdentity.h"
+#include "Daemon/platform/SandboxKernel.h"
+#include "Daemon/support/QRNError.h"
+
+#include <atomic>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <unordered_map>
+#include <vector>
+
+namespace quarn {
+
+class Notifications;
+class QRNDaemonContext;
+class QRNFileManager;
+class QRNGlobalConfiguration;
+class QRNUserIdentityCache;
+class QRNWhitelist;
+
+class QRNContainerCache {
+public:
+    using MetadataPtr = std::shared_ptr<const QRNMetadata>;
+    // Runs just before a class directory is scanned, with the cache's lock
+    // held; test facilities use it to hold a rebuild at that point.
+    using RebuildGate = std::function<void(std::uint64_t containerClass)>;
+
+    // With the context's shared user identity cache.
+    explicit QRNContainerCache(QRNDaemonContext& context);
+    QRNContainerCache(QRNDaemonContext& context,
+                      std::shared_ptr<QRNUserIdentityCache> userIdentityCache);
+    ~QRNContainerCache();
+    QRNContainerCache(const QRNContainerCache&) = delete;
+    QRNContainerCache& operator=(const QRNContainerCache&) = delete;
+
+    // The current daemon context's instance.
+    static QRNContainerCache& sharedInstance();
+
+    // "[<user identifier>]-<short name>" for per-user classes, the short name
+    // alone for global ones (one entry shared by every user).
+    static std::string cacheKey(const QRNUserIdentity& userIdentity, std::uint64_t containerClass);
+
+    // The container with the identity's identifier in its user's and class's
+    // entry; for a concrete identity also its UUID. Not found: code 21.
+    // `updateSandbox` makes sure every permanent container of the entry is
+    // in the kernel sandbox mapping; `allowKernelLookup` lets a lookup whose
+    // entry is not built yet be answered from that mapping.
+    Result<MetadataPtr> containerForContainerIdentity(const QRNContainerIdentityPtr& identity,
+                                                      bool transient = false,
+                                                      bool updateSandbox = false,
+                                                      bool allowKernelLookup = false);
+
+    Result<std::vector<MetadataPtr>>
+    allContainersForUserIdentity(const QRNUserIdentityPtr& userIdentity, std::uint64_t contentClass,
+                                 bool transient, bool populateSandboxCache = false);
+
+    // Inserts the record (replacing one with the same identifier) as living
+    // at `url`; with `updateSandbox` a permanent container is also mapped.
+    Status addContainerMetadata(const MetadataPtr& metadata, const std::filesystem::path& url,
+                                bool transient, bool updateSandbox);
+    // Drops the record and, for a permanent container, its sandbox mapping.
+    // An identifier the cache does not hold is no error.
+    Status removeContainerForUserIdentity(const QRNUserIdentityPtr& userIdentity,
+                                          std::uint64_t contentClass, const std::string& identifier,
+                                          bool transient);
+
+    // Whether a class directory's item may be a container of the class: a
+    // UUID name, or in the system classes a well-known container's name.
+    bool containerURL(const std::filesystem::path& url,
+                      std::uint64_t isValidForContainerClass) const;
+
+    // Pushes one mapping; 0 or the sandbox's errno. Bundle classes are not
+    // mapped and answer 0.
+    int setSandboxContainerMappingForUserIdentity(const QRNUserIdentityPtr& userIdentity,
+                                                  const std::string& identifier,
+                                                  std::uint64_t containerClass,
+                                                  const std::filesystem::path& url);
+    bool shouldRegisterSandboxMappingWithUserIdentity(const QRNUserIdentityPtr& userIdentity,
+                                                      const std::string& identifier,
+                                                      std::uint64_t containerClass) const;
+
+    // Forgets every entry keyed for the user (and so every global entry),
+    // removing their sandbox mappings, then posts the user-invalidated
+    // notification. Must not be called with the cache's lock held.
+    void invalidateUserIdentity(const QRNUserIdentityPtr& userIdentity);
+    // The user identity cache's observer callback: invalidates.
+    void userIdentityCache(QRNUserIdentityCache& cache,
+                           const QRNUserIdentityPtr& didInvalidateUserIdentity);
+
+    void setRebuildGate(RebuildGate gate);
+
+private:
+    // A mapping as it was pushed, so exactly it can be removed again.
+    struct SandboxMapping {
+        std::uint32_t uid = 0;
+        SandboxItem item;
+    };
+    struct Entry {
+        std::map<std::string, MetadataPtr, std::less<>> containers; // by identifier
+        std::map<std::string, SandboxMapping, std::less<>> pushed;  // by identifier
+        bool sandboxPopulated = false;
+    };
+    using EntryMap = std::unordered_map<std::string, Entry>;
+    class Observer;
+
+    // Holds the lock for a scope and records the owner for the `_lock_`
+    // assertions.
+    class Locker {
+    public:
+        explicit Locker(QRNContainerCache& cache) : cache_(cache) { cache_.lock(); }
+        ~Locker() { cache_.unlock(); }
+        Locker(const Locker&) = delete;
+        Locker& operator=(const Locker&) = delete;
+
+    private:
+        QRNContainerCache& cache_;
+    };
+
+    void lock();
+    void unlock();
+    void _lock_assertOwned(const char* function) const;
+    void assertNotOwned(const char* function) const;
+    static const char* transientSuffix(bool transient) { return transient ? "(transient)" : ""; }
+
+    // --- Entries (QRNContainerCache.cpp) ---
+    Result<Entry*> _lock_entryFor(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                                  bool transient, bool populateSandbox);
+    MetadataPtr _lock_find(const Entry& entry, const QRNContainerIdentity& identity) const;
+    // False only for a concrete identity whose UUID is not the record's.
+    static bool uuidMatches(const QRNContainerIdentity& identity, const QRNMetadata& metadata);
+
+    // --- Building (+Build) ---
+    Result<Entry*> _lock_rebuild(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                                 bool transient, bool populateSandbox);
+    Result<Entry> _lock_scanClassDirectory(const QRNUserIdentityPtr& userIdentity,
+                                           std::uint64_t cls, bool transient, bool populateSandbox);
+    void runRebuildGate(std::uint64_t cls);
+
+    // --- Sandbox (+Sandbox) ---
+    // The mapping for a container of the class; none for classes that are
+    // not mapped.
+    static std::optional<SandboxMapping> sandboxMappingFor(const QRNUserIdentity& userIdentity,
+                                                           const std::string& identifier,
+                                                           std::uint64_t cls,
+                                                           const std::filesystem::path& url);
+    static std::uint64_t sandboxItemTypeForClass(std::uint64_t cls);
+    int pushSandboxMapping(const SandboxMapping& mapping);
+    int pullSandboxMapping(const SandboxMapping& mapping);
+    // Pushes the container's mapping and remembers it in the entry; 0 or
+    // the sandbox's errno.
+    int _lock_mapContainer(Entry& entry, const QRNUserIdentity& userIdentity,
+                           const QRNMetadata& metadata);
+    void _lock_populateSandbox(Entry& entry, const QRNUserIdentity& userIdentity);
+    void _lock_unmapContainer(Entry& entry, const QRNUserIdentity& userIdentity, std::uint64_t cls,
+                              const std::string& identifier);
+    MetadataPtr _lock_containerFromKernelSandbox(const QRNContainerIdentity& identity);
+    std::optional<SandboxItem> findKernelSandboxItem(std::uint32_t uid,
+                                                     const SandboxMapping& wanted) const;
+
+    std::shared_ptr<QRNUserIdentityCache> userIdentityCache_;
+    std::shared_ptr<QRNGlobalConfiguration> configuration_;
+    std::shared_ptr<QRNFileManager> fileManager_;
+    std::shared_ptr<QRNWhitelist> whitelist_;
+    std::shared_ptr<SandboxKernel> sandbox_;
+    std::shared_ptr<Notifications> notifications_;
+    std::shared_ptr<Observer> observer_; // registered (weakly) with the user identity cache
+
+    // Guards permanent_ and transient_; owned by this cache. Building an
+    // entry (disk reads included) happens under it.
+    std::mutex mutex_;
+    std::atomic<std::thread::id> owner_;
+    EntryMap permanent_;
+    EntryMap transient_;
+
+    // Guards gate_ only; taken inside mutex_, never the other way round.
+    std::mutex gateMutex_;
+    RebuildGate gate_;
+};
+
+} // namespace quarn

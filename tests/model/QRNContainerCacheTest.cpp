@@ -1,0 +1,358 @@
+#include "Daemon/model/QRNContainerCache.h"
+
+#include "Daemon/fs/QRNFileManager.h"
+#include "Daemon/model/QRNContainerClass.h"
+#include "Daemon/model/QRNGlobalConfiguration.h"
+#include "Daemon/model/QRNUserIdentityCache.h"
+#include "Daemon/platform/LinuxNotifications.h"
+
+#include "common/LogCapture.h"
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <fstream>
+
+using namespace quarn;
+
+namespace {
+
+using Ids = std::vector<std::string>;
+
+class QRNContainerCacheTest : public quarn::test::TempRootTest {
+protected:
+    QRNContainerCache& cache() { return QRNContainerCache::sharedInstance(); }
+    InMemorySandboxKernel& sandbox() {
+        return dynamic_cast<InMemorySandboxKernel&>(root_.context().instance<SandboxKernel>());
+    }
+    QRNUserIdentityCache& identities() { return root_.context().instance<QRNUserIdentityCache>(); }
+    QRNUserIdentityPtr mobile() { return identities().defaultUserIdentity(); }
+    QRNUserIdentityPtr guest() {
+        return identities().userIdentityForPersonalPersonaWithUID(502, 502);
+    }
+
+    std::filesystem::path classDirectory(std::uint64_t cls, bool transient = false) {
+        return *QRNGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+            mobile(), cls, transient);
+    }
+
+    // A directory (a fresh UUID unless named) with a metadata file written
+    // the way the daemon writes it; `recordedClass` lets it lie about itself.
+    QRNMetadataPtr makeContainer(std::uint64_t cls, const std::string& identifier,
+                                 std::string name = {}, bool transient = false,
+                                 std::uint64_t recordedClass = 0) {
+        const UUID uuid = UUID::random();
+        const auto url = classDirectory(cls, transient) / (name.empty() ? uuid.string() : name);
+        std::filesystem::create_directories(url);
+        auto concrete = QRNConcreteContainerIdentity::containerIdentityWithUUID(
+            uuid, mobile(), identifier, recordedClass ? recordedClass : cls);
+        auto metadata = std::make_shared<const QRNMetadata>(*concrete, Value(), url, std::nullopt);
+        EXPECT_TRUE(metadata->writeMetadataToFileURL(url / QRNMetadata::kFileName));
+        return metadata;
+    }
+
+    QRNContainerIdentityPtr identity(std::uint64_t cls, const std::string& identifier) {
+        return *QRNContainerIdentity::containerIdentityWithUserIdentity(mobile(), identifier, cls);
+    }
+
+    Ids identifiersOf(std::uint64_t cls) {
+        auto all = cache().allContainersForUserIdentity(mobile(), cls, false);
+        EXPECT_TRUE(all) << log_.all();
+        Ids ids;
+        for (const auto& metadata : all ? *all : std::vector<QRNMetadataPtr>{}) {
+            ids.push_back(metadata->identifier());
+        }
+        std::sort(ids.begin(), ids.end());
+        return ids;
+    }
+
+    std::vector<SandboxItem> mapped(std::uint32_t uid) {
+        std::vector<SandboxItem> items;
+        sandbox().forEachItem(uid, [&](const SandboxItem& item) {
+            items.push_back(item);
+            return true;
+        });
+        return items;
+    }
+
+    // Rebuilds of exactly this entry ("[501]-appData", "app(transient)").
+    std::size_t rebuilds(std::string_view key) {
+        const auto wanted = fmt::format("Rebuilding container class cache: {}", key);
+        const auto lines = log_.messages();
+        return static_cast<std::size_t>(std::count(lines.begin(), lines.end(), wanted));
+    }
+
+    std::size_t notificationsPosted() {
+        std::ifstream in(LinuxNotifications(Paths(root_.path())).directory() /
+                         Notifications::kUserInvalidated);
+        return static_cast<std::size_t>(
+            std::count(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>(), '\n'));
+    }
+
+    quarn::test::LogCapture log_;
+};
+
+// --- Building an entry from disk -------------------------------------------------------
+
+TEST_F(QRNContainerCacheTest, OnlyUUIDNamesAreContainersExceptWellKnownSystemNames) {
+    auto real = makeContainer(kQRNContainerClassAppData, "com.example.uuid");
+    makeContainer(kQRNContainerClassAppData, "com.example.named", "com.example.named");
+    makeContainer(kQRNContainerClassAppData, "com.orvex.devicesettings",
+                  "com.orvex.devicesettings");
+    // Links and files under a container's name are never taken for one.
+    std::filesystem::create_directory_symlink(
+        real->url(), classDirectory(kQRNContainerClassAppData) / UUID::random().string());
+    std::ofstream(classDirectory(kQRNContainerClassAppData) / UUID::random().string()) << "file";
+    const auto system = kQRNContainerClassSystemData;
+    makeContainer(system, "com.orvex.devicesettings", "com.orvex.devicesettings");
+    makeContainer(system, "com.orvex.unknown", "com.orvex.unknown");
+    makeContainer(system, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
+    const auto group = kQRNContainerClassSystemGroup;
+    makeContainer(group, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
+    makeContainer(group, "systemgroup.com.orvex.uuid");
+
+    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.uuid"});
+    EXPECT_EQ(identifiersOf(system), Ids{"com.orvex.devicesettings"});
+    EXPECT_EQ(identifiersOf(group),
+              (Ids{"systemgroup.com.orvex.pairing", "systemgroup.com.orvex.uuid"}));
+    EXPECT_FALSE(log_.contains("INCONSISTENT")) << log_.all();
+}
+
+TEST_F(QRNContainerCacheTest, OfTwoContainersWithOneIdentifierTheOneListedLaterWins) {
+    auto first = makeContainer(kQRNContainerClassAppData, "com.example.twice");
+    auto second = makeContainer(kQRNContainerClassAppData, "com.example.twice");
+    // An unchanged directory lists in the same order every time.
+    auto listed = QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(
+        classDirectory(kQRNContainerClassAppData));
+    ASSERT_TRUE(listed && listed->size() == 2u);
+    const auto& later = listed->back().url == first->url() ? first : second;
+
+    auto found = cache().containerForContainerIdentity(
+        identity(kQRNContainerClassAppData, "com.example.twice"));
+    ASSERT_TRUE(found) << log_.all();
+    EXPECT_EQ((*found)->uuid(), later->uuid());
+    EXPECT_EQ((*found)->url(), later->url());
+}
+
+TEST_F(QRNContainerCacheTest, ContainersWithoutValidMetadataAreReportedAndLeftOut) {
+    makeContainer(kQRNContainerClassAppData, "com.example.good");
+    const auto empty = classDirectory(kQRNContainerClassAppData) / UUID::random().string();
+    std::filesystem::create_directories(empty);
+    auto corrupt = makeContainer(kQRNContainerClassAppData, "com.example.corrupt");
+    std::ofstream(corrupt->url() / QRNMetadata::kFileName, std::ios::trunc) << "garbage";
+    makeContainer(kQRNContainerClassAppData, "com.example.group", {}, false,
+                  kQRNContainerClassAppGroup);
+
+    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.good"});
+    EXPECT_EQ(log_.count("Cache: [501]-appData: INCONSISTENT-No Metadata at: "), 3u) << log_.all();
+    EXPECT_TRUE(log_.contains(fmt::format("INCONSISTENT-No Metadata at: {} for id: {}, class: 2",
+                                          empty.string(), empty.filename().string())));
+}
+
+TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsNothing) {
+    const auto dir = classDirectory(kQRNContainerClassAppData);
+    std::filesystem::remove(dir);
+    std::ofstream(dir) << "a file where the class directory belongs";
+    auto all = cache().allContainersForUserIdentity(mobile(), kQRNContainerClassAppData, false);
+    ASSERT_FALSE(all);
+    EXPECT_TRUE(all.error().isQRN(kQRNErrorCacheRebuildFailed));
+    EXPECT_EQ(all.error().message, "Cache: [501]-appData: Failed to rebuild");
+
+    std::filesystem::remove(dir);
+    makeContainer(kQRNContainerClassAppData, "com.example.back");
+    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.back"});
+}
+
+// --- Lookups --------------------------------------------------------------------------------
+
+TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
+    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
+    auto transient = makeContainer(kQRNContainerClassAppData, "com.example.app", {}, true);
+    auto id = identity(kQRNContainerClassAppData, "com.example.app");
+    for (int i = 0; i < 2; ++i) {
+        auto found = cache().containerForContainerIdentity(id);
+        auto foundTransient = cache().containerForContainerIdentity(id, true);
+        ASSERT_TRUE(found && foundTransient) << log_.all();
+        EXPECT_EQ((*found)->uuid(), made->uuid());
+        EXPECT_EQ((*foundTransient)->uuid(), transient->uuid());
+    }
+    EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+    EXPECT_EQ(rebuilds("[501]-appData(transient)"), 1u);
+
+    auto missing = cache().containerForContainerIdentity(
+        identity(kQRNContainerClassAppData, "com.example.none"), true);
+    ASSERT_FALSE(missing);
+    EXPECT_TRUE(missing.error().isQRN(kQRNErrorContainerNotFound));
+    EXPECT_EQ(missing.error().message,
+              "Cache: [501]-appData(transient): Container Not Found with ID: com.example.none");
+    // A concrete identity names one directory, not any with its identifier.
+    auto elsewhere = QRNConcreteContainerIdentity::containerIdentityWithUUID(
+        UUID::random(), mobile(), "com.example.app", kQRNContainerClassAppData);
+    EXPECT_FALSE(cache().containerForContainerIdentity(*elsewhere));
+    EXPECT_TRUE(cache().containerForContainerIdentity(made->containerIdentity()));
+
+    auto beyond = cache().allContainersForUserIdentity(mobile(), kQRNContainerClassMax, false);
+    ASSERT_FALSE(beyond);
+    EXPECT_TRUE(beyond.error().isQRN(kQRNErrorInvalidCacheInput));
+}
+
+// --- The kernel sandbox mapping -------------------------------------------------------------
+
+TEST_F(QRNContainerCacheTest, AddingAndRemovingKeepsTheSandboxMappingInStep) {
+    struct Case {
+        std::uint64_t cls, itemType; // item type 0: never mapped
+        std::uint32_t uid;
+    };
+    for (const Case& c : std::vector<Case>{{1, 0, 0},
+                                           {2, 1, 501},
+                                           {4, 1, 501},
+                                           {7, 2, 501},
+                                           {8, 0, 0},
+                                           {11, 1, 501},
+                                           {12, 4, 0},
+                                           {13, 8, 0}}) {
+        SCOPED_TRACE(c.cls);
+        const std::string id = fmt::format("com.example.c{}", c.cls);
+        auto made = makeContainer(c.cls, id);
+        ASSERT_TRUE(cache().addContainerMetadata(made, made->url(), false, true)) << log_.all();
+        const auto hasIt = [&](const SandboxItem& i) { return i.identifier == id; };
+        auto items = mapped(c.uid);
+        auto item = std::find_if(items.begin(), items.end(), hasIt);
+        if (c.itemType == 0) {
+            EXPECT_EQ(item, items.end());
+            continue;
+        }
+        ASSERT_NE(item, items.end());
+        EXPECT_EQ(*item, (SandboxItem{c.itemType, id, c.cls, 501, made->url().string()}));
+
+        ASSERT_TRUE(cache().removeContainerForUserIdentity(mobile(), c.cls, id, false));
+        items = mapped(c.uid);
+        EXPECT_TRUE(std::none_of(items.begin(), items.end(), hasIt));
+        EXPECT_FALSE(cache().containerForContainerIdentity(identity(c.cls, id)));
+    }
+    EXPECT_FALSE(log_.contains("Unsupported class")) << log_.all();
+}
+
+TEST_F(QRNContainerCacheTest, OnlyPermanentContainersAreMappedAndAnEntryOnlyOnce) {
+    auto temp = makeContainer(kQRNContainerClassAppData, "com.example.t", {}, true);
+    ASSERT_TRUE(cache().addContainerMetadata(temp, temp->url(), true, true));
+    makeContainer(kQRNContainerClassAppGroup, "group.example");
+    auto id = identity(kQRNContainerClassAppGroup, "group.example");
+    ASSERT_TRUE(cache().containerForContainerIdentity(id));
+    EXPECT_TRUE(mapped(501).empty());
+
+    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
+    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
+    ASSERT_EQ(mapped(501).size(), 1u);
+    EXPECT_EQ(log_.count("Pushed user: 501, itemType: 2, identifier group.example"), 1u);
+}
+
+TEST_F(QRNContainerCacheTest, AKernelMappingWhoseMetadataValidatesAnswersWithoutAScan) {
+    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
+    // As a kernel that kept its mapping while the daemon restarted.
+    sandbox().setContainerMapping(
+        501, {1, "com.example.app", kQRNContainerClassAppData, 501, made->url().string()});
+    auto id = identity(kQRNContainerClassAppData, "com.example.app");
+
+    auto found = cache().containerForContainerIdentity(id, false, false, true);
+    ASSERT_TRUE(found) << log_.all();
+    EXPECT_EQ((*found)->uuid(), made->uuid());
+    EXPECT_EQ(rebuilds("[501]-appData"), 0u);
+    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
+    EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+}
+
+TEST_F(QRNContainerCacheTest, AKernelMappingThatDoesNotHoldTheContainerFallsBackToTheScan) {
+    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
+    auto impostor = makeContainer(kQRNContainerClassAppData, "com.example.impostor");
+    const auto bare = classDirectory(kQRNContainerClassAppData) / "bare";
+    std::filesystem::create_directories(bare);
+    const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
+        {impostor->url(),
+         fmt::format("Attempted to fetch container from Sandbox-provided path [{}] that was not "
+                     "what was expected; expected class: 2, expected identifier: "
+                     "[com.example.app], actual class: 2, actual identifier: "
+                     "[com.example.impostor]",
+                     impostor->url().string())},
+        {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
+                           bare.string())},
+    };
+    for (const auto& [path, logged] : cases) {
+        sandbox().setContainerMapping(
+            501, {1, "com.example.app", kQRNContainerClassAppData, 501, path.string()});
+        auto found = cache().containerForContainerIdentity(
+            identity(kQRNContainerClassAppData, "com.example.app"), false, false, true);
+        ASSERT_TRUE(found) << log_.all();
+        EXPECT_EQ((*found)->uuid(), made->uuid());
+        EXPECT_TRUE(log_.contains(logged)) << log_.all();
+        EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+        cache().invalidateUserIdentity(mobile()); // back to an unbuilt entry
+        log_.clear();
+    }
+}
+
+// --- Invalidation ----------------------------------------------------------------------------
+
+TEST_F(QRNContainerCacheTest, InvalidatingOneUserRebuildsOnlyTheGlobalEntriesForAnother) {
+    makeContainer(kQRNContainerClassAppGroup, "group.example");
+    makeContainer(kQRNContainerClassAppBundle, "com.example.bundle");
+    makeContainer(kQRNContainerClassSystemData, "com.orvex.devicesettings",
+                  "com.orvex.devicesettings");
+    auto lookUpAll = [&] {
+        for (std::uint64_t cls : {kQRNContainerClassAppGroup, kQRNContainerClassAppBundle,
+                                  kQRNContainerClassSystemData}) {
+            EXPECT_EQ(identifiersOf(cls).size(), 1u) << cls;
+        }
+    };
+    lookUpAll();
+    cache().invalidateUserIdentity(guest());
+    lookUpAll();
+    EXPECT_EQ(rebuilds("[501]-appGroup"), 1u);
+    EXPECT_EQ(rebuilds("app"), 2u);
+    EXPECT_EQ(rebuilds("systemData"), 2u);
+    EXPECT_EQ(notificationsPosted(), 1u);
+
+    cache().invalidateUserIdentity(mobile());
+    lookUpAll();
+    EXPECT_EQ(rebuilds("[501]-appGroup"), 2u);
+    EXPECT_EQ(notificationsPosted(), 2u);
+}
+
+TEST_F(QRNContainerCacheTest, InvalidationRemovesTheUsersAndTheGlobalSandboxMappings) {
+    auto data = makeContainer(kQRNContainerClassAppData, "com.example.app");
+    auto system = makeContainer(kQRNContainerClassSystemData, "com.orvex.devicesettings",
+                                "com.orvex.devicesettings");
+    for (const auto& made : {data, system}) {
+        ASSERT_TRUE(cache().addContainerMetadata(made, made->url(), false, true));
+    }
+    const SandboxItem theirs{1, "com.example.theirs", kQRNContainerClassAppData, 502, "/x"};
+    sandbox().setContainerMapping(502, theirs);
+
+    cache().invalidateUserIdentity(mobile());
+    EXPECT_TRUE(mapped(501).empty());
+    EXPECT_TRUE(mapped(0).empty());
+    EXPECT_EQ(mapped(502), std::vector<SandboxItem>{theirs});
+}
+
+TEST_F(QRNContainerCacheTest, TheUserIdentityCacheTellsTheCacheWhomItDroppedWhileTheCacheLives) {
+    auto enterprise = QRNUserIdentity::initWithUID(502, 502, root_ / "/private/var/mobile",
+                                                   "persona-1", kQRNPersonaTypeEnterprise, 1000);
+    auto dropEnterprise = [&] {
+        identities().flushAndRepopulateWithUserIdentities({mobile(), enterprise});
+        identities().flush();
+    };
+    {
+        QRNContainerCache own(root_.context(),
+                              root_.context().sharedInstance<QRNUserIdentityCache>());
+        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kQRNContainerClassAppData, false));
+        dropEnterprise();
+        EXPECT_EQ(notificationsPosted(), 1u);
+        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kQRNContainerClassAppData, false));
+        EXPECT_EQ(rebuilds("[persona-1]-appData"), 2u);
+    }
+    dropEnterprise();
+    EXPECT_EQ(notificationsPosted(), 1u);
+}
+
+} // namespace
