@@ -135,20 +135,23 @@ private:
 
     CodeResult<QRNMetadataPtr> _createOrLookup(const QRNContainerIdentityPtr& identity,
                                                bool createIfNecessary, bool transient,
-                                               bool useLocking, bool& existed);
+                                               bool useLocking, CreateAttempt& attempt,
+                                               bool& existed);
     CodeResult<void> _checkAccess(const QRNContainerIdentity& identity);
     CodeResult<void> _checkSystemContainerAccess(const QRNContainerIdentity& identity);
     CodeResult<QRNMetadataPtr> _lookupUnderReadLock(const QRNContainerIdentityPtr& identity,
-                                                    bool useLocking, bool& existed);
+                                                    bool useLocking);
     CodeResult<QRNMetadataPtr> _lookupUnderWriteLock(const QRNContainerIdentityPtr& identity,
-                                                     bool transient, bool& existed);
-    CodeResult<QRNMetadataPtr> _createContainer(const QRNContainerIdentityPtr& identity,
+                                                     bool transient);
+    CodeResult<QRNMetadataPtr> _createContainer(const QRNContainerIdentity& identity,
                                                 bool transient, CreateAttempt& attempt);
-    CodeResult<std::shared_ptr<QRNMetadata>> _buildInStaging(const QRNContainerIdentity& identity,
-                                                             CreateAttempt& attempt);
+    // Sets `stagingURL` once the staging directory exists.
+    CodeResult<QRNMetadataPtr> _buildInStaging(const QRNContainerIdentity& identity,
+                                               const UUID& uuid,
+                                               std::optional<std::filesystem::path>& stagingURL);
     std::optional<std::filesystem::path> _liveURL(const QRNContainerIdentity& identity,
                                                   bool transient, const std::string& uuidString);
-    void _cleanUpStaging(CreateAttempt& attempt);
+    void _cleanUpStaging(CreateAttempt& attempt, CodeResult<QRNMetadataPtr>& result);
 
     const QRNClientIdentityPtr clientIdentity_;
     const bool entitled_;
