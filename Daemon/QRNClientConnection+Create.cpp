@@ -5,6 +5,7 @@
 #include "Daemon/QRNClientConnection.h"
 
 #include "Daemon/QRNLocks.h"
+#include "Daemon/QRNOperationGuard.h"
 #include "Daemon/codesigning/QRNCodeSigningMapping.h"
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNContainerCache.h"
@@ -18,9 +19,7 @@
 #include "Daemon/support/Signpost.h"
 #include "Daemon/support/UUID.h"
 
-#include <cstdlib>
 #include <exception>
-#include <typeinfo>
 
 namespace quarn {
 
@@ -68,23 +67,14 @@ CodeResult<QRNMetadataPtr> QRNClientConnection::createOrLookupContainerWithConta
     CreateAttempt attempt;
     bool found = false;
     CodeResult<QRNMetadataPtr> result = QRN_CODE(kQRNErrorException);
-    bool threw = false;
     try {
         result =
             _createOrLookup(identity, createIfNecessary, transient, useLocking, attempt, found);
     } catch (const std::exception& exception) {
-        threw = true;
-        QRN_ERROR(kQRNErrorException, "Got exception: {} : {}", typeid(exception).name(),
-                  exception.what());
-        result = QRN_CODE(kQRNErrorException);
+        QRNOperationGuard::reportException(exception);
     }
     _cleanUpStaging(attempt, result);
     attempt.globalLock.reset();
-    if (threw && QRNGlobalConfiguration::sharedInstance().isInternalImage()) {
-        // Stopped on purpose, so that the exception is seen.
-        QRN_LOG_FAULT(LogCategory::Lifecycle, "** INTERNAL ERROR: Uncaught Exception **\n");
-        std::abort();
-    }
     if (result && existed) {
         *existed = found;
     }

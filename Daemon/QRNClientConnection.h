@@ -106,6 +106,29 @@ public:
                                            const QRNMetadata& metadata);
     std::int32_t _dataProtectionClassForContainerMetadata(const QRNMetadata& metadata);
 
+    // --- Reading and touching one container; listing --------------------
+
+    // Every container of the class for the client's user identity.
+    CodeResult<std::vector<QRNMetadataPtr>> containersWithClass(std::uint64_t containerClass,
+                                                                bool transient);
+    // `key` must be a string; a none `value` removes the key. The metadata
+    // file is rewritten and the cache updated.
+    CodeResult<void> setInfoValue(const Value& value, const Value* key,
+                                  const QRNContainerIdentityPtr& containerIdentity,
+                                  bool useLocking);
+    CodeResult<Value> infoValueForKey(const Value* key,
+                                      const QRNContainerIdentityPtr& containerIdentity,
+                                      bool useLocking);
+    CodeResult<QRNMetadataPtr>
+    metadataWithContainerIdentity(const QRNContainerIdentityPtr& containerIdentity);
+    // Makes missing subdirectories again; system containers get their ACLs back.
+    CodeResult<void>
+    recreateDefaultStructureWithContainerIdentity(const QRNContainerIdentityPtr& containerIdentity);
+    // Queues a staged delete of the container; it goes when the request completes.
+    CodeResult<void>
+    deleteContainerWithContainerIdentity(const QRNContainerIdentityPtr& containerIdentity,
+                                         bool transient);
+
     // --- Death row and directory UUIDs ------------------------------------
 
     // Moves the item into its own unique directory on death row; a missing
@@ -152,6 +175,9 @@ private:
     std::optional<std::filesystem::path> _liveURL(const QRNContainerIdentity& identity,
                                                   bool transient, const std::string& uuidString);
     void _cleanUpStaging(CreateAttempt& attempt, CodeResult<QRNMetadataPtr>& result);
+    // The cached container of a permanent identity, or code 21 with `message`.
+    CodeResult<QRNMetadataPtr> _cachedContainer(const QRNContainerIdentityPtr& identity,
+                                                std::string_view message);
 
     const QRNClientIdentityPtr clientIdentity_;
     const bool entitled_;
