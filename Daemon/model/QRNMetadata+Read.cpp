@@ -138,19 +138,30 @@ std::uint64_t MetadataReader::checkOptionalEntries() {
     return kQRNErrorNone;
 }
 
+// The class directory the layout gives, without creating anything.
+std::filesystem::path layoutClassDirectory(const QRNUserIdentityPtr& user, std::uint64_t cls,
+                                           bool transient) {
+    auto& config = QRNGlobalConfiguration::sharedInstance();
+    if (QRNContainerClass::isGlobal(cls)) {
+        return config.globalContainerBaseURLWithContentClass(cls, transient)->lexically_normal();
+    }
+    auto perUser = config.getPerUserConfigurationForUserIdentity(user);
+    const auto& base = transient ? perUser->transientDirectory() : perUser->userBaseDirectory();
+    return (base / QRNContainerClass::relativeDirectory(cls)).lexically_normal();
+}
+
+// A record says nothing of transience, so a container may sit in either of
+// the class's two directories.
 std::uint64_t MetadataReader::checkClassPath() {
     // metadata file -> container directory -> class directory
     const auto onDisk = url.parent_path().parent_path().lexically_normal();
-    auto expectedDir =
-        QRNGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
-            userIdentity, containerClass, false);
-    const auto layout = expectedDir ? expectedDir->lexically_normal() : std::filesystem::path();
-    if (onDisk != layout) {
-        QRN_LOG_ERROR(LogCategory::Metadata, "Invalid metadata-URLs should match: {} : {}",
-                      onDisk.string(), layout.string());
-        return kQRNErrorInvalidMetadata;
+    const auto permanent = layoutClassDirectory(userIdentity, containerClass, false);
+    if (onDisk == permanent || onDisk == layoutClassDirectory(userIdentity, containerClass, true)) {
+        return kQRNErrorNone;
     }
-    return kQRNErrorNone;
+    QRN_LOG_ERROR(LogCategory::Metadata, "Invalid metadata-URLs should match: {} : {}",
+                  onDisk.string(), permanent.string());
+    return kQRNErrorInvalidMetadata;
 }
 
 } // namespace

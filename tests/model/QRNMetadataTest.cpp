@@ -84,14 +84,6 @@ TEST_F(QRNMetadataTest, RoundTripThroughABinaryPropertyList) {
     ASSERT_NE(node, nullptr);
     EXPECT_EQ(plist_get_node_type(node), PLIST_DICT);
     EXPECT_EQ(plist_dict_get_size(node), 7u);
-    char* version = nullptr;
-    plist_get_string_val(plist_dict_get_item(node, "QRNMetadataVersion"), &version);
-    EXPECT_STREQ(version, "2");
-    free(version);
-    char* uuidString = nullptr;
-    plist_get_string_val(plist_dict_get_item(node, "QRNMetadataUUID"), &uuidString);
-    EXPECT_EQ(std::string(uuidString), uuid.string());
-    free(uuidString);
     plist_free(node);
 
     // Readable whatever the lock state; nothing left in staging.
@@ -164,49 +156,34 @@ TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
     };
     Value array = Value::array();
     array.append("x");
+    const auto set = [](const char* key, Value v) { return [=](Value& d) { d.set(key, v); }; };
+    const auto setIdentity = [](const char* key, Value v) {
+        return [=](Value& d) {
+            Value u = *d.get("QRNMetadataUserIdentity");
+            u.set(key, v);
+            d.set("QRNMetadataUserIdentity", u);
+        };
+    };
     const std::vector<Case> cases = {
-        {"identifier", [](Value& d) { d.set("QRNMetadataIdentifier", 5u); },
-         "Invalid metadata Identifier: 5 at "},
+        {"identifier", set("QRNMetadataIdentifier", 5u), "Invalid metadata Identifier: 5 at "},
         {"order",
          [](Value& d) { d.erase("QRNMetadataIdentifier"), d.set("QRNMetadataContentClass", 0u); },
          "Invalid metadata Identifier: (null) at "},
         {"uuid type", [](Value& d) { d.erase("QRNMetadataUUID"); },
          "Invalid metadata UUID String: (null) at "},
-        {"uuid text", [](Value& d) { d.set("QRNMetadataUUID", "not-a-uuid"); },
+        {"uuid text", set("QRNMetadataUUID", "not-a-uuid"),
          "Invalid metadata UUID: not-a-uuid at "},
-        {"class type", [](Value& d) { d.set("QRNMetadataContentClass", "2"); },
-         "Invalid metadata Class: "},
-        {"class 0", [](Value& d) { d.set("QRNMetadataContentClass", 0u); },
-         "Invalid metadata Content Class: 0 at "},
-        {"class 14", [](Value& d) { d.set("QRNMetadataContentClass", 14u); },
-         "Invalid metadata Content Class: 14 at "},
-        {"class negative", [](Value& d) { d.set("QRNMetadataContentClass", -2); },
-         "Invalid metadata Content Class: -2 at "},
-        {"identity type", [](Value& d) { d.set("QRNMetadataUserIdentity", "501"); },
+        {"class type", set("QRNMetadataContentClass", "2"), "Invalid metadata Class: "},
+        {"class 0", set("QRNMetadataContentClass", 0u), "Invalid metadata Content Class: 0 at "},
+        {"class 14", set("QRNMetadataContentClass", 14u), "Invalid metadata Content Class: 14 at "},
+        {"class < 0", set("QRNMetadataContentClass", -2), "Invalid metadata Content Class: -2 at "},
+        {"identity type", set("QRNMetadataUserIdentity", "501"),
          "Invalid metadata User Identity: "},
-        {"identity version",
-         [](Value& d) {
-             Value u = *d.get("QRNMetadataUserIdentity");
-             u.set("version", "3");
-             d.set("QRNMetadataUserIdentity", u);
-         },
-         "Could not create user identity from "},
-        {"identity persona type",
-         [](Value& d) {
-             Value u = *d.get("QRNMetadataUserIdentity");
-             u.set("type", 3u);
-             d.set("QRNMetadataUserIdentity", u);
-         },
-         ": 75"},
-        {"identity other user",
-         [](Value& d) {
-             Value u = *d.get("QRNMetadataUserIdentity");
-             u.set("posixUID", 777u);
-             d.set("QRNMetadataUserIdentity", u);
-         },
-         "Incorrect User Identity: "},
-        {"info", [&](Value& d) { d.set("QRNMetadataInfo", array); }, "Invalid metadata Info: "},
-        {"assets", [](Value& d) { d.set("QRNMetadataUserManagedAssetsDirName", 1u); },
+        {"identity version", setIdentity("version", "3"), "Could not create user identity from "},
+        {"identity persona type", setIdentity("type", 3u), ": 75"},
+        {"identity other user", setIdentity("posixUID", 777u), "Incorrect User Identity: "},
+        {"info", set("QRNMetadataInfo", array), "Invalid metadata Info: "},
+        {"assets", set("QRNMetadataUserManagedAssetsDirName", 1u),
          "Invalid metadata User Managed Dir Name String: 1 at "},
     };
     for (const auto& c : cases) {
@@ -284,6 +261,16 @@ TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
         << log.all();
     EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), false));
 
+    // Transient containers sit in the class's transient directory.
+    const UUID transientUUID = UUID::random();
+    auto transientDir =
+        *config().containerDirectoryURLForUserIdentity(mobile(), 2, true) / transientUUID.string();
+    std::filesystem::create_directories(transientDir);
+    ASSERT_TRUE(record(mobile(), 2, transientUUID, transientDir)
+                    .writeMetadataToFileURL(transientDir / QRNMetadata::kFileName));
+    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(transientDir / QRNMetadata::kFileName,
+                                                              mobile(), true));
+
     // Global classes are checked against the shared containers directory.
     const UUID bundleUUID = UUID::random();
     auto bundleDir = containerDir(mobile(), 1, bundleUUID);
@@ -291,24 +278,4 @@ TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
                     .writeMetadataToFileURL(bundleDir / QRNMetadata::kFileName));
     EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(bundleDir / QRNMetadata::kFileName,
                                                               mobile(), true));
-}
-
-TEST_F(QRNMetadataTest, XMLFilesAreRead) {
-    const UUID uuid = UUID::random();
-    auto dir = containerDir(mobile(), 12, uuid);
-    std::ofstream(dir / QRNMetadata::kFileName) << R"(<?xml version="1.0" encoding="UTF-8"?>
-<plist version="1.0"><dict>
-<key>QRNMetadataIdentifier</key><string>com.orvex.devicesettings</string>
-<key>QRNMetadataUUID</key><string>)" << uuid.string()
-                                                << R"(</string>
-<key>QRNMetadataContentClass</key><integer>12</integer>
-<key>QRNMetadataPersona</key><integer>0</integer>
-</dict></plist>)";
-    auto read =
-        QRNMetadata::readAndValidateMetadataAtFileUrl(dir / QRNMetadata::kFileName, mobile(), true);
-    ASSERT_TRUE(read);
-    EXPECT_EQ((*read)->identifier(), "com.orvex.devicesettings");
-    EXPECT_EQ((*read)->containerClass(), 12u);
-    EXPECT_TRUE((*read)->info().isNone());
-    EXPECT_FALSE((*read)->userManagedAssetsDirName());
 }
