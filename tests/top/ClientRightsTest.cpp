@@ -68,38 +68,17 @@ TEST_F(ClientRightsTest, MalformedEntitlementsBecomeAnEmptyDictionary) {
     ASSERT_TRUE(identity);
     EXPECT_TRUE(identity->entitlements().isDictionary());
     EXPECT_EQ(identity->entitlements().size(), 0u);
-    EXPECT_EQ(QRNClientIdentity::initWithBundleIdentifier("x", 501, 501, 1, nullptr,
-                                                          Value::dictionary(), false,
-                                                          QRNClientIdentity::AuditToken{}, false),
-              nullptr);
 }
 
-TEST_F(ClientRightsTest, PrivilegedIdentitiesCarryNoIdsNoEntitlementsAndNoSandbox) {
-    auto user = QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity();
-    for (bool kernel : {false, true}) {
-        auto identity = QRNClientIdentity::privilegedClientIdentityWithUserIdentity(user, kernel);
-        ASSERT_TRUE(identity);
-        EXPECT_EQ(identity->bundleIdentifier(), "com.orvex.quarnd.internal");
-        EXPECT_EQ(identity->posixUID(), 0u);
-        EXPECT_EQ(identity->posixPID(), 0);
-        EXPECT_EQ(identity->isKernel(), kernel);
-        EXPECT_FALSE(identity->isSandboxed());
-        EXPECT_EQ(identity->entitlements().size(), 0u);
-        EXPECT_EQ(identity->auditToken(), QRNClientIdentity::AuditToken{});
-    }
-    auto anonymous = QRNClientIdentity::anonymousPrivilegedClientIdentity();
-    ASSERT_TRUE(anonymous);
-    EXPECT_FALSE(anonymous->isKernel());
-    EXPECT_TRUE(anonymous->userIdentity()->isEqual(*user));
-    // Class owners come from the user identity.
-    EXPECT_EQ(anonymous->posixUIDForContainerClass(kQRNContainerClassAppData), kMobileUID);
-    EXPECT_EQ(anonymous->posixUIDForContainerClass(kQRNContainerClassAppBundle), 33u);
-}
-
-TEST_F(ClientRightsTest, PlainInitIsRefused) {
-    LogCapture log;
-    EXPECT_EQ(QRNClientIdentity::init(), nullptr);
-    EXPECT_TRUE(log.contains("You cannot init this class directly.")) << log.all();
+TEST_F(ClientRightsTest, SharedConnectionIsPrivilegedAndOneInstance) {
+    auto& shared = QRNClientConnection::sharedClientConnection();
+    EXPECT_EQ(&shared, &QRNClientConnection::sharedClientConnection());
+    EXPECT_TRUE(shared.unrestricted());
+    EXPECT_TRUE(shared.allowOtherIdLookup());
+    ASSERT_TRUE(shared.clientIdentity());
+    EXPECT_FALSE(shared.clientIdentity()->isKernel());
+    EXPECT_EQ(shared.clientBundleIdentifier(), "com.orvex.quarnd.internal");
+    EXPECT_TRUE(shared.commandQueue());
 }
 
 TEST_F(ClientRightsTest, LookupEntitlementIsReadPerClassByShortName) {
@@ -126,48 +105,23 @@ TEST_F(ClientRightsTest, LookupEntitlementIsReadPerClassByShortName) {
         EXPECT_TRUE(set->empty()) << cls;
     }
     EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppGroup, "group.a"));
-    // Outside the class table there is nothing to ask.
+    // Outside the class table, or without the entitlement, there is nothing to ask.
     EXPECT_EQ(connection->_lookupForContainerClass(0), nullptr);
     EXPECT_EQ(connection->_lookupForContainerClass(14), nullptr);
-}
-
-TEST_F(ClientRightsTest, WithoutLookupEntitlementNothingIsGranted) {
-    auto connection = withLookup(std::nullopt);
-    EXPECT_EQ(connection->_lookupForContainerClass(kQRNContainerClassAppData), nullptr);
-    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppData, ""));
-}
-
-TEST_F(ClientRightsTest, SetOfStringsKeepsOnlyStrings) {
-    EXPECT_EQ(QRNClientConnection::_setOfStringsFromArray(
-                  arrayOf({Value("a"), Value("a"), Value(true), Value("b")})),
-              (QRNClientConnection::IdentifierSet{"a", "b"}));
-    EXPECT_TRUE(QRNClientConnection::_setOfStringsFromArray(Value("a")).empty());
+    EXPECT_EQ(withLookup(std::nullopt)->_lookupForContainerClass(kQRNContainerClassAppData),
+              nullptr);
 }
 
 TEST_F(ClientRightsTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
     using M = QRNDataProtectionManager;
-    const std::pair<std::string_view, int> levels[] = {
-        {M::kProtectionComplete, 1},
-        {M::kProtectionCompleteUnlessOpen, 2},
-        {M::kProtectionCompleteUntilFirstUserAuthentication, 3},
-        {M::kProtectionNone, 4},
-        {M::kProtectionWriteOnly, 2},
-        {M::kProtectionCompleteUntilUserAuthentication, 3},
-    };
-    for (const auto& [level, expected] : levels) {
-        for (const char* key : {"com.orvex.developer.default-data-protection",
-                                "data-protection-class", "DataProtectionClass"}) {
-            EXPECT_EQ(
-                M::intendedDataProtectionClassForEntitlements(dictionaryOf({{key, Value(level)}})),
-                expected)
-                << key << " " << level;
-        }
-    }
-    // The first key present decides, even when it holds no string.
+    EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(
+                  dictionaryOf({{"DataProtectionClass", Value(M::kProtectionWriteOnly)}})),
+              2);
     EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(
                   dictionaryOf({{"data-protection-class", Value(M::kProtectionNone)},
                                 {"DataProtectionClass", Value(M::kProtectionComplete)}})),
               4);
+    // The first key present decides, even when it holds no string.
     EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(
                   dictionaryOf({{"com.orvex.developer.default-data-protection", Value(1)},
                                 {"DataProtectionClass", Value(M::kProtectionComplete)}})),
@@ -181,23 +135,6 @@ TEST_F(ClientRightsTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
     EXPECT_TRUE(log.contains(
         "Unknown value for DataProtectionClass entitlement: Sometimes; defaulting to class 0"))
         << log.all();
-}
-
-TEST_F(ClientRightsTest, EntitledProtectionClassAsksTheEntitlementsSource) {
-    auto& manager = QRNDataProtectionManager::defaultManager();
-    EXPECT_EQ(manager.intendedDataProtectionClassBasedOnEntitlementsForIdentifier("com.a"), 0);
-    std::vector<std::string> asked;
-    manager.setEntitlementsSource([&asked](std::string_view identifier) -> std::optional<Value> {
-        asked.emplace_back(identifier);
-        if (identifier != "com.a") {
-            return std::nullopt;
-        }
-        return dictionaryOf(
-            {{"DataProtectionClass", Value(QRNDataProtectionManager::kProtectionNone)}});
-    });
-    EXPECT_EQ(manager.intendedDataProtectionClassBasedOnEntitlementsForIdentifier("com.a"), 4);
-    EXPECT_EQ(manager.intendedDataProtectionClassBasedOnEntitlementsForIdentifier("com.b"), 0);
-    EXPECT_EQ(asked, (std::vector<std::string>{"com.a", "com.b"}));
 }
 
 } // namespace

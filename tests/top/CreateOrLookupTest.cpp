@@ -105,14 +105,9 @@ TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtection
     }
 }
 
-TEST_F(CreateOrLookupTest, NonDataClassesIgnoreTheEntitledProtectionClass) {
-    entitlementsAskFor(QRNDataProtectionManager::kProtectionComplete);
-    auto made = create("com.example.system", kQRNContainerClassSystemData);
-    ASSERT_TRUE(made);
-    EXPECT_EQ(protectionClassOf(made->url() / "Library"), 0);
-}
-
 TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
+    // Entitlements choose protection classes for data containers only.
+    entitlementsAskFor(QRNDataProtectionManager::kProtectionComplete);
     auto made = create("com.example.system", kQRNContainerClassSystemData);
     ASSERT_TRUE(made);
     // Not well known: named by its UUID.
@@ -125,6 +120,7 @@ TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
         const struct stat st = lstatOf(made->url() / name);
         EXPECT_EQ(st.st_mode & 07777, 0u);
         EXPECT_EQ(st.st_uid, kNobody32);
+        EXPECT_EQ(protectionClassOf(made->url() / name), 0);
     }
     EXPECT_EQ(namesIn(made->url()).size(), 2u); // metadata and Library
 }
