@@ -125,9 +125,9 @@ QRNClientConnection::_createOrLookup(const QRNContainerIdentityPtr& identity,
 CodeResult<void> QRNClientConnection::_checkAccess(const QRNContainerIdentity& identity) {
     const std::uint64_t cls = identity.containerClass();
     const std::string& identifier = identity.identifier();
-    if (identifier == clientBundleIdentifier() || allowOtherIdLookup() ||
-        (QRNContainerClass::isGroup(cls) && allowGroupIdLookup()) || unrestricted() ||
-        isEntitledForLookupWithClass(cls, identifier) ||
+    const bool own = !identifier.empty() && identifier == clientBundleIdentifier();
+    if (own || allowOtherIdLookup() || (QRNContainerClass::isGroup(cls) && allowGroupIdLookup()) ||
+        unrestricted() || isEntitledForLookupWithClass(cls, identifier) ||
         QRNWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
             clientBundleIdentifier(), cls, identifier)) {
         return {};
@@ -149,8 +149,8 @@ QRNClientConnection::_checkSystemContainerAccess(const QRNContainerIdentity& ide
     // declares one.
     if (QRNWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
             clientBundleIdentifier(), kQRNContainerClassSystemData, identifier) ||
-        (QRNCodeSigningMapping::sharedInstance().identifierHasSystemContainer(identifier) &&
-         identifier == clientBundleIdentifier())) {
+        (!identifier.empty() && identifier == clientBundleIdentifier() &&
+         QRNCodeSigningMapping::sharedInstance().identifierHasSystemContainer(identifier))) {
         return {};
     }
     QRN_ERROR(kQRNErrorNotEntitled, "{} not entitled for system container with identifier {}",

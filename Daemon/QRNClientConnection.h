@@ -4,10 +4,11 @@
 // the daemon's own boot and upcall work.
 //
 // The operations are spread over files by concern:
-// QRNClientConnection.cpp (construction, rights),
-// +Create (create or look up a container), +Lookup (lookup rights and the
-// smaller read operations), +DeathRow (death row, new directory UUIDs),
-// +Complete (running the request's queued commands).
+// QRNClientConnection.cpp (construction, rights), +Lookup (the lookup
+// entitlement), +Create (create or look up a container), +Staging (building
+// a new container in staging), +Info (info values, metadata, listing and
+// deletion of existing containers), +DeathRow (death row, new directory
+// UUIDs), +Complete (running the request's queued commands).
 
 #include "Daemon/QRNClientIdentity.h"
 #include "Daemon/model/QRNContainerIdentity.h"
