@@ -4,8 +4,6 @@
 #include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNPlatformConstants.h"
 
-#include <fmt/std.h>
-
 #include <functional>
 
 namespace quarn {
