@@ -44,8 +44,12 @@ std::string Paths::devicePath(const std::filesystem::path& path) const {
     return p;
 }
 
-std::filesystem::path Paths::runDirectory() const { return resolve("/private/var/run/quarnd"); }
+std::filesystem::path Paths::runDirectory() const {
+    return resolve("/private/var/run/quarnd");
+}
 
-std::filesystem::path Paths::configDirectory() const { return resolve("/etc/quarnd"); }
+std::filesystem::path Paths::configDirectory() const {
+    return resolve("/etc/quarnd");
+}
 
 } // namespace quarn

@@ -24,11 +24,10 @@ template <class E> Unexpected(E) -> Unexpected<E>;
 
 template <class T, class E> class Expected {
 public:
-    Expected()
-        requires std::is_default_constructible_v<T>
-        : v_(std::in_place_index<0>) {}
+    Expected() requires std::is_default_constructible_v<T> : v_(std::in_place_index<0>) {}
     Expected(T value) : v_(std::in_place_index<0>, std::move(value)) {}
-    template <class G> Expected(Unexpected<G> u) : v_(std::in_place_index<1>, std::move(u).error()) {}
+    template <class G>
+    Expected(Unexpected<G> u) : v_(std::in_place_index<1>, std::move(u).error()) {}
 
     bool has_value() const { return v_.index() == 0; }
     explicit operator bool() const { return has_value(); }

@@ -12,14 +12,15 @@ namespace quarn {
 namespace {
 
 constexpr std::array<const char*, static_cast<std::size_t>(LogCategory::Count_)> kNames = {
-    "unspecified", "cache",   "sandbox", "vell", "locking",  "database",       "upcall",
-    "lifecycle",   "fs",      "startup", "test", "metadata", "codesignmapping"};
+    "unspecified", "cache", "sandbox", "vell", "locking",  "database",       "upcall",
+    "lifecycle",   "fs",    "startup", "test", "metadata", "codesignmapping"};
 
 // Pattern: time, level, category, the function name, then the message.
 constexpr const char* kPattern = "%Y-%m-%d %H:%M:%S.%f %^%l%$ [%n] %!: %v";
 
 struct Loggers {
-    std::shared_ptr<spdlog::sinks::dist_sink_mt> sink = std::make_shared<spdlog::sinks::dist_sink_mt>();
+    std::shared_ptr<spdlog::sinks::dist_sink_mt> sink =
+        std::make_shared<spdlog::sinks::dist_sink_mt>();
     std::array<std::shared_ptr<spdlog::logger>, kNames.size()> loggers;
 
     Loggers() {
@@ -47,7 +48,9 @@ const char* Log::categoryName(LogCategory category) {
     return kNames[static_cast<std::size_t>(category)];
 }
 
-std::shared_ptr<spdlog::sinks::dist_sink_mt> Log::sink() { return loggers().sink; }
+std::shared_ptr<spdlog::sinks::dist_sink_mt> Log::sink() {
+    return loggers().sink;
+}
 
 void Log::setLevel(spdlog::level::level_enum level) {
     for (auto& l : loggers().loggers) {
@@ -76,7 +79,8 @@ bool Log::addRotatingFile(const std::string& directory, std::size_t maxBytes,
                           std::size_t maxFiles) {
     try {
         auto path = (std::filesystem::path(directory) / "quarnd.log").string();
-        auto file = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(path, maxBytes, maxFiles);
+        auto file =
+            std::make_shared<spdlog::sinks::rotating_file_sink_mt>(path, maxBytes, maxFiles);
         file->set_pattern(kPattern);
         sink()->add_sink(file);
         return true;

@@ -76,8 +76,9 @@ const char* Error::domainName(Domain d) {
 }
 
 std::string Error::description() const {
-    std::string d = fmt::format("Error Domain={} Code={} \"{}\" {{FunctionName={}, SourceFileLine={}",
-                                domainName(), code, message, function, line);
+    std::string d =
+        fmt::format("Error Domain={} Code={} \"{}\" {{FunctionName={}, SourceFileLine={}",
+                    domainName(), code, message, function, line);
     if (underlying) {
         d += ", NSUnderlyingError=" + underlying->description();
     }

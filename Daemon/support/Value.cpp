@@ -89,8 +89,12 @@ std::optional<bool> Value::asBool() const {
     return std::nullopt;
 }
 
-const std::string* Value::asString() const { return std::get_if<std::string>(&v_); }
-const Value::Data* Value::asData() const { return std::get_if<Data>(&v_); }
+const std::string* Value::asString() const {
+    return std::get_if<std::string>(&v_);
+}
+const Value::Data* Value::asData() const {
+    return std::get_if<Data>(&v_);
+}
 
 std::optional<Date> Value::asDate() const {
     if (auto* d = std::get_if<Date>(&v_)) {
@@ -228,8 +232,8 @@ std::size_t Value::hash() const {
     case Kind::String:
         return std::hash<std::string>{}(*asString());
     case Kind::Data:
-        return std::hash<std::string_view>{}(std::string_view(
-            reinterpret_cast<const char*>(asData()->data()), asData()->size()));
+        return std::hash<std::string_view>{}(
+            std::string_view(reinterpret_cast<const char*>(asData()->data()), asData()->size()));
     case Kind::Date:
         return std::hash<std::int64_t>{}(asDate()->microsecondsSince1970);
     case Kind::UUID:

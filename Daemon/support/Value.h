@@ -38,13 +38,24 @@ public:
     using Array = std::vector<Value>;
     using Dictionary = std::map<std::string, Value, std::less<>>;
 
-    enum class Kind { None, UInt64, Int64, Real, Bool, String, Data, Date, UUID, Array, Dictionary };
+    enum class Kind {
+        None,
+        UInt64,
+        Int64,
+        Real,
+        Bool,
+        String,
+        Data,
+        Date,
+        UUID,
+        Array,
+        Dictionary
+    };
 
     Value() = default;
     Value(bool b) : v_(b) {}
     template <std::unsigned_integral T>
-        requires(!std::same_as<T, bool>)
-    Value(T u) : v_(static_cast<std::uint64_t>(u)) {}
+    requires(!std::same_as<T, bool>) Value(T u) : v_(static_cast<std::uint64_t>(u)) {}
     template <std::signed_integral T> Value(T i) : v_(static_cast<std::int64_t>(i)) {}
     Value(double d) : v_(d) {}
     Value(std::string s) : v_(std::move(s)) {}

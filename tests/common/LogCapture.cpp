@@ -34,9 +34,13 @@ LogCapture::~LogCapture() {
     Log::setLevel(previousLevel_);
 }
 
-std::vector<std::string> LogCapture::messages() const { return sink_->snapshot(); }
+std::vector<std::string> LogCapture::messages() const {
+    return sink_->snapshot();
+}
 
-bool LogCapture::contains(std::string_view fragment) const { return count(fragment) > 0; }
+bool LogCapture::contains(std::string_view fragment) const {
+    return count(fragment) > 0;
+}
 
 std::size_t LogCapture::count(std::string_view fragment) const {
     std::size_t n = 0;
@@ -57,6 +61,8 @@ std::string LogCapture::all() const {
     return out;
 }
 
-void LogCapture::clear() { sink_->reset(); }
+void LogCapture::clear() {
+    sink_->reset();
+}
 
 } // namespace quarn::test

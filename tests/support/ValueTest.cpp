@@ -1,5 +1,5 @@
-#include "Daemon/support/QRNError.h"
 #include "Daemon/support/Value.h"
+#include "Daemon/support/QRNError.h"
 #include "common/LogCapture.h"
 
 #include <gtest/gtest.h>
@@ -37,8 +37,10 @@ TEST(Value, EqualityAndHashAgree) {
     EXPECT_NE(Value("a"), Value(Value::Data{'a'}));
 
     UUID u = UUID::random();
-    Value a = Value::Dictionary{{"k", Value::Array{1, "two", u, Date{42}}}, {"d", Value::Data{1, 2}}};
-    Value b = Value::Dictionary{{"d", Value::Data{1, 2}}, {"k", Value::Array{1u, "two", u, Date{42}}}};
+    Value a =
+        Value::Dictionary{{"k", Value::Array{1, "two", u, Date{42}}}, {"d", Value::Data{1, 2}}};
+    Value b =
+        Value::Dictionary{{"d", Value::Data{1, 2}}, {"k", Value::Array{1u, "two", u, Date{42}}}};
     EXPECT_EQ(a, b);
     EXPECT_EQ(a.hash(), b.hash());
     std::unordered_set<Value> set{a, b, Value("x")};
@@ -63,9 +65,11 @@ TEST(Value, CopiesAreIndependent) {
 }
 
 TEST(Value, DescriptionIsDeterministicAndReadable) {
-    Value v = Value::Dictionary{{"b", Value::Array{1, "s"}}, {"a", true}, {"c", Value::Dictionary{}}};
-    EXPECT_EQ(v.description(), "{\n    \"a\" = true;\n    \"b\" = (\n        1,\n        \"s\"\n    );\n"
-                               "    \"c\" = {};\n}");
+    Value v =
+        Value::Dictionary{{"b", Value::Array{1, "s"}}, {"a", true}, {"c", Value::Dictionary{}}};
+    EXPECT_EQ(v.description(),
+              "{\n    \"a\" = true;\n    \"b\" = (\n        1,\n        \"s\"\n    );\n"
+              "    \"c\" = {};\n}");
     EXPECT_EQ(Value().description(), "(null)");
     EXPECT_EQ(Value(Value::Data{0xde, 0xad}).description(), "<dead>");
 }
@@ -87,8 +91,8 @@ TEST(UUID, ParseAndCanonicalForm) {
 TEST(QRNError, CarriesFunctionLineAndLogsOnce) {
     test::LogCapture capture;
     Error inner = QRN_POSIX_ERROR(ENOENT, "stat of [{}] failed: {}", "/x", "No such file");
-    Error outer = QRN_ERROR_UNDERLYING(inner, kQRNErrorMoveDirFailed, "Failed to move dir: {} to: {}",
-                                       "/a", "/b");
+    Error outer = QRN_ERROR_UNDERLYING(inner, kQRNErrorMoveDirFailed,
+                                       "Failed to move dir: {} to: {}", "/a", "/b");
     EXPECT_TRUE(inner.isPOSIX(ENOENT));
     EXPECT_TRUE(outer.isQRN(kQRNErrorMoveDirFailed));
     EXPECT_EQ(outer.qrnCode(99), 4u);
