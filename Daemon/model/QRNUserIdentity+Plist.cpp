@@ -6,6 +6,7 @@
 #include "Daemon/model/QRNUserIdentityCache.h"
 
 #include <limits>
+#include <utility>
 
 namespace quarn {
 
@@ -34,7 +35,8 @@ const std::string* optionalString(const Value& plist, std::string_view key) {
     return v ? v->asString() : nullptr;
 }
 
-CodeResult<QRNUserIdentityPtr> readVersion1(const Value& plist, QRNUserIdentityCache& cache) {
+// "posixUID" and "posixGID", both required.
+CodeResult<std::pair<std::uint32_t, std::uint32_t>> readIds(const Value& plist) {
     auto uid = readNumber(plist, "posixUID");
     if (!uid) {
         return QRN_CODE(uid.error());
@@ -43,23 +45,29 @@ CodeResult<QRNUserIdentityPtr> readVersion1(const Value& plist, QRNUserIdentityC
     if (!gid) {
         return QRN_CODE(gid.error());
     }
+    return std::pair{*uid, *gid};
+}
+
+CodeResult<QRNUserIdentityPtr> readVersion1(const Value& plist, QRNUserIdentityCache& cache) {
+    auto ids = readIds(plist);
+    if (!ids) {
+        return QRN_CODE(ids.error());
+    }
+    auto [uid, gid] = *ids;
     if (const std::string* persona = optionalString(plist, "personaIdentifier")) {
-        if (auto found = cache.userIdentityForPersonaUniqueString(*persona, *uid, *gid)) {
+        if (auto found = cache.userIdentityForPersonaUniqueString(*persona, uid, gid)) {
             return found;
         }
     }
-    return cache.userIdentityForPersonalPersonaWithUID(*uid, *gid);
+    return cache.userIdentityForPersonalPersonaWithUID(uid, gid);
 }
 
 CodeResult<QRNUserIdentityPtr> readVersion2(const Value& plist, QRNUserIdentityCache& cache) {
-    auto uid = readNumber(plist, "posixUID");
-    if (!uid) {
-        return QRN_CODE(uid.error());
+    auto ids = readIds(plist);
+    if (!ids) {
+        return QRN_CODE(ids.error());
     }
-    auto gid = readNumber(plist, "posixGID");
-    if (!gid) {
-        return QRN_CODE(gid.error());
-    }
+    auto [uid, gid] = *ids;
     auto type = readNumber(plist, "type");
     if (!type) {
         return QRN_CODE(type.error());
@@ -73,9 +81,9 @@ CodeResult<QRNUserIdentityPtr> readVersion2(const Value& plist, QRNUserIdentityC
     }
     const std::string* persona = optionalString(plist, "personaUniqueString");
     if (*type != kQRNPersonaTypeEnterprise || !persona) {
-        return cache.userIdentityForPersonalPersonaWithUID(*uid, *gid);
+        return cache.userIdentityForPersonalPersonaWithUID(uid, gid);
     }
-    QRNUserIdentityPtr found = cache.userIdentityForPersonaUniqueString(*persona, *uid, *gid);
+    QRNUserIdentityPtr found = cache.userIdentityForPersonaUniqueString(*persona, uid, gid);
     if (found && !found->isEnterprise()) {
         QRN_LOG_ERROR(LogCategory::Unspecified,
                       "Invalid user identity plist data. Expected {} to be enterprise, but it was "

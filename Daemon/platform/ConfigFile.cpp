@@ -1,6 +1,8 @@
 #include "Daemon/platform/ConfigFile.h"
 
+#include "Daemon/support/Descriptor.h"
 #include <cerrno>
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -8,22 +10,6 @@
 namespace quarn {
 
 namespace {
-
-class Descriptor {
-public:
-    explicit Descriptor(int fd) : fd_(fd) {}
-    ~Descriptor() {
-        if (fd_ >= 0) {
-            ::close(fd_);
-        }
-    }
-    Descriptor(const Descriptor&) = delete;
-    Descriptor& operator=(const Descriptor&) = delete;
-    int get() const { return fd_; }
-
-private:
-    int fd_;
-};
 
 // Reads to the end or one byte past `maxBytes`, whichever comes first.
 Expected<std::string, int> readAll(int fd, std::size_t maxBytes) {

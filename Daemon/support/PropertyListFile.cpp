@@ -3,6 +3,8 @@
 #include "Daemon/support/PropertyList.h"
 #include "Daemon/support/ProtectionClassAttribute.h"
 
+#include "Daemon/support/Descriptor.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -14,29 +16,6 @@
 namespace quarn {
 
 namespace {
-
-class Descriptor {
-public:
-    explicit Descriptor(int fd) : fd_(fd) {}
-    ~Descriptor() {
-        if (fd_ >= 0) {
-            ::close(fd_);
-        }
-    }
-    Descriptor(const Descriptor&) = delete;
-    Descriptor& operator=(const Descriptor&) = delete;
-    int get() const { return fd_; }
-    bool valid() const { return fd_ >= 0; }
-    // Closes now, reporting the error close reports (a failed delayed write).
-    int close() {
-        int result = ::close(fd_);
-        fd_ = -1;
-        return result == 0 ? 0 : errno;
-    }
-
-private:
-    int fd_;
-};
 
 Status writeAll(int fd, std::span<const std::uint8_t> bytes, const std::filesystem::path& path) {
     while (!bytes.empty()) {
