@@ -1,0 +1,37 @@
+#pragma once
+// Value <-> CBOR, the wire format of requests and replies. Pure functions of
+// bytes. UUIDs travel as tag 37 over 16 bytes, dates as tag 1 over the
+// seconds since 1970; dictionaries are maps with text keys.
+
+#include "Daemon/support/QRNError.h"
+#include "Daemon/support/Value.h"
+
+#include <cstddef>
+#include <cstdint>
+#include <span>
+#include <vector>
+
+namespace quarn {
+
+class CborCodec {
+public:
+    struct Limits {
+        std::size_t maxBytes = 1024 * 1024;
+        std::size_t maxNesting = 32; // arrays and maps inside each other
+    };
+
+    // A none Value encodes as CBOR null.
+    static std::vector<std::uint8_t> encode(const Value& value);
+
+    // Refuses, with a message saying why: malformed or truncated input,
+    // trailing bytes, input over the limits, declared lengths longer than
+    // the input, map keys that are not text, duplicate keys, tags other
+    // than 1 and 37, a tag 37 not over 16 bytes, indefinite lengths,
+    // undefined and other simple values. Null decodes as none.
+    static Result<Value> decode(std::span<const std::uint8_t> bytes, const Limits& limits);
+    static Result<Value> decode(std::span<const std::uint8_t> bytes) {
+        return decode(bytes, Limits{});
+    }
+};
+
+} // namespace quarn

@@ -1,0 +1,35 @@
+#pragma once
+// The code-signing identity of a process: which identifier, entitlements and
+// sandbox state its executable was registered with. On Linux the registry is
+// the root-owned directory "<root>/etc/quarnd/codesign.d" of property lists
+// with the keys "Program" (absolute path of the executable as the kernel
+// reports it), "SHA256" (optional hex digest of it), "Identifier",
+// "Entitlements" (dictionary) and "Sandboxed" (boolean).
+
+#include "Daemon/platform/IpcPeer.h"
+#include "Daemon/support/Value.h"
+
+#include <optional>
+#include <string>
+
+namespace quarn {
+
+struct CodeSigningInfo {
+    std::string identifier;
+    // None when the entry has no "Entitlements" or they are no dictionary.
+    std::optional<Value> entitlements;
+    bool sandboxed = false;
+};
+
+class CodeSigningRegistry {
+public:
+    virtual ~CodeSigningRegistry() = default;
+
+    // The entry of the process behind the token. None when the process has
+    // gone (or its pid now names another process: the start time differs),
+    // when its executable matches no entry, or when the entry's digest does
+    // not match the executable.
+    virtual std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) = 0;
+};
+
+} // namespace quarn

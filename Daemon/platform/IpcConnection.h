@@ -1,0 +1,46 @@
+#pragma once
+// One client connection of the request service. The daemon sets an event
+// handler and resumes the connection; from then on the handler hears each
+// message, one at a time and in arrival order (the next message is read
+// only after the handler has returned), and once the end of the connection.
+//
+// Abstract so that the request layer can be tested without sockets.
+
+#include "Daemon/platform/IpcPeer.h"
+#include "Daemon/support/Value.h"
+
+#include <functional>
+#include <memory>
+
+namespace quarn {
+
+class IpcConnection {
+public:
+    struct Event {
+        enum class Kind {
+            Message,     // a request dictionary
+            Invalidated, // the connection has ended (peer gone, bad frame, cancel)
+        };
+        Kind kind = Kind::Message;
+        Value body;                // the message, for Kind::Message
+        bool expectsReply = false; // the frame's reply flag
+    };
+    using EventHandler =
+        std::function<void(const std::shared_ptr<IpcConnection>& connection, const Event& event)>;
+
+    virtual ~IpcConnection() = default;
+
+    virtual const IpcPeer& peer() const = 0;
+
+    // Both before resume(); a connection never resumed reads nothing.
+    virtual void setEventHandler(EventHandler handler) = 0;
+    virtual void resume() = 0;
+
+    // Sends one reply frame. Safe from any thread, also after the handler
+    // returned (asynchronous replies); dropped once the connection ended.
+    virtual void sendReply(const Value& reply) = 0;
+    // Ends the connection; pending replies are dropped.
+    virtual void cancel() = 0;
+};
+
+} // namespace quarn

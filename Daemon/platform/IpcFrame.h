@@ -1,0 +1,36 @@
+#pragma once
+// The frame around every message of the request service: a 4-byte
+// little-endian length N, one flag byte (bit 0: the sender expects a reply;
+// the other bits must be clear), then N bytes. Shared by the daemon, the
+// client library and the tools.
+
+#include "Daemon/support/Value.h"
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <vector>
+
+namespace quarn {
+
+class IpcFrame {
+public:
+    static constexpr std::size_t kHeaderSize = 5;
+    static constexpr std::uint8_t kExpectsReply = 0x01;
+
+    struct Header {
+        std::uint32_t length = 0;
+        bool expectsReply = false;
+    };
+
+    static std::array<std::uint8_t, kHeaderSize> encodeHeader(std::uint32_t length,
+                                                              bool expectsReply);
+    // None when a reserved flag bit is set.
+    static std::optional<Header> decodeHeader(std::span<const std::uint8_t, kHeaderSize> bytes);
+    // Header and CBOR body of `message` in one buffer.
+    static std::vector<std::uint8_t> encodeMessage(const Value& message, bool expectsReply);
+};
+
+} // namespace quarn
