@@ -5,6 +5,7 @@
 // on different roots do not share it; like the real one it vanishes at
 // reboot.
 
+#include "Daemon/support/QRNDaemonContext.h"
 #include "Daemon/support/QRNError.h"
 
 #include <filesystem>
@@ -17,6 +18,8 @@ public:
     static constexpr const char* kBaseName = "quarnd.fb_check";
 
     explicit FirstBootMarker(const std::filesystem::path& rootPrefix);
+    // The marker of the context's root, so the context can make it on first use.
+    explicit FirstBootMarker(QRNDaemonContext& context) : FirstBootMarker(context.rootPrefix()) {}
 
     // "/quarnd.fb_check" on the root "/", "/quarnd.fb_check.<hash>" otherwise.
     const std::string& name() const { return name_; }
