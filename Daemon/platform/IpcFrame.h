@@ -31,6 +31,10 @@ public:
     static std::optional<Header> decodeHeader(std::span<const std::uint8_t, kHeaderSize> bytes);
     // Header and CBOR body of `message` in one buffer.
     static std::vector<std::uint8_t> encodeMessage(const Value& message, bool expectsReply);
+    // The same appended to `out`, so that a sender can reuse its buffer.
+    // False (and `out` unchanged) for a message too long for a frame.
+    static bool appendMessage(const Value& message, bool expectsReply,
+                              std::vector<std::uint8_t>& out);
 };
 
 } // namespace quarn
