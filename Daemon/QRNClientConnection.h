@@ -8,7 +8,9 @@
 // entitlement), +Create (create or look up a container), +Staging (building
 // a new container in staging), +Info (info values, metadata, listing and
 // deletion of existing containers), +DeathRow (death row, new directory
-// UUIDs), +Complete (running the request's queued commands).
+// UUIDs), +Complete (running the request's queued commands), +Personas
+// (the persona of a looked-up container), +Groups (group containers of an
+// owner), +Usage (disk usage).
 
 #include "Daemon/QRNClientIdentity.h"
 #include "Daemon/model/QRNContainerIdentity.h"
@@ -147,6 +149,37 @@ public:
 
     // Runs the commands queued during the request; may overwrite `error`.
     bool completeWithError(std::uint64_t& error);
+
+    // --- Personas, group containers, disk usage ---------------------------
+    // (+Personas, +Groups, +Usage)
+
+    // The user identity in which a container of the identifier lives: for a
+    // client without a specific persona and a data class, the one persona
+    // that holds the bundle (or its parent for plug-in and VPN data);
+    // otherwise, and whenever that choice is not clear, the client's own.
+    // Code 76 only without a client identity.
+    CodeResult<QRNUserIdentityPtr>
+    userIdentityForContainerIdentifier(const std::string& identifier,
+                                       std::uint64_t containerClass);
+    // The same choice for the owner of group containers, except that finding
+    // no persona for the owner fails with 76.
+    CodeResult<QRNUserIdentityPtr> userIdentityForGroupOwner(const std::string& owner);
+
+    using GroupContainers = std::map<std::string, QRNMetadataPtr, std::less<>>;
+    // The owner's group containers of the class (7 or 13) by group
+    // identifier, made when missing. Grants group lookups for the rest of the
+    // request. A group that cannot be made is logged and left out.
+    CodeResult<GroupContainers> groupContainersForOwnerIdentifier(const std::string& owner,
+                                                                  QRNUserIdentityPtr userIdentity,
+                                                                  std::uint64_t groupContainerClass);
+    // The group manager's answer, under the owner's identifier lock when asked.
+    CodeResult<std::vector<std::string>>
+    groupContainerIdentifiersForOwnerIdentifier(const std::string& owner,
+                                                std::uint64_t groupContainerClass,
+                                                bool useLocking);
+    // Bytes the container takes on disk.
+    CodeResult<std::uint64_t>
+    diskUsageWithContainerIdentity(const QRNContainerIdentityPtr& containerIdentity);
 
     // Process-wide serial queues: moves into death row, the deletion pass,
     // other background work.

@@ -34,6 +34,14 @@ QRNCodeSigningMapping::childBundleIdentifiersForParentIdentifier(std::string_vie
     return {};
 }
 
+std::optional<Value> QRNCodeSigningMapping::appGroupIdentifiersForIdentifier(std::string_view) {
+    return std::nullopt;
+}
+
+std::optional<Value> QRNCodeSigningMapping::systemGroupIdentifiersForIdentifier(std::string_view) {
+    return std::nullopt;
+}
+
 std::uint64_t QRNCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
     const std::string&, const std::shared_ptr<QRNCommandQueue>&) {
     // No records, so nothing to clear and no group loses a reference.
@@ -43,6 +51,10 @@ std::uint64_t QRNCodeSigningMapping::removeCodeSigningDictionariesForIdentifierA
 std::uint64_t QRNCodeSigningMapping::processCallerRegisteredEntitlements(
     const Value&, const std::string&, const std::shared_ptr<QRNCommandQueue>&) {
     return kQRNErrorNone;
+}
+
+Status QRNCodeSigningMapping::removeAllAdvanceCopiesWithError() {
+    return {};
 }
 
 } // namespace quarn

@@ -7,6 +7,7 @@
 // never anything to register or remove. The database-backed mapping keeps
 // these signatures and fills in the bodies.
 
+#include "Daemon/support/QRNError.h"
 #include "Daemon/support/Value.h"
 
 #include <cstdint>
@@ -24,6 +25,7 @@ class QRNDaemonContext;
 class QRNCodeSigningMapping {
 public:
     explicit QRNCodeSigningMapping(QRNDaemonContext& context);
+    virtual ~QRNCodeSigningMapping() = default;
     QRNCodeSigningMapping(const QRNCodeSigningMapping&) = delete;
     QRNCodeSigningMapping& operator=(const QRNCodeSigningMapping&) = delete;
 
@@ -35,6 +37,11 @@ public:
     bool identifierHasSystemContainer(std::string_view identifier);
     std::optional<std::string> parentIdentifierForChildIdentifier(std::string_view identifier);
     std::vector<std::string> childBundleIdentifiersForParentIdentifier(std::string_view identifier);
+    // The application and system group identifiers the identifier's stored
+    // entitlements name; none without a record. Virtual so that tests can
+    // stand in a mapping with records.
+    virtual std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view identifier);
+    virtual std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier);
 
     // Both answer a QRNErrorDomain code, 1 meaning success; deletions they
     // cause are inserted into `commandQueue`.
@@ -43,6 +50,8 @@ public:
     std::uint64_t
     processCallerRegisteredEntitlements(const Value& entitlements, const std::string& identifier,
                                         const std::shared_ptr<QRNCommandQueue>& commandQueue);
+    // Drops every record that is only an advance copy.
+    Status removeAllAdvanceCopiesWithError();
 };
 
 } // namespace quarn
