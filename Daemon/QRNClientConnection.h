@@ -10,7 +10,8 @@
 // deletion of existing containers), +DeathRow (death row, new directory
 // UUIDs), +Complete (running the request's queued commands), +Personas
 // (the persona of a looked-up container), +Groups (group containers of an
-// owner), +Usage (disk usage).
+// owner), +Usage (disk usage), +Boot (boot setup, restored system
+// containers), +Cleanup (boot cleanup passes).
 
 #include "Daemon/QRNClientIdentity.h"
 #include "Daemon/model/QRNContainerIdentity.h"
@@ -186,6 +187,29 @@ public:
     static std::shared_ptr<Queue> _sharedDeathrowQueue();
     static std::shared_ptr<Queue> _sharedDeathrowBackgroundQueue();
     static std::shared_ptr<Queue> _sharedBackgroundQueue();
+
+    // --- Boot setup and cleanup (+Boot, +Cleanup) -------------------------
+
+    // Every start, before requests are served.
+    void quarnManagerSetup();
+    // The first start after the first-boot marker went missing, before
+    // quarnManagerSetup.
+    void rebootQuarnManagerSetup();
+    // Background passes over staging, transient and orphaned data; each
+    // returns at once and calls its completion once, after all its steps.
+    void quarnManagerCleanupWithCompletion(std::function<void()> completion);
+    void rebootQuarnManagerCleanupWithCompletion(std::function<void()> completion);
+    // Sends the entries of a class directory that are no containers of the
+    // class (a bad name, no metadata file) to death row.
+    void _cleanupOrphanedDataForDirectories(const std::vector<std::filesystem::path>& urls,
+                                            std::uint64_t containerClass);
+    void _cleanupOprhanedCodeSigningMappingData();
+    // Merges one restored system container (class 12 or 13, named by its
+    // identifier) into the live container of that identifier.
+    CodeResult<void> _moveSystemContainerIntoPlace(const std::filesystem::path& url,
+                                                   std::uint64_t containerClass);
+    // Keeps a restored item that could not be merged for inspection.
+    void _moveFailedPathAside(const std::filesystem::path& url);
 
 private:
     struct CreateAttempt;

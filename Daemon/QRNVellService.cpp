@@ -1,0 +1,48 @@
+#include "Daemon/QRNVellService.h"
+
+#include "Daemon/QRNVellEvent.h"
+#include "Daemon/platform/IpcListener.h"
+#include "Daemon/platform/Paths.h"
+#include "Daemon/support/Log.h"
+#include "Daemon/support/Queue.h"
+
+#include <string>
+#include <utility>
+
+namespace quarn {
+
+QRNVellService::QRNVellService(std::shared_ptr<Queue> listenerQueue, std::size_t workerThreads)
+    : listenerQueue_(std::move(listenerQueue)), workerThreads_(workerThreads) {}
+
+QRNVellService::~QRNVellService() = default;
+
+bool QRNVellService::start(const Paths& paths) {
+    IpcListener::Options options;
+    options.socketPath = paths.runDirectory() / (std::string(kServiceName) + ".sock");
+    options.inheritedFd = IpcListener::socketFromSystemd(kServiceName);
+    options.workerThreads = workerThreads_;
+    listener_ = std::make_unique<IpcListener>(std::move(options));
+    Status started =
+        listener_->start([queue = listenerQueue_](std::shared_ptr<IpcConnection> connection) {
+            // Behind initialisation on the listener queue.
+            queue->async([connection = std::move(connection)] {
+                connection->setEventHandler(QRNProcessVellEvent);
+                // Quality-of-service classes have no meaning here.
+                connection->resume();
+            });
+        });
+    if (!started) {
+        QRN_LOG_ERROR(LogCategory::Vell, "unable to start vell service!");
+        listener_.reset();
+        return false;
+    }
+    return true;
+}
+
+void QRNVellService::stopAccepting() {
+    if (listener_) {
+        listener_->stopAccepting();
+    }
+}
+
+} // namespace quarn
