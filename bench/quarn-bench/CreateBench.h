@@ -1,0 +1,39 @@
+#pragma once
+// Creation of new app data containers through the daemon (command 0,
+// creation on, one client), against the bare system calls of the same work
+// done by this tool on the same file system: make the staging directory and
+// the class's subdirectories with their modes, write a metadata file of the
+// same size, rename the directory into place.
+
+#include "BenchOptions.h"
+#include "DaemonRunner.h"
+#include "LatencySamples.h"
+#include "LoadRoot.h"
+#include "ResultTable.h"
+
+#include <cstdint>
+#include <filesystem>
+#include <vector>
+
+namespace quarn::loadbench {
+
+class CreateBench {
+public:
+    CreateBench(const BenchOptions& options, DaemonRunner& daemon, LoadRoot& root);
+    void run(ResultTable& table);
+
+private:
+    // Each returns the total time taken, in seconds.
+    double createWithDaemon(int count, LatencySamples& samples);
+    double createBare(int count, LatencySamples& samples);
+    void createOneBare(const std::filesystem::path& name) const;
+
+    const BenchOptions& options_;
+    DaemonRunner& daemon_;
+    std::filesystem::path staging_;
+    std::filesystem::path live_;
+    std::vector<std::uint8_t> metadata_;
+    int made_ = 0;
+};
+
+} // namespace quarn::loadbench

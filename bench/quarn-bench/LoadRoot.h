@@ -1,0 +1,39 @@
+#pragma once
+// The temporary root the daemon under test runs on: its own accounts
+// ("mobile" 501/501 with home "/private/var/mobile", "systemusers",
+// "_installd" 33), an os-release, and a code-signing registry entry that
+// gives this tool's executable full access. A daemon context on the same
+// root, current in this process, lets the tool lay out containers exactly
+// where and how the daemon would. Removed, with the root's first-boot
+// marker, when the tool ends.
+
+#include "Daemon/support/QRNDaemonContext.h"
+
+#include <filesystem>
+#include <memory>
+
+namespace quarn::loadbench {
+
+class LoadRoot {
+public:
+    // A fresh root in a new directory below `base`.
+    explicit LoadRoot(const std::filesystem::path& base);
+    ~LoadRoot();
+    LoadRoot(const LoadRoot&) = delete;
+    LoadRoot& operator=(const LoadRoot&) = delete;
+
+    const std::filesystem::path& path() const { return root_; }
+    QRNDaemonContext& context() { return *context_; }
+    std::filesystem::path socketPath() const;
+    // Lines in the notification file of `name` (one per post).
+    std::size_t notificationCount(const char* name) const;
+
+private:
+    void writeAccounts() const;
+    void writeRegistryEntry() const;
+
+    std::filesystem::path root_;
+    std::shared_ptr<QRNDaemonContext> context_;
+};
+
+} // namespace quarn::loadbench
