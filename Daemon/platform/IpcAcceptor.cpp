@@ -1,0 +1,115 @@
+#include "Daemon/platform/IpcAcceptor.h"
+
+#include "Daemon/support/Log.h"
+
+#include <cerrno>
+#include <chrono>
+#include <exception>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace quarn {
+
+namespace {
+
+// Out of descriptors or memory the listening socket stays readable; waiting
+// a little keeps the pool from spinning on it.
+constexpr std::chrono::milliseconds kBackOff{100};
+
+bool isResourceShortage(const asio::error_code& error) {
+    if (error.category() != asio::system_category()) {
+        return false;
+    }
+    const int err = error.value();
+    return err == EMFILE || err == ENFILE || err == ENOBUFS || err == ENOMEM;
+}
+
+} // namespace
+
+IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
+                         IpcListener::ConnectionHandler handler)
+    : core_(std::move(core)), limits_(limits), handler_(std::move(handler)), acceptor_(core_->io()),
+      backOffTimer_(core_->io()) {}
+
+Status IpcAcceptor::adopt(int listeningFd) {
+    std::lock_guard lock(mutex_);
+    asio::error_code error;
+    acceptor_.assign(asio::local::stream_protocol(), listeningFd, error);
+    if (error) {
+        ::close(listeningFd);
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(error.value(), "Cannot listen on descriptor {}: {}",
+                                              listeningFd, error.message()));
+    }
+    return {};
+}
+
+void IpcAcceptor::start() {
+    acceptNext();
+}
+
+void IpcAcceptor::close() {
+    std::lock_guard lock(mutex_);
+    closed_ = true;
+    asio::error_code ignored;
+    acceptor_.close(ignored);
+    backOffTimer_.cancel();
+}
+
+void IpcAcceptor::acceptNext() {
+    std::lock_guard lock(mutex_);
+    if (closed_) {
+        return;
+    }
+    acceptor_.async_accept(asio::make_strand(core_->io()),
+                           [self = shared_from_this()](const asio::error_code& error,
+                                                       AsioIpcConnection::Socket socket) {
+                               self->onAccepted(error, std::move(socket));
+                           });
+}
+
+void IpcAcceptor::onAccepted(const asio::error_code& error, AsioIpcConnection::Socket socket) {
+    if (error == asio::error::operation_aborted) {
+        return;
+    }
+    if (error) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Accepting a connection failed: {}", error.message());
+        return isResourceShortage(error) ? backOff() : acceptNext();
+    }
+    handOver(std::move(socket));
+    acceptNext();
+}
+
+void IpcAcceptor::handOver(AsioIpcConnection::Socket socket) {
+    ::fcntl(socket.native_handle(), F_SETFD, FD_CLOEXEC);
+    auto peer = IpcPeer::fromSocket(socket.native_handle());
+    if (!peer) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection whose client is unknown: {}",
+                      peer.error().message);
+        return;
+    }
+    const pid_t pid = peer->pid();
+    auto connection =
+        std::make_shared<AsioIpcConnection>(core_, std::move(socket), std::move(*peer), limits_);
+    const std::size_t open = core_->add(connection);
+    QRN_LOG_DEBUG(LogCategory::Vell, "Accepted a connection of pid {}; {} open", pid, open);
+    try {
+        handler_(std::move(connection));
+    } catch (const std::exception& e) {
+        QRN_LOG_FAULT(LogCategory::Vell, "The connection handler threw: {}", e.what());
+    }
+}
+
+void IpcAcceptor::backOff() {
+    std::lock_guard lock(mutex_);
+    if (closed_) {
+        return;
+    }
+    backOffTimer_.expires_after(kBackOff);
+    backOffTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+        if (!error) {
+            self->acceptNext();
+        }
+    });
+}
+
+} // namespace quarn
