@@ -68,8 +68,8 @@ void IpcAcceptor::acceptNext() {
 }
 
 void IpcAcceptor::onAccepted(const asio::error_code& error, AsioIpcConnection::Socket socket) {
-    if (error == asio::error::operation_aborted) {
-        return;
+    if (error == asio::error::operation_aborted || error == asio::error::bad_descriptor) {
+        return; // closed
     }
     if (error) {
         QRN_LOG_ERROR(LogCategory::Vell, "Accepting a connection failed: {}", error.message());

@@ -42,8 +42,15 @@ Status UnixSocketFile::makeParent(const std::filesystem::path& directory) {
         missing.push_back(at);
     }
     for (auto it = missing.rbegin(); it != missing.rend(); ++it) {
-        if (::mkdir(it->c_str(), kDirectoryMode) != 0 && errno != EEXIST) {
+        if (::mkdir(it->c_str(), kDirectoryMode) != 0) {
+            if (errno == EEXIST) {
+                continue;
+            }
             return QRN_UNEXPECTED(posixError(errno, "cannot make", *it));
+        }
+        // Whatever the umask, clients must reach the socket inside.
+        if (::chmod(it->c_str(), kDirectoryMode) != 0) {
+            return QRN_UNEXPECTED(posixError(errno, "cannot open up", *it));
         }
     }
     return {};

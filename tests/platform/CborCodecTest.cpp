@@ -132,6 +132,8 @@ TEST(CborCodecTest, MalformedInputIsRefusedForItsReason) {
         {"array of 9 in 8 bytes", bytes({0x89, 1, 2, 3, 4, 5, 6, 7}), "declares"},
         {"inner array longer than the rest",
          bytes({0x82, 0x83, 0x01, 0x02, 0x03, 0x84, 0x01, 0x02, 0x03}), "declares"},
+        {"array and its siblings longer than the rest", bytes({0x85, 0x84, 0, 0, 0, 0}),
+         "declares"},
         {"byte string of 2^40", bytes({0x5b, 0, 0, 1, 0, 0, 0, 0, 0, 0x00}), "ends inside"},
         {"text of 2^32-1", bytes({0x7a, 0xff, 0xff, 0xff, 0xff, 'a'}), "ends inside"},
         {"integer key", bytes({0xa1, 0x01, 0x02}), "not text"},

@@ -31,8 +31,26 @@ mode_t modeOf(const std::filesystem::path& path) {
 
 } // namespace
 
+TEST(IpcFrameTest, HeaderIsALittleEndianLengthAndOneFlagBit) {
+    const auto header = IpcFrame::encodeHeader(0x01020304, true);
+    EXPECT_EQ(header, (std::array<std::uint8_t, 5>{0x04, 0x03, 0x02, 0x01, 0x01}));
+    const auto decoded = IpcFrame::decodeHeader(header);
+    ASSERT_TRUE(decoded);
+    EXPECT_EQ(decoded->length, 0x01020304u);
+    EXPECT_TRUE(decoded->expectsReply);
+    EXPECT_FALSE(IpcFrame::decodeHeader(std::array<std::uint8_t, 5>{1, 0, 0, 0, 0x80}));
+
+    const auto frame = IpcFrame::encodeMessage(message(1), false);
+    EXPECT_EQ(frame.size(), IpcFrame::kHeaderSize + CborCodec::encode(message(1)).size());
+    EXPECT_EQ(frame[0], frame.size() - IpcFrame::kHeaderSize);
+    EXPECT_EQ(frame[4], 0);
+}
+
 TEST_F(IpcListenerTest, SocketFileIsMadeOpenToAllReplacedWhenStaleAndKeptWhenLive) {
-    ASSERT_TRUE(start(echo));
+    const mode_t umask = ::umask(077); // modes hold whatever the daemon's umask
+    const bool started = bool(start(echo));
+    ::umask(umask);
+    ASSERT_TRUE(started);
     EXPECT_EQ(modeOf(socketPath()), 0666u);
     EXPECT_EQ(modeOf(socketPath().parent_path()), 0755u);
     listener_->stop(); // leaves the socket file behind, as a crash would
