@@ -1,13 +1,31 @@
 #include "Daemon/QRNClientIdentity.h"
 
+#include "Daemon/model/QRNPlatformConstants.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
+#include "Daemon/platform/IpcConnection.h"
 #include "Daemon/support/Log.h"
+#include "Daemon/support/QRNDaemonContext.h"
 
 #include <fmt/format.h>
 
+#include <cerrno>
+#include <mutex>
 #include <utility>
 
 namespace quarn {
+
+namespace {
+
+// The installer service's last identity, one per daemon context. It sends
+// many requests in a row; reusing its identity saves a registry lookup each.
+struct InstallerIdentityMemory {
+    // Guards identity: requests of different connections make identities
+    // concurrently, and each may read or replace it.
+    std::mutex mutex;
+    QRNClientIdentityPtr identity;
+};
+
+} // namespace
 
 QRNClientIdentity::QRNClientIdentity(std::string bundleIdentifier, std::uint32_t uid,
                                      std::uint32_t gid, std::int32_t pid,
@@ -76,6 +94,68 @@ std::string QRNClientIdentity::description() const {
                        userIdentity_->description(), posixUID_, posixGID_,
                        static_cast<std::uint32_t>(posixPID_), sandboxed_ ? 1 : 0,
                        entitlements_.description());
+}
+
+Result<CodeSigningInfo>
+QRNClientIdentity::_codeSigningInfoFromAuditToken(const AuditToken& auditToken) {
+    auto& registry = QRNDaemonContext::current().instance<CodeSigningRegistry>();
+    std::optional<CodeSigningInfo> info = registry.infoForAuditToken(auditToken);
+    if (!info) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(ESRCH, "No code-signing entry for pid {}",
+                                              IpcPeer::fieldsOfAuditToken(auditToken).pid));
+    }
+    return std::move(*info);
+}
+
+Result<std::string>
+QRNClientIdentity::_bundleIdentifierFromAuditToken(const AuditToken& auditToken) {
+    auto info = _codeSigningInfoFromAuditToken(auditToken);
+    if (!info) {
+        return QRN_UNEXPECTED(info.error());
+    }
+    return std::move(info->identifier);
+}
+
+QRNClientIdentityPtr
+QRNClientIdentity::clientIdentityWithVellConnection(const IpcConnection& connection) {
+    const IpcPeer& peer = connection.peer();
+    const auto pid = static_cast<std::int32_t>(peer.pid());
+    const AuditToken& token = peer.auditToken();
+    QRNUserIdentityPtr userIdentity =
+        QRNUserIdentitySharedCache::sharedCache().userIdentityForCurrentContextWithUID(peer.uid(),
+                                                                                       peer.gid());
+    // One registry lookup answers identifier, entitlements and sandbox state.
+    Result<CodeSigningInfo> info = _codeSigningInfoFromAuditToken(token);
+    const bool isInstaller = info && info->identifier == QRNPlatformConstants::kInstallerIdentifier;
+    auto& installer = QRNDaemonContext::current().instance<InstallerIdentityMemory>();
+    if (isInstaller) {
+        std::lock_guard guard(installer.mutex);
+        if (installer.identity && installer.identity->auditToken() == token) {
+            return installer.identity;
+        }
+    }
+    Value entitlements = Value::dictionary();
+    if (info && info->entitlements && info->entitlements->isDictionary()) {
+        entitlements = *info->entitlements;
+    } else {
+        QRN_LOG_ERROR(LogCategory::Vell, "Missing or malformed entitlements for pid {}", pid);
+    }
+    QRNClientIdentityPtr identity;
+    if (info) {
+        identity = initWithBundleIdentifier(info->identifier, peer.uid(), peer.gid(), pid,
+                                            std::move(userIdentity), std::move(entitlements),
+                                            info->sandboxed, token, false);
+    } else {
+        QRN_LOG_ERROR(LogCategory::Vell, "Failed to copy signing ID for pid {} : {}", pid,
+                      info.error().description());
+    }
+    if (isInstaller) {
+        std::lock_guard guard(installer.mutex);
+        installer.identity = identity;
+    }
+    QRN_LOG_INFO(LogCategory::Vell, "[{}] Vell client identity: {}", __func__,
+                 identity ? identity->description() : "(null)");
+    return identity;
 }
 
 } // namespace quarn

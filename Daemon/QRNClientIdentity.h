@@ -5,6 +5,8 @@
 // and upcall work uses privileged identities made without a connection.
 
 #include "Daemon/model/QRNUserIdentity.h"
+#include "Daemon/platform/CodeSigningRegistry.h"
+#include "Daemon/support/QRNError.h"
 #include "Daemon/support/Value.h"
 
 #include <sys/types.h>
@@ -17,6 +19,7 @@
 
 namespace quarn {
 
+class IpcConnection;
 class QRNClientIdentity;
 using QRNClientIdentityPtr = std::shared_ptr<const QRNClientIdentity>;
 
@@ -43,6 +46,14 @@ public:
     // The privileged identity of the default user identity, not the kernel.
     static QRNClientIdentityPtr anonymousPrivilegedClientIdentity();
 
+    // The identity of the process on the other end of `connection`, from its
+    // credentials and its code-signing registry entry; nullptr when it has
+    // no code-signing identifier or no user identity. The installer service
+    // gets the same object back for as long as its audit token is the same.
+    static QRNClientIdentityPtr clientIdentityWithVellConnection(const IpcConnection& connection);
+    // The code-signing identifier of the process behind `auditToken`.
+    static Result<std::string> _bundleIdentifierFromAuditToken(const AuditToken& auditToken);
+
     const std::string& bundleIdentifier() const { return bundleIdentifier_; }
     std::uint32_t posixUID() const { return posixUID_; }
     std::uint32_t posixGID() const { return posixGID_; }
@@ -62,6 +73,8 @@ public:
     std::string description() const;
 
 private:
+    static Result<CodeSigningInfo> _codeSigningInfoFromAuditToken(const AuditToken& auditToken);
+
     QRNClientIdentity(std::string bundleIdentifier, std::uint32_t uid, std::uint32_t gid,
                       std::int32_t pid, QRNUserIdentityPtr userIdentity, Value entitlements,
                       bool sandboxed, const AuditToken& auditToken, bool kernel);

@@ -1,12 +1,15 @@
 #include "Daemon/platform/LinuxPlatform.h"
 
 #include "Daemon/platform/ContainerLibrary.h"
+#include "Daemon/platform/FirstBootMarker.h"
 #include "Daemon/platform/LinuxAccounts.h"
+#include "Daemon/platform/LinuxCodeSigningRegistry.h"
 #include "Daemon/platform/LinuxFeatures.h"
 #include "Daemon/platform/LinuxHostConfig.h"
 #include "Daemon/platform/LinuxLockState.h"
 #include "Daemon/platform/LinuxNotifications.h"
 #include "Daemon/platform/LinuxOsVariant.h"
+#include "Daemon/platform/LinuxSandboxExtensions.h"
 #include "Daemon/platform/Paths.h"
 #include "Daemon/platform/SandboxKernel.h"
 #include "Daemon/support/QRNDaemonContext.h"
@@ -26,6 +29,9 @@ void installLinuxPlatform(QRNDaemonContext& context) {
     context.install<ContainerLibrary>(std::make_shared<LinuxContainerLibrary>());
     context.install<SandboxKernel>(std::make_shared<InMemorySandboxKernel>());
     context.install<Notifications>(std::make_shared<LinuxNotifications>(paths));
+    context.install<CodeSigningRegistry>(std::make_shared<LinuxCodeSigningRegistry>(paths));
+    context.install<SandboxExtensions>(std::make_shared<LinuxSandboxExtensions>(paths));
+    context.install(std::make_shared<FirstBootMarker>(paths.rootPrefix()));
 }
 
 } // namespace quarn

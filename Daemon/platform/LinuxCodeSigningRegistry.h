@@ -1,0 +1,50 @@
+#pragma once
+// CodeSigningRegistry over "<root>/etc/quarnd/codesign.d". A process is
+// matched by the executable the kernel reports for it ("/proc/<pid>/exe" of
+// the host, whatever the root prefix), and, when the entry carries a digest,
+// by the SHA-256 of that very file. The directory is reread when it changes;
+// the check is a non-blocking poll at each lookup.
+
+#include "Daemon/platform/CodeSigningRegistry.h"
+#include "Daemon/platform/CodeSigningRegistryLoader.h"
+#include "Daemon/platform/DirectoryChangeMonitor.h"
+#include "Daemon/platform/ExecutableDigestCache.h"
+#include "Daemon/platform/Paths.h"
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+
+namespace quarn {
+
+class LinuxCodeSigningRegistry final : public CodeSigningRegistry {
+public:
+    explicit LinuxCodeSigningRegistry(const Paths& paths);
+
+    std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) override;
+
+    const std::filesystem::path& directory() const { return directory_; }
+
+private:
+    using TablePtr = std::shared_ptr<const CodeSigningRegistryLoader::Table>;
+
+    // The current table, reread first when the directory changed.
+    TablePtr currentTable();
+    bool digestMatches(const CodeSigningRegistryEntry& entry, pid_t pid, std::uint32_t startTime);
+
+    std::filesystem::path directory_;
+    ExecutableDigestCache digests_;
+
+    // Serialises rereading: guards monitor_'s consumption and the reads of
+    // the directory, so one change is read once.
+    std::mutex reloadMutex_;
+    DirectoryChangeMonitor monitor_;
+    // Set once the first read is in table_; until then lookups wait for it.
+    std::atomic<bool> loaded_{false};
+
+    // Guards table_ (swapped by a reload, copied out by lookups).
+    std::mutex tableMutex_;
+    TablePtr table_;
+};
+
+} // namespace quarn

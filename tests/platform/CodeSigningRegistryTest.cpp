@@ -1,0 +1,231 @@
+#include "Daemon/platform/CodeSigningRegistryLoader.h"
+#include "Daemon/platform/LinuxCodeSigningRegistry.h"
+#include "Daemon/support/Descriptor.h"
+#include "Daemon/support/PropertyList.h"
+
+#include "common/LogCapture.h"
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+#include <sodium.h>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <thread>
+#include <vector>
+
+using namespace quarn;
+
+namespace {
+
+std::string hexOf(const ExecutableDigestCache::Digest& digest) {
+    char hex[2 * digest.size() + 1];
+    sodium_bin2hex(hex, sizeof hex, digest.data(), digest.size());
+    return hex;
+}
+
+std::string sha256Hex(const std::string& bytes) {
+    ExecutableDigestCache::Digest digest;
+    crypto_hash_sha256(digest.data(), reinterpret_cast<const unsigned char*>(bytes.data()),
+                       bytes.size());
+    return hexOf(digest);
+}
+
+std::string fileSha256Hex(const std::filesystem::path& path) {
+    crypto_hash_sha256_state state;
+    crypto_hash_sha256_init(&state);
+    std::ifstream in(path, std::ios::binary);
+    std::vector<char> chunk(1 << 20);
+    while (in.read(chunk.data(), static_cast<std::streamsize>(chunk.size())) || in.gcount() > 0) {
+        crypto_hash_sha256_update(&state, reinterpret_cast<const unsigned char*>(chunk.data()),
+                                  static_cast<unsigned long long>(in.gcount()));
+    }
+    ExecutableDigestCache::Digest digest;
+    crypto_hash_sha256_final(&state, digest.data());
+    return hexOf(digest);
+}
+
+class CodeSigningRegistryTest : public quarn::test::TempRootTest {
+protected:
+    const std::string self_ = std::filesystem::read_symlink("/proc/self/exe").string();
+    Paths paths_{root_.path()};
+    std::filesystem::path directory_ = paths_.configDirectory() / "codesign.d";
+
+    static IpcPeer::AuditToken ownToken() {
+        auto peer = IpcPeer::fromPID(::getpid());
+        EXPECT_TRUE(peer);
+        return peer ? peer->auditToken() : IpcPeer::AuditToken{};
+    }
+
+    static Value entry(std::string program, std::string identifier) {
+        Value plist = Value::dictionary();
+        plist.set("Program", std::move(program));
+        plist.set("Identifier", std::move(identifier));
+        return plist;
+    }
+
+    void write(const std::string& name, const Value& plist) const {
+        std::filesystem::create_directories(directory_);
+        ASSERT_TRUE(QRN_writeToURL(plist, directory_ / name, {.atomic = true}));
+    }
+};
+
+} // namespace
+
+TEST_F(CodeSigningRegistryTest, MatchesTheRunningExecutableAndChecksItsDigest) {
+    LinuxCodeSigningRegistry registry(paths_);
+    Value plist = entry(self_, "com.orvex.tests");
+    plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
+    plist.set("Sandboxed", true);
+    write("self.plist", plist);
+    auto info = registry.infoForAuditToken(ownToken());
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->identifier, "com.orvex.tests");
+    EXPECT_TRUE(info->sandboxed);
+    ASSERT_TRUE(info->entitlements);
+    EXPECT_EQ(*info->entitlements->get("com.orvex.private.Quarn.allowed"), Value(true));
+
+    plist.set("SHA256", fileSha256Hex("/proc/self/exe"));
+    write("self.plist", plist);
+    EXPECT_TRUE(registry.infoForAuditToken(ownToken()));
+
+    quarn::test::LogCapture log;
+    plist.set("SHA256", std::string(64, 'a'));
+    write("self.plist", plist);
+    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
+    EXPECT_TRUE(log.contains("does not match the digest of code-signing entry self.plist"))
+        << log.all();
+}
+
+TEST_F(CodeSigningRegistryTest, TokenOfAnotherProcessIncarnationGivesNone) {
+    LinuxCodeSigningRegistry registry(paths_);
+    write("self.plist", entry(self_, "com.orvex.tests"));
+    IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(ownToken());
+    ASSERT_TRUE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
+    fields.startTime += 1;
+    EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
+    fields.pid = 0;
+    EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
+}
+
+TEST_F(CodeSigningRegistryTest, FollowsTheDirectoryAppearingAndEntriesComingAndGoing) {
+    LinuxCodeSigningRegistry registry(paths_);
+    EXPECT_FALSE(registry.infoForAuditToken(ownToken())) << "no directory yet";
+
+    write("self.plist", entry(self_, "com.orvex.first"));
+    auto info = registry.infoForAuditToken(ownToken());
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->identifier, "com.orvex.first");
+
+    std::filesystem::remove(directory_ / "self.plist");
+    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
+
+    write("again.plist", entry(self_, "com.orvex.second"));
+    info = registry.infoForAuditToken(ownToken());
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->identifier, "com.orvex.second");
+
+    // The whole directory removed and made again.
+    std::filesystem::remove_all(directory_);
+    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
+    write("third.plist", entry(self_, "com.orvex.third"));
+    info = registry.infoForAuditToken(ownToken());
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->identifier, "com.orvex.third");
+}
+
+TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
+    auto with = [](Value plist, const char* key, Value value) {
+        plist.set(key, std::move(value));
+        return plist;
+    };
+    const Value good = entry("/bin/good", "com.orvex.good");
+    write("a-relative.plist", entry("bin/x", "com.orvex.x"));
+    write("b-no-identifier.plist", entry("/bin/b", ""));
+    write("c-short-digest.plist", with(entry("/bin/c", "c"), "SHA256", std::string(63, 'a')));
+    write("d-bad-digest.plist", with(entry("/bin/d", "d"), "SHA256", std::string(64, 'g')));
+    write("e-entitlements.plist", with(entry("/bin/e", "e"), "Entitlements", Value::array()));
+    write("f-sandboxed.plist", with(entry("/bin/f", "f"), "Sandboxed", "true"));
+    write("g-group-writable.plist", entry("/bin/g", "g"));
+    ::chmod((directory_ / "g-group-writable.plist").c_str(), 0664);
+    write("h-not-root.plist", entry("/bin/h", "h"));
+    ASSERT_EQ(::chown((directory_ / "h-not-root.plist").c_str(), 501, 501), 0);
+    std::ofstream(directory_ / "i-garbage.plist") << "<plist><dict><key>Program";
+    write(".hidden.plist", entry("/bin/hidden", "hidden"));
+    write("good.txt", entry("/bin/txt", "txt"));
+    write("good-1.plist", with(good, "Identifier", "com.orvex.replaced"));
+    write("good-2.plist", good);
+    std::filesystem::create_symlink(directory_ / "good-2.plist", directory_ / "j-link.plist");
+
+    quarn::test::LogCapture log;
+    const auto table = CodeSigningRegistryLoader::load(directory_, true);
+    ASSERT_EQ(table.size(), 1u) << log.all();
+    EXPECT_EQ(table.at("/bin/good")->info.identifier, "com.orvex.good");
+    for (const char* name :
+         {"a-relative", "b-no-identifier", "c-short-digest", "d-bad-digest", "e-entitlements",
+          "f-sandboxed", "g-group-writable", "h-not-root", "i-garbage", "j-link"}) {
+        EXPECT_TRUE(log.contains((directory_ / name).string() + ".plist")) << name;
+    }
+    EXPECT_TRUE(log.contains("good-2.plist replaces good-1.plist")) << log.all();
+
+    // Not as root, ownership and mode do not matter.
+    EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
+}
+
+TEST_F(CodeSigningRegistryTest, ConcurrentLookupsSeeOneOfTheVersions) {
+    LinuxCodeSigningRegistry registry(paths_);
+    write("self.plist", entry(self_, "com.orvex.v0"));
+    const IpcPeer::AuditToken token = ownToken();
+    std::atomic<bool> done{false};
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> readers;
+    for (int i = 0; i < 4; ++i) {
+        readers.emplace_back([&] {
+            while (!done.load()) {
+                auto info = registry.infoForAuditToken(token);
+                if (!info || info->identifier.rfind("com.orvex.v", 0) != 0) {
+                    wrong.fetch_add(1);
+                }
+            }
+        });
+    }
+    for (int version = 1; version <= 50; ++version) {
+        write("self.plist", entry(self_, "com.orvex.v" + std::to_string(version)));
+    }
+    done.store(true);
+    for (auto& reader : readers) {
+        reader.join();
+    }
+    EXPECT_EQ(wrong.load(), 0);
+    EXPECT_EQ(registry.infoForAuditToken(token)->identifier, "com.orvex.v50");
+}
+
+TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
+    quarn::test::TempRoot root;
+    const auto file = root.path() / "program";
+    std::ofstream(file, std::ios::binary) << "first version";
+    ExecutableDigestCache cache;
+    auto digestNow = [&] {
+        Descriptor fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
+        auto digest = cache.digestOf(fd.get());
+        EXPECT_TRUE(digest);
+        return digest ? hexOf(*digest) : std::string();
+    };
+    EXPECT_EQ(digestNow(), sha256Hex("first version"));
+    EXPECT_EQ(digestNow(), sha256Hex("first version"));
+
+    // Same size, mtime put back: still seen as changed.
+    struct stat before {};
+    ASSERT_EQ(::stat(file.c_str(), &before), 0);
+    std::ofstream(file, std::ios::binary | std::ios::trunc) << "other version";
+    const timespec times[2] = {before.st_atim, before.st_mtim};
+    ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
+    EXPECT_EQ(digestNow(), sha256Hex("other version"));
+
+    std::ofstream(file, std::ios::binary | std::ios::app) << " grown";
+    EXPECT_EQ(digestNow(), sha256Hex("other version grown"));
+}
