@@ -22,42 +22,38 @@ int listeningSocketAt(const std::filesystem::path& path) {
     return fd;
 }
 
-// Puts descriptors where systemd would (3 and up) with LISTEN_* naming
-// them, and puts everything back afterwards.
+// Puts `fds` where systemd would (3 and up), named by LISTEN_* variables,
+// and puts back what was there afterwards.
 class SystemdHandOver {
 public:
     SystemdHandOver(const std::vector<int>& fds, const char* names) {
-        // Copies first: a source may sit where another one goes.
-        std::vector<int> sources;
-        for (int fd : fds) {
-            sources.push_back(::fcntl(fd, F_DUPFD_CLOEXEC, 200));
+        for (int fd : fds) { // copies first: a source may sit at a target
+            sources_.push_back(::fcntl(fd, F_DUPFD_CLOEXEC, 200));
         }
-        for (std::size_t i = 0; i < sources.size(); ++i) {
-            const int target = 3 + static_cast<int>(i);
-            saved_.emplace_back(target, ::fcntl(target, F_DUPFD_CLOEXEC, 200));
-            ::dup2(sources[i], target);
-            ::close(sources[i]);
+        for (std::size_t i = 0; i < fds.size(); ++i) {
+            saved_.push_back(::fcntl(kFirst + static_cast<int>(i), F_DUPFD_CLOEXEC, 200));
+            ::dup2(sources_[i], kFirst + static_cast<int>(i));
         }
         ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
         ::setenv("LISTEN_FDS", std::to_string(fds.size()).c_str(), 1);
         ::setenv("LISTEN_FDNAMES", names, 1);
     }
     ~SystemdHandOver() {
-        ::unsetenv("LISTEN_PID");
-        ::unsetenv("LISTEN_FDS");
-        ::unsetenv("LISTEN_FDNAMES");
-        for (const auto& [target, copy] : saved_) {
-            if (copy >= 0) {
-                ::dup2(copy, target);
-                ::close(copy);
-            } else {
-                ::close(target);
-            }
+        for (const char* name : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) {
+            ::unsetenv(name);
+        }
+        for (std::size_t i = 0; i < saved_.size(); ++i) {
+            saved_[i] >= 0 ? ::dup2(saved_[i], kFirst + static_cast<int>(i))
+                           : ::close(kFirst + static_cast<int>(i));
+            ::close(saved_[i]);
+            ::close(sources_[i]);
         }
     }
 
 private:
-    std::vector<std::pair<int, int>> saved_; // target, copy of what was there (or -1)
+    static constexpr int kFirst = 3;
+    std::vector<int> sources_;
+    std::vector<int> saved_; // what was at each target, or -1
 };
 
 } // namespace

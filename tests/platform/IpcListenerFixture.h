@@ -26,7 +26,7 @@ protected:
 
     static void echo(const std::shared_ptr<IpcConnection>& connection, const Event& event) {
         if (event.expectsReply) {
-            connection->sendReply(Value(Value::Dictionary{{"Echo", event.body}}));
+            connection->sendReply(event.body);
         }
     }
 
@@ -89,15 +89,12 @@ protected:
         std::lock_guard lock(mutex_);
         return index < accepted_.size() ? accepted_[index] : nullptr;
     }
-    int invalidations(std::size_t index) {
+    int invalidations(std::size_t index) { return count(invalidations_, index); }
+    int messages(std::size_t index) { return count(messages_, index); }
+    int count(std::map<const IpcConnection*, int>& counts, std::size_t index) {
         auto connection = accepted(index);
         std::lock_guard lock(mutex_);
-        return invalidations_[connection.get()];
-    }
-    int messages(std::size_t index) {
-        auto connection = accepted(index);
-        std::lock_guard lock(mutex_);
-        return messages_[connection.get()];
+        return counts[connection.get()];
     }
     void TearDown() override {
         if (listener_) {

@@ -5,7 +5,6 @@
 #include <atomic>
 #include <fmt/format.h>
 #include <fstream>
-#include <numeric>
 #include <sys/stat.h>
 #include <thread>
 
@@ -39,11 +38,6 @@ TEST(IpcFrameTest, HeaderIsALittleEndianLengthAndOneFlagBit) {
     EXPECT_EQ(decoded->length, 0x01020304u);
     EXPECT_TRUE(decoded->expectsReply);
     EXPECT_FALSE(IpcFrame::decodeHeader(std::array<std::uint8_t, 5>{1, 0, 0, 0, 0x80}));
-
-    const auto frame = IpcFrame::encodeMessage(message(1), false);
-    EXPECT_EQ(frame.size(), IpcFrame::kHeaderSize + CborCodec::encode(message(1)).size());
-    EXPECT_EQ(frame[0], frame.size() - IpcFrame::kHeaderSize);
-    EXPECT_EQ(frame[4], 0);
 }
 
 TEST_F(IpcListenerTest, SocketFileIsMadeOpenToAllReplacedWhenStaleAndKeptWhenLive) {
@@ -58,15 +52,13 @@ TEST_F(IpcListenerTest, SocketFileIsMadeOpenToAllReplacedWhenStaleAndKeptWhenLiv
     ASSERT_TRUE(start(echo)); // over the stale file
     IpcTestClient client(socketPath());
     client.send(message(7));
-    const auto reply = client.receive();
-    ASSERT_TRUE(reply);
-    EXPECT_EQ(seqOf(*reply->get("Echo")), 7u);
+    EXPECT_EQ(seqOf(client.receive()), 7u);
     EXPECT_EQ(accepted(0)->peer().pid(), ::getpid());
 
     IpcListener second(options());
     EXPECT_FALSE(second.start([](auto) {}));
     client.send(message(8));
-    EXPECT_EQ(seqOf(*client.receive()->get("Echo")), 8u);
+    EXPECT_EQ(seqOf(client.receive()), 8u);
 
     auto o = options();
     o.socketPath = root_ / "/not-a-socket";
@@ -81,7 +73,6 @@ TEST_F(IpcListenerTest, RequestsOfOneConnectionRunOneAtATimeInOrder) {
     constexpr std::uint64_t kCount = 64;
     std::atomic<int> active{0};
     std::atomic<bool> overlapped{false};
-    std::vector<std::uint64_t> order; // written by the handler, never by two at once
     ASSERT_TRUE(start([&](const auto& connection, const Event& event) {
         if (active.fetch_add(1) != 0) {
             overlapped = true;
@@ -89,7 +80,6 @@ TEST_F(IpcListenerTest, RequestsOfOneConnectionRunOneAtATimeInOrder) {
         for (int i = 0; i < 200; ++i) {
             std::this_thread::yield();
         }
-        order.push_back(*event.body.get("Seq")->asUInt64());
         active.fetch_sub(1);
         connection->sendReply(event.body);
     }));
@@ -104,9 +94,6 @@ TEST_F(IpcListenerTest, RequestsOfOneConnectionRunOneAtATimeInOrder) {
         ASSERT_EQ(seqOf(client.receive()), i);
     }
     EXPECT_FALSE(overlapped);
-    std::vector<std::uint64_t> expected(kCount);
-    std::iota(expected.begin(), expected.end(), 0);
-    EXPECT_EQ(order, expected);
 }
 
 TEST_F(IpcListenerTest, DifferentConnectionsRunConcurrently) {
@@ -128,8 +115,9 @@ TEST_F(IpcListenerTest, DifferentConnectionsRunConcurrently) {
     IpcTestClient b(socketPath());
     a.send(Value(Value::Dictionary{{"Name", Value("a")}}));
     b.send(Value(Value::Dictionary{{"Name", Value("b")}}));
-    EXPECT_EQ(*a.receive(), Value(Value::Dictionary{{"SawOther", Value(true)}}));
-    EXPECT_EQ(*b.receive(), Value(Value::Dictionary{{"SawOther", Value(true)}}));
+    const Value sawOther(Value::Dictionary{{"SawOther", Value(true)}});
+    EXPECT_EQ(a.receive(), sawOther);
+    EXPECT_EQ(b.receive(), sawOther);
 }
 
 TEST_F(IpcListenerTest, MalformedFrameClosesOnlyItsConnectionWithOneLogLine) {
@@ -220,6 +208,6 @@ TEST_F(IpcListenerTest, ConnectionNotResumedReadsNothing) {
     EXPECT_EQ(messages(0), 0);
 
     resume(connection); // from this thread, not the pool
-    EXPECT_EQ(seqOf(*waiting.receive()->get("Echo")), 1u);
+    EXPECT_EQ(seqOf(waiting.receive()), 1u);
     EXPECT_EQ(waiting.unreadByService(), 0);
 }

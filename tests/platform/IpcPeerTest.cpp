@@ -78,26 +78,13 @@ TEST(IpcPeerTest, AnotherProcessHasItsOwnTokenAndNoneOnceGone) {
 }
 
 TEST(IpcPeerTest, AuditTokenIsEightLittleEndianWordsInOrder) {
-    IpcPeer::TokenFields fields;
-    fields.loginUID = 0x04030201;
-    fields.euid = 11;
-    fields.egid = 12;
-    fields.ruid = 13;
-    fields.rgid = 14;
-    fields.pid = 0x00010000;
-    fields.sessionID = 16;
-    fields.startTime = 0xA1B2C3D4;
+    const IpcPeer::TokenFields fields{0x04030201, 11, 12, 13, 14, 0x00010000, 16, 0xA1B2C3D4};
     const auto token = IpcPeer::makeAuditToken(fields);
-    EXPECT_EQ(token[0], 0x01);
-    EXPECT_EQ(token[3], 0x04);
-    EXPECT_EQ(token[4], 11);
-    EXPECT_EQ(token[22], 0x01); // pid, third byte
-    EXPECT_EQ(token[28], 0xD4);
-    EXPECT_EQ(token[31], 0xA1);
+    const std::array<std::uint8_t, 8> ends{token[0],  token[3],  token[4],  token[16],
+                                           token[22], token[24], token[28], token[31]};
+    EXPECT_EQ(ends, (std::array<std::uint8_t, 8>{0x01, 0x04, 11, 14, 0x01, 16, 0xD4, 0xA1}));
     const auto back = IpcPeer::fieldsOfAuditToken(token);
-    EXPECT_EQ(back.loginUID, fields.loginUID);
-    EXPECT_EQ(back.rgid, fields.rgid);
-    EXPECT_EQ(back.pid, fields.pid);
+    EXPECT_EQ(IpcPeer::makeAuditToken(back), token);
     EXPECT_EQ(back.startTime, fields.startTime);
 }
 
@@ -114,10 +101,11 @@ TEST(IpcPeerTest, ProcFilesAreParsedStrictly) {
     EXPECT_EQ(ids->effectiveUID, 502u);
     EXPECT_EQ(ids->realGID, 20u);
     EXPECT_EQ(ids->effectiveGID, 21u);
-    EXPECT_FALSE(ProcessInfo::parseIds("Uid:\t1\t1\t1\t1\n"));
-    EXPECT_FALSE(ProcessInfo::parseIds("Uid:\t1\t1\t1\nGid:\t1\t1\t1\t1\n"));
-    EXPECT_FALSE(ProcessInfo::parseIds("Uid:\t1\tx\t1\t1\nGid:\t1\t1\t1\t1\n"));
-    EXPECT_FALSE(ProcessInfo::parseIds("Uid:\t4294967296\t1\t1\t1\nGid:\t1\t1\t1\t1\n"));
+    for (const char* bad : {"Uid:\t1\t1\t1\t1\n", "Uid:\t1\t1\t1\nGid:\t1\t1\t1\t1\n",
+                            "Uid:\t1\tx\t1\t1\nGid:\t1\t1\t1\t1\n",
+                            "Uid:\t4294967296\t1\t1\t1\nGid:\t1\t1\t1\t1\n"}) {
+        EXPECT_FALSE(ProcessInfo::parseIds(bad)) << bad;
+    }
 
     EXPECT_EQ(ProcessInfo::parseLoginUID("4294967295"), ProcessInfo::kNoLoginUID);
     EXPECT_EQ(ProcessInfo::parseLoginUID("501\n"), 501u);

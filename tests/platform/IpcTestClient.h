@@ -35,8 +35,6 @@ public:
         ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &guard, sizeof guard);
     }
     ~IpcTestClient() { ::close(fd_); }
-    IpcTestClient(const IpcTestClient&) = delete;
-    IpcTestClient& operator=(const IpcTestClient&) = delete;
 
     void write(const std::vector<std::uint8_t>& bytes) {
         std::size_t done = 0;
