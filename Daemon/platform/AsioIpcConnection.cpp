@@ -4,7 +4,6 @@
 #include "Daemon/platform/IpcFrame.h"
 #include "Daemon/support/Log.h"
 
-#include <asio/read.hpp>
 #include <asio/write.hpp>
 
 #include <cstring>
@@ -26,7 +25,8 @@ constexpr std::size_t kMaxQueuedReplyBytes = 4 * 1024 * 1024;
 
 AsioIpcConnection::AsioIpcConnection(std::shared_ptr<IpcServiceCore> core, Socket socket,
                                      IpcPeer peer, Limits limits)
-    : core_(std::move(core)), socket_(std::move(socket)), peer_(std::move(peer)), limits_(limits) {}
+    : core_(std::move(core)), socket_(std::move(socket)), strand_(socket_.get_executor()),
+      peer_(std::move(peer)), limits_(limits) {}
 
 AsioIpcConnection::~AsioIpcConnection() {
     core_->remove(this);
@@ -38,7 +38,7 @@ void AsioIpcConnection::setEventHandler(EventHandler handler) {
 }
 
 void AsioIpcConnection::resume() {
-    if (!core_->post(socket_.get_executor(), [self = shared_from_this()] { self->onResume(); })) {
+    if (!core_->post(strand_, [self = shared_from_this()] { self->onResume(); })) {
         // The service has stopped: drop what the handler holds.
         std::lock_guard lock(pendingHandlerMutex_);
         pendingHandler_ = nullptr;
@@ -48,15 +48,15 @@ void AsioIpcConnection::resume() {
 void AsioIpcConnection::cancel() {
     // Posted even from the strand, so that a handler cancelling its own
     // connection hears Invalidated only after it has returned.
-    core_->post(socket_.get_executor(), [self = shared_from_this()] { self->end(); });
+    core_->post(strand_, [self = shared_from_this()] { self->end(); });
 }
 
 void AsioIpcConnection::shutDown() {
-    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->end(); });
+    asio::post(strand_, [self = shared_from_this()] { self->end(); });
 }
 
 void AsioIpcConnection::sendReply(const Value& reply) {
-    if (socket_.get_executor().running_in_this_thread()) {
+    if (strand_.running_in_this_thread()) {
         queueReply(reply);
         return;
     }
@@ -64,10 +64,9 @@ void AsioIpcConnection::sendReply(const Value& reply) {
     if (!IpcFrame::appendMessage(reply, false, frame)) {
         return;
     }
-    core_->post(socket_.get_executor(),
-                [self = shared_from_this(), frame = std::move(frame)]() mutable {
-                    self->queueFrame(std::move(frame));
-                });
+    core_->post(strand_, [self = shared_from_this(), frame = std::move(frame)]() mutable {
+        self->queueFrame(std::move(frame));
+    });
 }
 
 void AsioIpcConnection::onResume() {

@@ -64,6 +64,7 @@ private:
     // Declared first so that it outlives the socket and strand it runs.
     std::shared_ptr<IpcServiceCore> core_;
     Socket socket_;
+    const Strand strand_; // the socket's, kept apart for calls from other threads
     const IpcPeer peer_;
     const Limits limits_;
 
