@@ -15,6 +15,7 @@
 
 #include <atomic>
 #include <fstream>
+#include <sstream>
 #include <thread>
 #include <vector>
 
@@ -28,17 +29,9 @@ std::string hexOf(const ExecutableDigestCache::Digest& digest) {
     return hex;
 }
 
-std::string sha256Hex(const std::string& bytes) {
-    ExecutableDigestCache::Digest digest;
-    crypto_hash_sha256(digest.data(), reinterpret_cast<const unsigned char*>(bytes.data()),
-                       bytes.size());
-    return hexOf(digest);
-}
-
-std::string fileSha256Hex(const std::filesystem::path& path) {
+std::string sha256Hex(std::istream&& in) {
     crypto_hash_sha256_state state;
     crypto_hash_sha256_init(&state);
-    std::ifstream in(path, std::ios::binary);
     std::vector<char> chunk(1 << 20);
     while (in.read(chunk.data(), static_cast<std::streamsize>(chunk.size())) || in.gcount() > 0) {
         crypto_hash_sha256_update(&state, reinterpret_cast<const unsigned char*>(chunk.data()),
@@ -76,7 +69,7 @@ protected:
 
 } // namespace
 
-TEST_F(CodeSigningRegistryTest, MatchesTheRunningExecutableAndChecksItsDigest) {
+TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
     LinuxCodeSigningRegistry registry(paths_);
     Value plist = entry(self_, "com.orvex.tests");
     plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
@@ -89,7 +82,7 @@ TEST_F(CodeSigningRegistryTest, MatchesTheRunningExecutableAndChecksItsDigest) {
     ASSERT_TRUE(info->entitlements);
     EXPECT_EQ(*info->entitlements->get("com.orvex.private.Quarn.allowed"), Value(true));
 
-    plist.set("SHA256", fileSha256Hex("/proc/self/exe"));
+    plist.set("SHA256", sha256Hex(std::ifstream("/proc/self/exe", std::ios::binary)));
     write("self.plist", plist);
     EXPECT_TRUE(registry.infoForAuditToken(ownToken()));
 
@@ -99,11 +92,10 @@ TEST_F(CodeSigningRegistryTest, MatchesTheRunningExecutableAndChecksItsDigest) {
     EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
     EXPECT_TRUE(log.contains("does not match the digest of code-signing entry self.plist"))
         << log.all();
-}
 
-TEST_F(CodeSigningRegistryTest, TokenOfAnotherProcessIncarnationGivesNone) {
-    LinuxCodeSigningRegistry registry(paths_);
-    write("self.plist", entry(self_, "com.orvex.tests"));
+    // Another process that got the pid, or none at all.
+    plist.erase("SHA256");
+    write("self.plist", plist);
     IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(ownToken());
     ASSERT_TRUE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
     fields.startTime += 1;
@@ -215,8 +207,8 @@ TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
         EXPECT_TRUE(digest);
         return digest ? hexOf(*digest) : std::string();
     };
-    EXPECT_EQ(digestNow(), sha256Hex("first version"));
-    EXPECT_EQ(digestNow(), sha256Hex("first version"));
+    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("first version")));
+    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("first version")));
 
     // Same size, mtime put back: still seen as changed.
     struct stat before {};
@@ -224,8 +216,8 @@ TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
     std::ofstream(file, std::ios::binary | std::ios::trunc) << "other version";
     const timespec times[2] = {before.st_atim, before.st_mtim};
     ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
-    EXPECT_EQ(digestNow(), sha256Hex("other version"));
+    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("other version")));
 
     std::ofstream(file, std::ios::binary | std::ios::app) << " grown";
-    EXPECT_EQ(digestNow(), sha256Hex("other version grown"));
+    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("other version grown")));
 }
