@@ -41,7 +41,8 @@ protected:
     }
 
     // Connections are resumed with `onMessage` unless their accept index is
-    // in `held`.
+    // in `held`. A test whose handler uses its locals stops the listener
+    // before it returns: a handler may still run after the last reply.
     Status start(Handler onMessage, IpcListener::Options o, std::set<std::size_t> held = {}) {
         onMessage_ = std::move(onMessage);
         listener_ = std::make_unique<IpcListener>(std::move(o));

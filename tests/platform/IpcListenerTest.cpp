@@ -94,6 +94,7 @@ TEST_F(IpcListenerTest, RequestsOfOneConnectionRunOneAtATimeInOrder) {
         ASSERT_EQ(seqOf(client.receive()), i);
     }
     EXPECT_FALSE(overlapped);
+    listener_->stop(); // before the handler's locals go
 }
 
 TEST_F(IpcListenerTest, DifferentConnectionsRunConcurrently) {
@@ -118,6 +119,7 @@ TEST_F(IpcListenerTest, DifferentConnectionsRunConcurrently) {
     const Value sawOther(Value::Dictionary{{"SawOther", Value(true)}});
     EXPECT_EQ(a.receive(), sawOther);
     EXPECT_EQ(b.receive(), sawOther);
+    listener_->stop(); // the handlers may still be unlocking `mutex`
 }
 
 TEST_F(IpcListenerTest, MalformedFrameClosesOnlyItsConnectionWithOneLogLine) {
@@ -192,6 +194,7 @@ TEST_F(IpcListenerTest, ReplyMayBeSentLaterFromAnotherThread) {
     held->sendReply(message(2));
     EXPECT_EQ(seqOf(client.receive()), 1u);
     EXPECT_EQ(seqOf(client.receive()), 2u);
+    listener_->stop(); // before `held` goes
 }
 
 TEST_F(IpcListenerTest, ConnectionNotResumedReadsNothing) {
