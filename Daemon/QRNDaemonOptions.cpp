@@ -55,7 +55,8 @@ QRNDaemonOptions::Parsed QRNDaemonOptions::parse(const std::vector<std::string>&
         app.parse(reversed);
     } catch (const CLI::ParseError& error) {
         std::ostringstream out;
-        parsed.exitStatus = app.exit(error, out, out);
+        // Usage errors all end with 2, whatever kind of error the parser saw.
+        parsed.exitStatus = app.exit(error, out, out) == 0 ? 0 : 2;
         parsed.output = out.str();
         return parsed;
     }
