@@ -9,6 +9,7 @@
 
 #include <signal.h>
 #include <sys/signalfd.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -84,6 +85,7 @@ int QRNDaemon::runMainLoop(const std::function<void()>& stopAccepting) {
     ::close(fd);
 
     QRN_LOG_NOTICE(LogCategory::Startup, "Stopping on signal {}", received);
+    sd_notify(0, "STOPPING=1");
     if (stopAccepting) {
         stopAccepting();
     }
