@@ -144,9 +144,11 @@ void QRNCommandHandlers::groupIdentifiersForOwner(const Value&, QRNVellReply& re
 void QRNCommandHandlers::systemGroupContainerPath(const Value& request, QRNVellReply& reply,
                                                   QRNClientConnection& client,
                                                   std::uint64_t& error) {
-    auto group = identifierFromRequest(request, client, "GroupIdentifier");
-    if (!group) {
-        return setError(error, group.error());
+    // A group never defaults to the client's own identifier.
+    const std::string* group = stringValue(request, "GroupIdentifier");
+    if (!group || group->empty()) {
+        QRN_ERROR(kQRNErrorMissingIdentifier, "Invalid object: missing identifier");
+        return setError(error, kQRNErrorMissingIdentifier);
     }
     const std::string& bundle = client.clientBundleIdentifier();
     std::vector<std::string> entitledGroups;
