@@ -1,0 +1,182 @@
+#include "ChildProcess.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <fmt/format.h>
+#include <utility>
+
+extern char** environ;
+
+namespace quarn::test {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// A child must not take over a socket or a notification channel that a
+// service manager handed to the test.
+bool inheritedFromTest(const char* entry) {
+    for (const char* name : {"LISTEN_FDS=", "LISTEN_PID=", "LISTEN_FDNAMES=", "NOTIFY_SOCKET="}) {
+        if (std::strncmp(entry, name, std::strlen(name)) == 0) {
+            return false;
+        }
+    }
+    return true;
+}
+
+std::vector<std::string> environmentFor(const ChildProcess::Spec& spec) {
+    std::vector<std::string> environment;
+    for (char** entry = environ; *entry; ++entry) {
+        if (inheritedFromTest(*entry)) {
+            environment.emplace_back(*entry);
+        }
+    }
+    environment.insert(environment.end(), spec.environment.begin(), spec.environment.end());
+    return environment;
+}
+
+std::vector<char*> pointersTo(std::vector<std::string>& strings) {
+    std::vector<char*> pointers;
+    for (std::string& string : strings) {
+        pointers.push_back(string.data());
+    }
+    pointers.push_back(nullptr);
+    return pointers;
+}
+
+int pollFor(int fd, std::chrono::milliseconds limit) {
+    pollfd entry{fd, POLLIN, 0};
+    int ready;
+    do {
+        ready = ::poll(&entry, 1, static_cast<int>(limit.count()));
+    } while (ready < 0 && errno == EINTR);
+    return ready;
+}
+
+struct FileActions {
+    posix_spawn_file_actions_t actions;
+    FileActions() { posix_spawn_file_actions_init(&actions); }
+    ~FileActions() { posix_spawn_file_actions_destroy(&actions); }
+};
+
+} // namespace
+
+bool ChildProcess::Exit::exitedWith(int code) const {
+    return WIFEXITED(status) && WEXITSTATUS(status) == code;
+}
+
+std::string ChildProcess::Exit::description() const {
+    if (WIFEXITED(status)) {
+        return fmt::format("exit status {}", WEXITSTATUS(status));
+    }
+    if (WIFSIGNALED(status)) {
+        return fmt::format("killed by signal {} ({})", WTERMSIG(status),
+                           ::strsignal(WTERMSIG(status)));
+    }
+    return fmt::format("wait status {:#x}", status);
+}
+
+Result<ChildProcess> ChildProcess::spawn(const Spec& spec) {
+    FileActions files;
+    posix_spawn_file_actions_addopen(&files.actions, 0, "/dev/null", O_RDONLY, 0);
+    std::array<int, 2> pipe{-1, -1};
+    if (spec.captureStdout) {
+        if (::pipe2(pipe.data(), O_CLOEXEC) != 0) {
+            return QRN_UNEXPECTED(QRN_POSIX_ERROR(errno, "pipe: {}", std::strerror(errno)));
+        }
+        posix_spawn_file_actions_adddup2(&files.actions, pipe[1], 1);
+    } else {
+        posix_spawn_file_actions_addopen(&files.actions, 1, "/dev/null", O_WRONLY, 0);
+    }
+    if (!spec.stderrFile.empty()) {
+        posix_spawn_file_actions_addopen(&files.actions, 2, spec.stderrFile.c_str(),
+                                         O_WRONLY | O_CREAT | O_APPEND, 0644);
+    }
+    std::vector<std::string> arguments{spec.program.string()};
+    arguments.insert(arguments.end(), spec.arguments.begin(), spec.arguments.end());
+    std::vector<std::string> environment = environmentFor(spec);
+    pid_t pid = -1;
+    const int err = ::posix_spawn(&pid, spec.program.c_str(), &files.actions, nullptr,
+                                  pointersTo(arguments).data(), pointersTo(environment).data());
+    auto out = std::make_unique<Descriptor>(pipe[0]);
+    if (pipe[1] >= 0) {
+        ::close(pipe[1]);
+    }
+    if (err != 0) {
+        return QRN_UNEXPECTED(
+            QRN_POSIX_ERROR(err, "cannot spawn {}: {}", spec.program.string(), std::strerror(err)));
+    }
+    auto pidfd = std::make_unique<Descriptor>(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+    if (!pidfd->valid()) {
+        const int openErr = errno;
+        ::kill(pid, SIGKILL);
+        ::waitpid(pid, nullptr, 0);
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(openErr, "pidfd_open: {}", std::strerror(openErr)));
+    }
+    return ChildProcess(pid, std::move(pidfd), std::move(out));
+}
+
+ChildProcess::ChildProcess(ChildProcess&& other) noexcept
+    : pid_(std::exchange(other.pid_, -1)), pidfd_(std::move(other.pidfd_)),
+      stdout_(std::move(other.stdout_)), exit_(other.exit_) {}
+
+ChildProcess::~ChildProcess() {
+    if (pid_ > 0 && !exit_) {
+        ::kill(pid_, SIGKILL);
+        ::waitpid(pid_, nullptr, 0);
+    }
+}
+
+bool ChildProcess::isRunning() const {
+    return pid_ > 0 && !exit_ && pollFor(pidfd_->get(), std::chrono::milliseconds(0)) == 0;
+}
+
+std::optional<ChildProcess::Exit> ChildProcess::waitFor(std::chrono::milliseconds limit) {
+    if (!exit_ && pid_ > 0 && pollFor(pidfd_->get(), limit) > 0) {
+        int status = 0;
+        if (::waitpid(pid_, &status, 0) == pid_) {
+            exit_ = Exit{status};
+        }
+    }
+    return exit_;
+}
+
+void ChildProcess::signal(int signo) const {
+    if (pid_ > 0 && !exit_) {
+        ::kill(pid_, signo);
+    }
+}
+
+std::string ChildProcess::readStdout(std::chrono::milliseconds limit) {
+    std::string text;
+    const Clock::time_point deadline = Clock::now() + limit;
+    while (stdout_ && stdout_->valid()) {
+        const auto left =
+            std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now());
+        if (left.count() <= 0 || pollFor(stdout_->get(), left) <= 0) {
+            signal(SIGKILL);
+            break;
+        }
+        char chunk[4096];
+        const ssize_t n = ::read(stdout_->get(), chunk, sizeof chunk);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            break;
+        }
+        text.append(chunk, static_cast<std::size_t>(n));
+    }
+    return text;
+}
+
+} // namespace quarn::test

@@ -1,0 +1,230 @@
+#include "DaemonHarness.h"
+
+#include "Daemon/platform/FirstBootMarker.h"
+#include "Daemon/platform/Paths.h"
+#include "HexCbor.h"
+
+#include <gtest/gtest.h>
+
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <fstream>
+#include <iostream>
+#include <iterator>
+#include <sstream>
+#include <stdexcept>
+#include <thread>
+
+namespace quarn::test {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+void writeFile(const std::filesystem::path& file, std::string_view contents) {
+    std::filesystem::create_directories(file.parent_path());
+    std::ofstream(file, std::ios::trunc) << contents;
+}
+
+// One connect attempt, without the client library's error logging: a
+// socket that is not there yet is the normal case while polling.
+bool acceptsConnections(const std::filesystem::path& socketPath) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
+    Descriptor fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    return fd.valid() &&
+           ::connect(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+}
+
+std::vector<std::string> lines(const std::string& text) {
+    std::vector<std::string> result;
+    std::istringstream in(text);
+    for (std::string line; std::getline(in, line);) {
+        result.push_back(line);
+    }
+    return result;
+}
+
+} // namespace
+
+bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds limit) {
+    const Clock::time_point deadline = Clock::now() + limit;
+    while (!condition()) {
+        if (Clock::now() >= deadline) {
+            return condition();
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return true;
+}
+
+std::uint64_t replyError(const Value& reply) {
+    const Value* error = reply.get("ReplyError");
+    return error ? error->asUInt64().value_or(0) : 0;
+}
+
+DaemonHarness::DaemonHarness() {
+    std::string pattern = (std::filesystem::temp_directory_path() / "quarn-it.XXXXXX").string();
+    if (!::mkdtemp(pattern.data())) {
+        throw std::runtime_error("mkdtemp failed");
+    }
+    root_ = pattern;
+    stderrFile_ = root_ / "quarnd.stderr";
+    writeAccounts();
+    clients_.emplace(QUARN_TEST_CLIENT_PATH, root_ / "clients",
+                     Paths(root_).configDirectory() / "codesign.d");
+    if (clients_->copied()) {
+        std::cout << "note: the test clients are copies, not hard links (another file system)\n";
+    }
+}
+
+DaemonHarness::~DaemonHarness() {
+    daemon_.reset(); // kills a daemon still running
+    (void)FirstBootMarker(root_).remove();
+    std::error_code ignored;
+    std::filesystem::remove_all(root_, ignored);
+}
+
+void DaemonHarness::writeAccounts() const {
+    writeFile(*this / "/etc/passwd",
+              "root:x:0:0:root:/private/var/root:/bin/sh\n"
+              "_installd:x:33:33:installer:/private/var/installer:/bin/false\n"
+              "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n");
+    writeFile(*this / "/etc/group", "wheel:x:0:\n"
+                                    "_installd:x:33:\n"
+                                    "mobile:x:501:\n"
+                                    "systemusers:x:1501:mobile\n");
+    writeFile(*this / "/etc/os-release", "ID=quarnos\n"
+                                         "VERSION_ID=1.0\n"
+                                         "BUILD_ID=1A100\n"
+                                         "VARIANT_ID=internal\n");
+    std::filesystem::create_directories(*this / "/private/var/mobile");
+}
+
+std::filesystem::path DaemonHarness::operator/(std::string_view absolute) const {
+    return Paths(root_).resolve(absolute);
+}
+
+std::filesystem::path DaemonHarness::runDirectory() const {
+    return Paths(root_).runDirectory();
+}
+
+std::filesystem::path DaemonHarness::socketPath() const {
+    return QRNClient::socketPathForRoot(root_);
+}
+
+bool DaemonHarness::spawn(std::vector<std::string> environment) {
+    runLogStart_ =
+        std::filesystem::exists(stderrFile_) ? std::filesystem::file_size(stderrFile_) : 0;
+    ChildProcess::Spec spec;
+    spec.program = QUARN_DAEMON_PATH;
+    spec.arguments = {"--root", root_.string(), "--foreground", "--log-level", "debug"};
+    spec.environment = std::move(environment);
+    spec.stderrFile = stderrFile_;
+    auto spawned = ChildProcess::spawn(spec);
+    daemon_.reset();
+    if (!spawned) {
+        ADD_FAILURE() << spawned.error().description();
+        return false;
+    }
+    daemon_.emplace(std::move(*spawned));
+    return true;
+}
+
+bool DaemonHarness::waitUntilAccepting() {
+    const Clock::time_point deadline = Clock::now() + kWaitLimit;
+    while (daemon_ && Clock::now() < deadline) {
+        if (acceptsConnections(socketPath())) {
+            return true;
+        }
+        // Doubles as the pause between attempts, and ends early on a crash.
+        if (daemon_->waitFor(std::chrono::milliseconds(10))) {
+            return false;
+        }
+    }
+    return false;
+}
+
+bool DaemonHarness::start() {
+    return spawn() && waitUntilAccepting();
+}
+
+bool DaemonHarness::isRunning() const {
+    return daemon_ && daemon_->isRunning();
+}
+
+std::optional<ChildProcess::Exit> DaemonHarness::stop() {
+    if (!daemon_) {
+        return std::nullopt;
+    }
+    daemon_->signal(SIGTERM);
+    return daemon_->waitFor(kWaitLimit);
+}
+
+std::string DaemonHarness::log(std::size_t from) const {
+    std::ifstream in(stderrFile_, std::ios::binary);
+    in.seekg(static_cast<std::streamoff>(runLogStart_ + from));
+    return std::string((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+}
+
+std::size_t DaemonHarness::logSize() const {
+    std::error_code ec;
+    const std::uintmax_t size = std::filesystem::file_size(stderrFile_, ec);
+    return ec || size < runLogStart_ ? 0 : static_cast<std::size_t>(size - runLogStart_);
+}
+
+DaemonHarness::ClientRun DaemonHarness::runClient(std::string_view program,
+                                                  const std::vector<Value>& requests) const {
+    ChildProcess::Spec spec;
+    spec.program = clients_->pathOf(program);
+    spec.arguments = {"--socket", socketPath().string()};
+    for (const Value& request : requests) {
+        spec.arguments.push_back(HexCbor::encode(request));
+    }
+    spec.captureStdout = true;
+    ClientRun run;
+    auto child = ChildProcess::spawn(spec);
+    if (!child) {
+        run.failure = child.error().description();
+        return run;
+    }
+    for (const std::string& line : lines(child->readStdout(kWaitLimit))) {
+        if (line.starts_with('!')) {
+            run.failure = line.substr(1);
+            break;
+        }
+        auto reply = HexCbor::decode(line);
+        if (!reply) {
+            run.failure = "unreadable reply line: " + reply.error().message;
+            break;
+        }
+        run.replies.push_back(std::move(*reply));
+    }
+    run.exit = child->waitFor(kWaitLimit);
+    return run;
+}
+
+Result<QRNClient> DaemonHarness::connect() const {
+    QRNClient::Options options;
+    options.timeout = kWaitLimit;
+    return QRNClient::connect(socketPath(), options);
+}
+
+Value DaemonHarness::request(const Value& request) const {
+    auto client = connect();
+    auto reply = client ? client->send(request) : Result<Value>(QRN_UNEXPECTED(client.error()));
+    if (!reply) {
+        ADD_FAILURE() << "no reply to " << request.description() << ": "
+                      << reply.error().description();
+        return Value();
+    }
+    return *reply;
+}
+
+} // namespace quarn::test

@@ -1,0 +1,92 @@
+#pragma once
+// The real quarnd on a throw-away root: the root's accounts and OS release,
+// a code-signing registry of client programs, the daemon process with its
+// stderr in a file, and the ways a test talks to it (copies of the test
+// client, or connections of the test binary itself).
+//
+// Every wait is bounded by kWaitLimit; none of them measures anything.
+
+#include "ChildProcess.h"
+#include "Client/QRNClient.h"
+#include "ClientPrograms.h"
+#include "Daemon/support/Value.h"
+
+#include <chrono>
+#include <cstddef>
+#include <filesystem>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace quarn::test {
+
+class DaemonHarness {
+public:
+    static constexpr std::chrono::seconds kWaitLimit{30};
+
+    // What one run of a client copy printed.
+    struct ClientRun {
+        std::vector<Value> replies;
+        std::string failure; // the client's "!" line, or why its output was unreadable
+        std::optional<ChildProcess::Exit> exit; // none: it did not end
+    };
+
+    DaemonHarness();
+    // Kills a daemon still running, removes the first-boot marker of the
+    // root and the root itself.
+    ~DaemonHarness();
+    DaemonHarness(const DaemonHarness&) = delete;
+    DaemonHarness& operator=(const DaemonHarness&) = delete;
+
+    const std::filesystem::path& root() const { return root_; }
+    // An absolute device path taken below the root.
+    std::filesystem::path operator/(std::string_view absolute) const;
+    std::filesystem::path runDirectory() const;
+    std::filesystem::path socketPath() const;
+    const ClientPrograms& clients() const { return *clients_; }
+
+    // Spawns quarnd on the root (with `environment` added) and returns at
+    // once. False when it cannot be spawned.
+    bool spawn(std::vector<std::string> environment = {});
+    // Polls connecting to the socket until it accepts; false when the
+    // daemon ended or the limit passed first.
+    bool waitUntilAccepting();
+    // spawn() and waitUntilAccepting().
+    bool start();
+    bool isRunning() const;
+    // SIGTERM, then waits for the exit; none when the daemon does not end.
+    std::optional<ChildProcess::Exit> stop();
+
+    // The daemon's stderr of the current run (debug level), from byte
+    // `from` of that run on.
+    std::string log(std::size_t from = 0) const;
+    std::size_t logSize() const;
+
+    // Runs the client copy `program` with `requests` on one connection.
+    ClientRun runClient(std::string_view program, const std::vector<Value>& requests) const;
+    // A connection of the test binary, which the registry grants "allowed".
+    Result<QRNClient> connect() const;
+    // One request on a new connection of the test binary; fails the
+    // calling test when no reply comes.
+    Value request(const Value& request) const;
+
+private:
+    void writeAccounts() const;
+
+    std::filesystem::path root_;
+    std::filesystem::path stderrFile_;
+    std::size_t runLogStart_ = 0; // where the current run's stderr begins
+    std::optional<ClientPrograms> clients_;
+    std::optional<ChildProcess> daemon_;
+};
+
+// Polls `condition` until it holds or `limit` has passed; answers its last value.
+bool waitUntil(const std::function<bool()>& condition,
+               std::chrono::milliseconds limit = DaemonHarness::kWaitLimit);
+
+// "ReplyError" of a reply; 0 when there is none.
+std::uint64_t replyError(const Value& reply);
+
+} // namespace quarn::test

@@ -1,0 +1,67 @@
+// quarn_test_client: sends requests to quarnd over one connection and
+// prints each reply. The integration tests run hard-linked copies of it,
+// each registered in the code-signing registry with other entitlements.
+//
+//   quarn_test_client --socket PATH [HEX...]
+//
+// Each HEX is the CBOR of one request dictionary; without any, one request
+// is read per line of stdin. Each reply is printed as hex CBOR on its own
+// line. When a request gets no reply, a line "!<error>" says why and the
+// client stops: 0 all answered, 1 usage or bad input, 2 cannot connect,
+// 3 a request went unanswered.
+
+#include "Client/QRNClient.h"
+#include "HexCbor.h"
+
+#include <cstdio>
+#include <iostream>
+#include <string>
+#include <vector>
+
+namespace {
+
+using quarn::QRNClient;
+using quarn::Value;
+using quarn::test::HexCbor;
+
+int sendAll(QRNClient& client, const std::vector<std::string>& requests) {
+    for (const std::string& hex : requests) {
+        auto request = HexCbor::decode(hex);
+        if (!request) {
+            std::fprintf(stderr, "bad request %s: %s\n", hex.c_str(),
+                         request.error().description().c_str());
+            return 1;
+        }
+        auto reply = client.send(*request);
+        if (!reply) {
+            std::printf("!%s\n", reply.error().description().c_str());
+            return 3;
+        }
+        std::printf("%s\n", HexCbor::encode(*reply).c_str());
+        std::fflush(stdout);
+    }
+    return 0;
+}
+
+} // namespace
+
+int main(int argc, char** argv) {
+    if (argc < 3 || std::string(argv[1]) != "--socket") {
+        std::fprintf(stderr, "usage: %s --socket PATH [HEX...]\n", argv[0]);
+        return 1;
+    }
+    std::vector<std::string> requests(argv + 3, argv + argc);
+    if (requests.empty()) {
+        for (std::string line; std::getline(std::cin, line);) {
+            if (!line.empty()) {
+                requests.push_back(line);
+            }
+        }
+    }
+    auto client = QRNClient::connect(argv[2]);
+    if (!client) {
+        std::printf("!%s\n", client.error().description().c_str());
+        return 2;
+    }
+    return sendAll(*client, requests);
+}
