@@ -114,8 +114,48 @@ json JsonConvention::toJson(const Value& value) {
     return out;
 }
 
+namespace {
+
+std::string compact(const json& node) {
+    return node.dump(-1, ' ', false, json::error_handler_t::replace);
+}
+
+// Like dump(indent), but the one-key objects of the convention stay on one
+// line: {"$uuid": "..."} reads as one value.
+void printIndented(const json& node, int indent, int depth, std::string& out) {
+    if (node.is_object() && node.size() == 1 && node.begin().key().starts_with('$') &&
+        !node.begin().key().starts_with("$$")) {
+        out += "{" + compact(node.begin().key()) + ": " + compact(node.begin().value()) + "}";
+        return;
+    }
+    if (!node.is_structured() || node.empty()) {
+        out += compact(node);
+        return;
+    }
+    const std::string pad(static_cast<std::size_t>(indent * (depth + 1)), ' ');
+    out += node.is_object() ? "{\n" : "[\n";
+    std::size_t left = node.size();
+    for (auto it = node.begin(); it != node.end(); ++it) {
+        out += pad;
+        if (node.is_object()) {
+            out += compact(it.key()) + ": ";
+        }
+        printIndented(it.value(), indent, depth + 1, out);
+        out += --left > 0 ? ",\n" : "\n";
+    }
+    out += std::string(static_cast<std::size_t>(indent * depth), ' ');
+    out += node.is_object() ? "}" : "]";
+}
+
+} // namespace
+
 std::string JsonConvention::print(const Value& value, int indent) {
-    return toJson(value).dump(indent, ' ', false, json::error_handler_t::replace);
+    if (indent < 0) {
+        return compact(toJson(value));
+    }
+    std::string out;
+    printIndented(toJson(value), indent, 0, out);
+    return out;
 }
 
 } // namespace quarn::ctl

@@ -88,6 +88,13 @@ TEST(JsonConvention, ReadsTheDocumentedForms) {
     EXPECT_EQ(parsed->get("t")->asDate()->microsecondsSince1970, 1500000);
     EXPECT_NE(parsed->get("$k"), nullptr);
     EXPECT_EQ(JsonConvention::print(Value(std::int64_t{7}), -1), R"({"$int":7})");
+    // Indented output keeps the typed objects on one line.
+    Value reply = Value::dictionary();
+    reply.set("ReplyUUID", *parsed->get("u"));
+    reply.set("Empty", Value::array());
+    EXPECT_EQ(JsonConvention::print(reply),
+              "{\n  \"Empty\": [],\n"
+              "  \"ReplyUUID\": {\"$uuid\": \"E621E1F8-C36C-495A-93FC-0C247A3E6E5F\"}\n}");
 }
 
 TEST(JsonConvention, RefusesMalformedInput) {
