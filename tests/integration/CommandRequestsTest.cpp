@@ -264,6 +264,31 @@ TEST_F(CommandRequests, ListingAndDeletionOfContainers) {
               Value(Value::Array{identifiers[1]}).description());
 }
 
+TEST_F(CommandRequests, CommandsReplyingFromTheirCompletionReplyOnce) {
+    const std::string identifier = "com.orvex.test.death-row";
+    // Deleted, so that death row holds something when the pass runs; each
+    // reply must belong to its own request, so a second reply to 4 or 21
+    // would show up as the reply to the request after it.
+    const auto replies =
+        repliesOf(P::kAllowed,
+                  {createOrLookup(identifier, 2), Requests::deleteContainer(identifier, 2, false),
+                   Requests::deleteContainersOnDeathRow(), command(32),
+                   command(21, {{"Identifier", identifier}, {"ContainerClass", 2u}}), command(32)});
+    EXPECT_EQ(replyError(replies[1]), kQRNErrorNone);
+    EXPECT_EQ(replyError(replies[2]), kQRNErrorNone) << replies[2].description();
+    EXPECT_EQ(replies[2].size(), 1u) << replies[2].description();
+    EXPECT_EQ(replyError(replies[4]), kQRNErrorInvalidCommand) << replies[4].description();
+    EXPECT_EQ(replies[4].size(), 1u) << replies[4].description();
+    for (std::size_t i : {3, 5}) {
+        EXPECT_NE(replies[i].get("ReplyPersonaUniqueStringsArray"), nullptr)
+            << replies[i].description();
+    }
+    // The pass replied when it was done: death row is empty.
+    const std::filesystem::path deathRow =
+        daemon() / "/private/var/root/Library/Caches/com.orvex.quarnd/Dead";
+    EXPECT_TRUE(std::filesystem::is_empty(deathRow));
+}
+
 TEST_F(CommandRequests, SandboxedClientWithoutEnterprisePersonaGetsNoTokens) {
     const std::string identifier = "com.orvex.test.sandboxed.data";
     const auto replies =

@@ -179,6 +179,19 @@ std::size_t DaemonHarness::logSize() const {
     return ec || size < runLogStart_ ? 0 : static_cast<std::size_t>(size - runLogStart_);
 }
 
+std::size_t DaemonHarness::waitForLog(std::string_view text, std::size_t from) const {
+    std::size_t at = std::string::npos;
+    waitUntil([&] {
+        const std::string tail = log(from);
+        const std::size_t found = tail.find(text);
+        if (found != std::string::npos) {
+            at = from + found;
+        }
+        return at != std::string::npos || !isRunning();
+    });
+    return at;
+}
+
 DaemonHarness::ClientRun DaemonHarness::runClient(std::string_view program,
                                                   const std::vector<Value>& requests) const {
     ChildProcess::Spec spec;

@@ -63,6 +63,10 @@ public:
     // `from` of that run on.
     std::string log(std::size_t from = 0) const;
     std::size_t logSize() const;
+    // Waits until `text` appears in the current run's log at or after
+    // `from`; answers where, or npos when the daemon ended or the limit
+    // passed first.
+    std::size_t waitForLog(std::string_view text, std::size_t from = 0) const;
 
     // Runs the client copy `program` with `requests` on one connection.
     ClientRun runClient(std::string_view program, const std::vector<Value>& requests) const;

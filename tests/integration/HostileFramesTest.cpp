@@ -45,6 +45,17 @@ Value nested(std::size_t depth) {
     return create({{"Identifier", "com.orvex.test.nested"}, {"Deep", deep}});
 }
 
+// A request padded to exactly `size` bytes of CBOR.
+Value padded(std::size_t size) {
+    Value request = create({{"Identifier", "com.orvex.test.padded"}});
+    request.set("Pad", Value::Data());
+    const std::size_t bare = CborCodec::encode(request).size();
+    // A byte string this long has a length field of a fixed size.
+    request.set("Pad", Value::Data(size - bare - 4));
+    EXPECT_EQ(CborCodec::encode(request).size(), size);
+    return request;
+}
+
 std::vector<Case> cases() {
     const Value normal = create({{"Identifier", "com.orvex.test.hostile"}});
     const std::vector<std::uint8_t> normalBody = CborCodec::encode(normal);
@@ -82,6 +93,8 @@ std::vector<Case> cases() {
                "nest deeper than 32"),
         closes("reply flag clear", RawConnection::frame(normal, 0x00), A::Wait,
                "Dictionary does not have reply context"),
+        answers("frame of exactly 1 MiB", RawConnection::frame(padded(1u << 20), kReply),
+                {kQRNErrorNone}),
         answers("nesting 32 deep", RawConnection::frame(nested(32), kReply), {kQRNErrorNone}),
         answers(
             "\"ContainerClass\" as a string",

@@ -10,8 +10,7 @@ namespace quarn::test {
 
 TEST_F(Serving, LockStateChangesDoNotDisturbServing) {
     const std::filesystem::path file = daemon().runDirectory() / "lockstate";
-    const std::size_t logStart = daemon().logSize();
-    std::size_t seen = 0; // where the previous report was found in the log
+    std::size_t seen = daemon().logSize(); // where the previous report ended in the log
     // Locked, transitional, unlocked, locked again, and the file removed
     // (which reads as unlocked).
     for (const char* state : {"1", "2", "0", "1", ""}) {
@@ -22,15 +21,9 @@ TEST_F(Serving, LockStateChangesDoNotDisturbServing) {
             std::filesystem::remove(file);
         }
         const std::string report = std::string("LockState=") + (*state ? state : "0");
-        ASSERT_TRUE(waitUntil([&] {
-            const std::size_t at = daemon().log(logStart).find(report, seen);
-            if (at == std::string::npos) {
-                return false;
-            }
-            seen = at + report.size();
-            return true;
-        })) << "the daemon did not report "
-            << report;
+        const std::size_t at = daemon().waitForLog(report, seen);
+        ASSERT_NE(at, std::string::npos) << "the daemon did not report " << report;
+        seen = at + report.size();
         const Value reply = daemon().request(
             QRNClientRequests::createOrLookup("com.orvex.test.lockstate", 2, true, false));
         EXPECT_EQ(replyError(reply), kQRNErrorNone) << reply.description();

@@ -40,16 +40,21 @@ void SharedDaemonTest::SetUpTestSuite() {
 }
 
 void SharedDaemonTest::TearDownTestSuite() {
-    expectCleanStop(*harness_);
-    harness_.reset();
+    if (harness_) {
+        expectCleanStop(*harness_);
+        harness_.reset();
+    }
 }
 
 void SharedDaemonTest::SetUp() {
-    ASSERT_TRUE(harness_->isRunning()) << "quarnd is not running";
+    ASSERT_TRUE(harness_ && harness_->isRunning()) << "quarnd is not running";
     logStart_ = harness_->logSize();
 }
 
 void SharedDaemonTest::TearDown() {
+    if (!harness_) {
+        return;
+    }
     EXPECT_TRUE(harness_->isRunning()) << "quarnd ended during the test";
     if (HasFailure()) {
         dumpLog(*harness_, logStart_);
