@@ -35,12 +35,6 @@ std::optional<std::uint64_t> ContainerClassName::parse(std::string_view text) {
     return std::nullopt;
 }
 
-std::string ContainerClassName::describe(std::uint64_t containerClass) {
-    auto name = QRNContainerClass::shortName(containerClass);
-    return name.empty() ? std::to_string(containerClass)
-                        : fmt::format("{} ({})", name, containerClass);
-}
-
 std::string ContainerClassName::allNames() {
     std::string names;
     for (std::uint64_t cls = kQRNContainerClassAppBundle; cls < kQRNContainerClassMax; ++cls) {

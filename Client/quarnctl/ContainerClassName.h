@@ -12,8 +12,6 @@ namespace quarn::ctl {
 class ContainerClassName {
 public:
     static std::optional<std::uint64_t> parse(std::string_view text);
-    // "appData (2)"; the bare number for classes without a name.
-    static std::string describe(std::uint64_t containerClass);
     // "app, appData, ..." for help texts and refusals.
     static std::string allNames();
 };

@@ -11,7 +11,7 @@ Quarnctl::TextPrinter Quarnctl::silent() {
     return [](const Value& reply, ReplyPrinter&) { return QRNClientReplies::status(reply); };
 }
 
-void Quarnctl::addContainerCommands() {
+void Quarnctl::addCreateAndLookupCommands() {
     for (bool create : {true, false}) {
         auto* command =
             create ? app_.add_subcommand("create", "Create a container, or find the one there is")
@@ -29,7 +29,9 @@ void Quarnctl::addContainerCommands() {
             };
         });
     }
+}
 
+void Quarnctl::addListAndDeleteCommands() {
     auto* list = app_.add_subcommand("list", "List the containers of a class");
     auto& listArgs = containerArgs(list, false, true);
     list->callback([this, &listArgs] {
@@ -52,7 +54,9 @@ void Quarnctl::addContainerCommands() {
                             silent());
         };
     });
+}
 
+void Quarnctl::addMetadataAndUsageCommands() {
     auto* metadata =
         app_.add_subcommand("metadata", "Path, transient flag and info of a container");
     auto& metadataArgs = containerArgs(metadata, true, false);

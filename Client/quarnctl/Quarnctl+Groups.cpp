@@ -38,7 +38,9 @@ void Quarnctl::addGroupCommands() {
                                      [](ReplyPrinter& p, const auto& r) { p.groupContainers(r); }));
         };
     });
+}
 
+void Quarnctl::addPathCommands() {
     auto* systemPath = app_.add_subcommand("system-path", "Path of a system container");
     auto& systemId = strings_.emplace_back();
     auto* systemIdOption =

@@ -22,9 +22,12 @@ Quarnctl::Quarnctl(std::ostream& out, std::ostream& err)
     app_.add_flag("--json", json_, "Print the reply dictionary as JSON");
     app_.add_option("--timeout", timeoutSeconds_, "Seconds to wait for quarnd (default 60)")
         ->check(CLI::PositiveNumber);
-    addContainerCommands();
+    addCreateAndLookupCommands();
+    addListAndDeleteCommands();
+    addMetadataAndUsageCommands();
     addInfoCommands();
     addGroupCommands();
+    addPathCommands();
     addRawCommand();
 }
 

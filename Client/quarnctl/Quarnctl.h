@@ -57,9 +57,12 @@ private:
     // Success shows nothing.
     static TextPrinter silent();
 
-    void addContainerCommands();
+    void addCreateAndLookupCommands();
+    void addListAndDeleteCommands();
+    void addMetadataAndUsageCommands();
     void addInfoCommands();
     void addGroupCommands();
+    void addPathCommands(); // system container, system group, personas
     void addRawCommand();
     ContainerArgs& containerArgs(CLI::App* command, bool withUUID, bool withTransient);
     CLI::Option* addIdentifier(CLI::App* command, std::string& into, const std::string& what);

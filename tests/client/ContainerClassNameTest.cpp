@@ -17,7 +17,6 @@ TEST(ContainerClassName, EveryClassByNumberAndByName) {
     }
     EXPECT_EQ(ContainerClassName::parse("APPDATA"), 2u);
     EXPECT_EQ(ContainerClassName::parse("systemgroup"), 13u);
-    EXPECT_EQ(ContainerClassName::describe(2), "appData (2)");
 }
 
 TEST(ContainerClassName, RefusesWhatIsNoClass) {
