@@ -43,6 +43,16 @@ std::string stringAt(const Value& reply, std::string_view key) {
     return value && value->asString() ? *value->asString() : std::string();
 }
 
+std::optional<bool> boolAt(const Value& reply, std::string_view key) {
+    const Value* value = reply.get(key);
+    return value ? value->asBool() : std::nullopt;
+}
+
+const Value::Array* arrayAt(const Value& reply, std::string_view key) {
+    const Value* value = reply.get(key);
+    return value ? value->asArray() : nullptr;
+}
+
 std::optional<UUID> uuidAt(const Value& reply, std::string_view key) {
     const Value* value = reply.get(key);
     return value ? value->asUUID() : std::nullopt;
@@ -69,7 +79,7 @@ TEST_F(CommandRequests, CreateThenLookUpFindsTheSameContainerWithItsSubdirectori
         const auto replies = repliesOf(P::kAllowed, {createOrLookup(identifier, c.containerClass),
                                                      createOrLookup(identifier, c.containerClass)});
         ASSERT_EQ(replyError(replies[0]), kQRNErrorNone) << replies[0].description();
-        EXPECT_EQ(replies[0].get("ReplyExisted")->asBool(), false);
+        EXPECT_EQ(boolAt(replies[0], "ReplyExisted"), false);
         EXPECT_EQ(stringAt(replies[0], "ReplyIdentifier"), identifier);
         const std::optional<UUID> uuid = uuidAt(replies[0], "ReplyUUID");
         ASSERT_TRUE(uuid);
@@ -82,7 +92,7 @@ TEST_F(CommandRequests, CreateThenLookUpFindsTheSameContainerWithItsSubdirectori
             EXPECT_TRUE(std::filesystem::is_directory(path / subdirectory)) << subdirectory;
         }
         ASSERT_EQ(replyError(replies[1]), kQRNErrorNone);
-        EXPECT_EQ(replies[1].get("ReplyExisted")->asBool(), true);
+        EXPECT_EQ(boolAt(replies[1], "ReplyExisted"), true);
         EXPECT_EQ(uuidAt(replies[1], "ReplyUUID"), uuid);
         EXPECT_EQ(stringAt(replies[1], "ReplyPath"), path.string());
     }
@@ -240,14 +250,16 @@ TEST_F(CommandRequests, ListingAndDeletionOfContainers) {
         P::kAllowed, {createOrLookup(identifiers[0], 9), createOrLookup(identifiers[1], 9)});
     const auto listed = repliesOf(P::kAllowed, {Requests::containersOfClass(9, false)});
     ASSERT_EQ(replyError(listed[0]), kQRNErrorNone);
-    const Value::Array* ids = listed[0].get("ReplyIdsArray")->asArray();
-    const Value::Array* uuids = listed[0].get("ReplyUUIDsArray")->asArray();
+    const Value::Array* ids = arrayAt(listed[0], "ReplyIdsArray");
+    const Value::Array* uuids = arrayAt(listed[0], "ReplyUUIDsArray");
     ASSERT_TRUE(ids && uuids);
     ASSERT_EQ(ids->size(), 2u);
     ASSERT_EQ(uuids->size(), 2u);
     for (std::size_t i = 0; i < 2; ++i) {
-        const auto at = std::find(identifiers.begin(), identifiers.end(), *(*ids)[i].asString());
-        ASSERT_NE(at, identifiers.end());
+        const std::string* id = (*ids)[i].asString();
+        ASSERT_NE(id, nullptr);
+        const auto at = std::find(identifiers.begin(), identifiers.end(), *id);
+        ASSERT_NE(at, identifiers.end()) << *id;
         EXPECT_EQ((*uuids)[i].asUUID(), uuidAt(created[at - identifiers.begin()], "ReplyUUID"));
     }
 
@@ -260,8 +272,9 @@ TEST_F(CommandRequests, ListingAndDeletionOfContainers) {
     EXPECT_FALSE(std::filesystem::exists(path));
     EXPECT_EQ(replyError(deleted[1]), kQRNErrorContainerNotFound) << deleted[1].description();
     EXPECT_EQ(deleted[1].get("ReplyPath"), nullptr);
-    EXPECT_EQ(deleted[2].get("ReplyIdsArray")->description(),
-              Value(Value::Array{identifiers[1]}).description());
+    const Value::Array* left = arrayAt(deleted[2], "ReplyIdsArray");
+    ASSERT_NE(left, nullptr);
+    EXPECT_EQ(Value(*left), Value(Value::Array{identifiers[1]})) << Value(*left).description();
 }
 
 TEST_F(CommandRequests, CommandsReplyingFromTheirCompletionReplyOnce) {

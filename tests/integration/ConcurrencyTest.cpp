@@ -4,6 +4,9 @@
 #include "Client/QRNClientRequests.h"
 #include "ServingTest.h"
 
+#include <fmt/format.h>
+
+#include <algorithm>
 #include <latch>
 #include <map>
 #include <set>
