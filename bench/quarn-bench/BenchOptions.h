@@ -2,6 +2,7 @@
 // What the command line sets.
 
 #include <filesystem>
+#include <string>
 
 namespace quarn::loadbench {
 
@@ -15,6 +16,10 @@ struct BenchOptions {
     int creates = 300;
     int rebuildContainers = 10000;
     int memoryContainers = 100000;
+    std::string only;      // one measure ("lookup", "create", "rebuild", "memory"), or all
+    bool keepRoot = false; // leave the temporary root (and the daemon's log) behind
+
+    bool runs(const char* measure) const { return only.empty() || only == measure; }
 };
 
 } // namespace quarn::loadbench

@@ -27,6 +27,8 @@ public:
     bool waitForSocket(const std::filesystem::path& socket, std::chrono::seconds timeout);
     // VmRSS in KiB.
     long residentKiB() const;
+    // User and system time of all its threads so far, in seconds.
+    double cpuSeconds() const;
     // SIGTERM, then SIGKILL when it has not ended in `grace`. The exit code,
     // or 128 + the signal that ended it.
     int stop(std::chrono::seconds grace = std::chrono::seconds(20));

@@ -1,6 +1,7 @@
 #include "CreateBench.h"
 
 #include "ContainerFactory.h"
+#include "CpuTime.h"
 #include "Fail.h"
 #include "FrameClient.h"
 #include "Requests.h"
@@ -49,8 +50,10 @@ CreateBench::CreateBench(const BenchOptions& options, DaemonRunner& daemon, Load
     metadata_ = ContainerFactory().metadataBytes(kAppDataClass, identifierAt(0), url);
 }
 
-double CreateBench::createWithDaemon(int count, LatencySamples& samples) {
+void CreateBench::createWithDaemon(int count, LatencySamples& samples, Totals& totals) {
     FrameClient client(daemon_.socket());
+    const ChildProcess* process = daemon_.process();
+    const double cpuBefore = process ? process->cpuSeconds() : 0;
     const auto begin = Clock::now();
     for (int i = 0; i < count; ++i) {
         const auto start = Clock::now();
@@ -63,7 +66,8 @@ double CreateBench::createWithDaemon(int count, LatencySamples& samples) {
             fail("create failed: {}", reply.description());
         }
     }
-    return std::chrono::duration<double>(Clock::now() - begin).count();
+    totals.seconds += std::chrono::duration<double>(Clock::now() - begin).count();
+    totals.cpu += process ? process->cpuSeconds() - cpuBefore : 0;
 }
 
 void CreateBench::createOneBare(const std::filesystem::path& name) const {
@@ -90,25 +94,26 @@ void CreateBench::createOneBare(const std::filesystem::path& name) const {
     }
 }
 
-double CreateBench::createBare(int count, LatencySamples& samples) {
+void CreateBench::createBare(int count, LatencySamples& samples, Totals& totals) {
+    const double cpuBefore = threadCpuSeconds();
     const auto begin = Clock::now();
     for (int i = 0; i < count; ++i) {
         const auto start = Clock::now();
         createOneBare(UUID::random().string());
         samples.add(nanosecondsSince(start));
     }
-    return std::chrono::duration<double>(Clock::now() - begin).count();
+    totals.seconds += std::chrono::duration<double>(Clock::now() - begin).count();
+    totals.cpu += threadCpuSeconds() - cpuBefore;
 }
 
 void CreateBench::run(ResultTable& table) {
     const int rounds = std::max(1, options_.rounds);
     const int perRound = std::max(1, options_.creates / rounds);
     LatencySamples daemonSamples, bareSamples;
-    double daemonSeconds = 0;
-    double bareSeconds = 0;
+    Totals daemon, bare;
     for (int round = 0; round < rounds; ++round) {
-        daemonSeconds += createWithDaemon(perRound, daemonSamples);
-        bareSeconds += createBare(perRound, bareSamples);
+        createWithDaemon(perRound, daemonSamples, daemon);
+        createBare(perRound, bareSamples, bare);
     }
     const double total = perRound * rounds;
     table.add({"create, per container (p50)", "us", daemonSamples.percentileMicroseconds(50),
@@ -116,7 +121,11 @@ void CreateBench::run(ResultTable& table) {
     table.add({"create, per container (p99)", "us", daemonSamples.percentileMicroseconds(99),
                bareSamples.percentileMicroseconds(99)});
     table.add(
-        {"create throughput, 1 client", "cont/s", total / daemonSeconds, total / bareSeconds});
+        {"create throughput, 1 client", "cont/s", total / daemon.seconds, total / bare.seconds});
+    if (daemon_.process()) {
+        table.add(
+            {"server CPU per create", "us", daemon.cpu * 1e6 / total, bare.cpu * 1e6 / total});
+    }
 }
 
 } // namespace quarn::loadbench

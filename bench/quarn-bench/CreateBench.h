@@ -23,9 +23,12 @@ public:
     void run(ResultTable& table);
 
 private:
-    // Each returns the total time taken, in seconds.
-    double createWithDaemon(int count, LatencySamples& samples);
-    double createBare(int count, LatencySamples& samples);
+    struct Totals {
+        double seconds = 0; // wall-clock time
+        double cpu = 0;     // CPU time of the side doing the work
+    };
+    void createWithDaemon(int count, LatencySamples& samples, Totals& totals);
+    void createBare(int count, LatencySamples& samples, Totals& totals);
     void createOneBare(const std::filesystem::path& name) const;
 
     const BenchOptions& options_;

@@ -27,6 +27,8 @@ public:
     // Stops it; complains when it does not exit cleanly.
     void stop();
     long residentKiB() const;
+    // The daemon process, when this tool started it.
+    const ChildProcess* process() const { return process_.get(); }
 
 private:
     void waitUntilServing();

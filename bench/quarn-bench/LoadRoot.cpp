@@ -10,6 +10,7 @@
 
 #include <stdlib.h>
 
+#include <cstdio>
 #include <fstream>
 
 namespace quarn::loadbench {
@@ -23,7 +24,7 @@ void writeFile(const std::filesystem::path& path, const char* contents) {
 
 } // namespace
 
-LoadRoot::LoadRoot(const std::filesystem::path& base) {
+LoadRoot::LoadRoot(const std::filesystem::path& base, bool keep) : keep_(keep) {
     std::string tmpl = (base / "quarn-bench.XXXXXX").string();
     if (!mkdtemp(tmpl.data())) {
         fail("cannot make a directory in {}", base.string());
@@ -40,6 +41,11 @@ LoadRoot::LoadRoot(const std::filesystem::path& base) {
 
 LoadRoot::~LoadRoot() {
     (void)FirstBootMarker(root_).remove();
+    if (keep_) {
+        std::printf("quarn-bench: root kept at %s\n", root_.c_str());
+        QRNDaemonContext::setCurrent(nullptr);
+        return;
+    }
     // Through the file manager: it removes a 100k-container tree fastest.
     (void)QRNFileManager::defaultManager().removeItemAtURL(root_);
     QRNDaemonContext::setCurrent(nullptr);

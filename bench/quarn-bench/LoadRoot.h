@@ -16,8 +16,8 @@ namespace quarn::loadbench {
 
 class LoadRoot {
 public:
-    // A fresh root in a new directory below `base`.
-    explicit LoadRoot(const std::filesystem::path& base);
+    // A fresh root in a new directory below `base`; `keep` leaves it there.
+    LoadRoot(const std::filesystem::path& base, bool keep);
     ~LoadRoot();
     LoadRoot(const LoadRoot&) = delete;
     LoadRoot& operator=(const LoadRoot&) = delete;
@@ -33,6 +33,7 @@ private:
     void writeRegistryEntry() const;
 
     std::filesystem::path root_;
+    bool keep_;
     std::shared_ptr<QRNDaemonContext> context_;
 };
 

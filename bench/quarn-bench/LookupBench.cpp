@@ -32,6 +32,7 @@ void LookupBench::Figures::add(const Run& run) {
     p50.push_back(run.samples.percentileMicroseconds(50));
     p99.push_back(run.samples.percentileMicroseconds(99));
     throughput.push_back(run.throughput);
+    cpu.push_back(run.cpu);
 }
 
 LookupBench::LookupBench(const BenchOptions& options, DaemonRunner& daemon, LoadRoot& root)
@@ -77,7 +78,8 @@ void LookupBench::clientLoop(const std::filesystem::path& socket, const Value& r
     }
 }
 
-LookupBench::Run LookupBench::measure(const std::filesystem::path& socket, int clients,
+LookupBench::Run LookupBench::measure(const std::filesystem::path& socket,
+                                      const ChildProcess* server, int clients,
                                       double seconds) const {
     std::vector<LatencySamples> perClient(static_cast<std::size_t>(clients));
     std::vector<std::thread> threads;
@@ -93,6 +95,7 @@ LookupBench::Run LookupBench::measure(const std::filesystem::path& socket, int c
     while (ready.load() < clients) {
         std::this_thread::yield();
     }
+    const double cpuBefore = server ? server->cpuSeconds() : 0;
     const auto start = Clock::now();
     deadline =
         start + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
@@ -106,6 +109,10 @@ LookupBench::Run LookupBench::measure(const std::filesystem::path& socket, int c
         run.samples.append(samples);
     }
     run.throughput = static_cast<double>(run.samples.count()) / elapsed;
+    if (server) {
+        run.cpu =
+            (server->cpuSeconds() - cpuBefore) * 1e6 / static_cast<double>(run.samples.count());
+    }
     return run;
 }
 
@@ -121,14 +128,14 @@ void LookupBench::run(ResultTable& table) {
     }
     const int many = std::max(1, options_.clients);
     // Warm both sides up (first connections, caches, the daemon's pool).
-    measure(daemon_.socket(), many, 0.2);
-    measure(echoSocket, many, 0.2);
+    measure(daemon_.socket(), daemon_.process(), many, 0.2);
+    measure(echoSocket, &echo, many, 0.2);
     Figures daemonOne, echoOne, daemonMany, echoMany;
     for (int round = 0; round < options_.rounds; ++round) {
-        daemonOne.add(measure(daemon_.socket(), 1, options_.seconds));
-        echoOne.add(measure(echoSocket, 1, options_.seconds));
-        daemonMany.add(measure(daemon_.socket(), many, options_.seconds));
-        echoMany.add(measure(echoSocket, many, options_.seconds));
+        daemonOne.add(measure(daemon_.socket(), daemon_.process(), 1, options_.seconds));
+        echoOne.add(measure(echoSocket, &echo, 1, options_.seconds));
+        daemonMany.add(measure(daemon_.socket(), daemon_.process(), many, options_.seconds));
+        echoMany.add(measure(echoSocket, &echo, many, options_.seconds));
     }
     using Goal = ResultTable::Goal;
     const std::string n = fmt::format("{} clients", many);
@@ -141,6 +148,10 @@ void LookupBench::run(ResultTable& table) {
     table.add({"lookup p99, " + n, "us", median(daemonMany.p99), median(echoMany.p99)});
     table.add({"lookup throughput, " + n, "req/s", median(daemonMany.throughput),
                median(echoMany.throughput), Goal::RatioAtLeast, 0.6});
+    if (daemon_.process()) {
+        table.add(
+            {"server CPU per lookup, " + n, "us", median(daemonMany.cpu), median(echoMany.cpu)});
+    }
 }
 
 } // namespace quarn::loadbench

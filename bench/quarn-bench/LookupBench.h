@@ -6,6 +6,7 @@
 // so a machine busy with other work disturbs both sides alike.
 
 #include "BenchOptions.h"
+#include "ChildProcess.h"
 #include "DaemonRunner.h"
 #include "LatencySamples.h"
 #include "LoadRoot.h"
@@ -28,15 +29,18 @@ private:
     struct Run {
         LatencySamples samples;
         double throughput = 0; // requests per second
+        double cpu = 0;        // the server's CPU time per request, microseconds
     };
     struct Figures {
-        std::vector<double> p50, p99, throughput;
+        std::vector<double> p50, p99, throughput, cpu;
         void add(const Run& run);
     };
 
     // One container per client; answers the reply a lookup gets.
     Value prepare();
-    Run measure(const std::filesystem::path& socket, int clients, double seconds) const;
+    // `server`, when known, is weighed for its CPU time.
+    Run measure(const std::filesystem::path& socket, const ChildProcess* server, int clients,
+                double seconds) const;
     static void clientLoop(const std::filesystem::path& socket, const Value& request,
                            const std::atomic<bool>& go, std::atomic<int>& ready,
                            std::chrono::steady_clock::time_point& deadline, LatencySamples& out);

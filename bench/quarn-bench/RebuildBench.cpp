@@ -1,6 +1,7 @@
 #include "RebuildBench.h"
 
 #include "ContainerFactory.h"
+#include "CpuTime.h"
 #include "Fail.h"
 #include "FrameClient.h"
 #include "Requests.h"
@@ -40,19 +41,26 @@ double median(std::vector<double> values) {
 RebuildBench::RebuildBench(const BenchOptions& options, DaemonRunner& daemon)
     : options_(options), daemon_(daemon) {}
 
-double RebuildBench::firstLookup(std::uint64_t containerClass, const std::string& identifier,
-                                 std::uint64_t expectedError) const {
+RebuildBench::Timing RebuildBench::firstLookup(std::uint64_t containerClass,
+                                               const std::string& identifier,
+                                               std::uint64_t expectedError) const {
     FrameClient client(daemon_.socket());
+    const ChildProcess* process = daemon_.process();
+    const double cpuBefore = process ? process->cpuSeconds() : 0;
     const auto start = Clock::now();
     const Value reply = client.roundTrip(containerRequest(identifier, containerClass, false));
-    const double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+    Timing timing;
+    timing.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+    timing.cpu = process ? process->cpuSeconds() - cpuBefore : 0;
     if (FrameClient::replyError(reply) != expectedError) {
         fail("lookup of {} in class {}: {}", identifier, containerClass, reply.description());
     }
-    return seconds;
+    return timing;
 }
 
-double RebuildBench::readAndParseAll(const std::filesystem::path& classDirectory, int expected) {
+RebuildBench::Timing RebuildBench::readAndParseAll(const std::filesystem::path& classDirectory,
+                                                   int expected) {
+    const double cpuBefore = threadCpuSeconds();
     const auto start = Clock::now();
     DIR* directory = ::opendir(classDirectory.c_str());
     if (directory == nullptr) {
@@ -83,7 +91,8 @@ double RebuildBench::readAndParseAll(const std::filesystem::path& classDirectory
         fail("parsed {} metadata files in {}, expected {}", parsed, classDirectory.string(),
              expected);
     }
-    return std::chrono::duration<double>(Clock::now() - start).count();
+    return {std::chrono::duration<double>(Clock::now() - start).count(),
+            threadCpuSeconds() - cpuBefore};
 }
 
 void RebuildBench::runRebuild(ResultTable& table) {
@@ -93,14 +102,22 @@ void RebuildBench::runRebuild(ResultTable& table) {
     factory.make(kRebuildClass, prefix, count);
     const auto directory = factory.classDirectory(kRebuildClass);
     readAndParseAll(directory, count); // both sides then find the files cached
-    std::vector<double> daemonTimes, floorTimes;
+    std::vector<double> daemonTimes, floorTimes, daemonCpu, floorCpu;
     for (int round = 0; round < std::max(1, options_.rounds); ++round) {
         daemon_.start();
-        daemonTimes.push_back(firstLookup(kRebuildClass, prefix + "0", kReplySuccess));
-        floorTimes.push_back(readAndParseAll(directory, count));
+        const Timing daemon = firstLookup(kRebuildClass, prefix + "0", kReplySuccess);
+        const Timing bare = readAndParseAll(directory, count);
+        daemonTimes.push_back(daemon.seconds);
+        daemonCpu.push_back(daemon.cpu);
+        floorTimes.push_back(bare.seconds);
+        floorCpu.push_back(bare.cpu);
     }
     table.add({fmt::format("cache rebuild, {} containers", count), "ms", median(daemonTimes) * 1e3,
                median(floorTimes) * 1e3, ResultTable::Goal::RatioAtMost, 1.5});
+    if (daemon_.process()) {
+        table.add(
+            {"server CPU, cache rebuild", "ms", median(daemonCpu) * 1e3, median(floorCpu) * 1e3});
+    }
 }
 
 void RebuildBench::runMemory(ResultTable& table) {
@@ -110,7 +127,7 @@ void RebuildBench::runMemory(ResultTable& table) {
     daemon_.start();
     firstLookup(kEmptyClass, prefix + "0", kNotFound);
     const long empty = daemon_.residentKiB();
-    const double seconds = firstLookup(kMemoryClass, prefix + "0", kReplySuccess);
+    const double seconds = firstLookup(kMemoryClass, prefix + "0", kReplySuccess).seconds;
     const long full = daemon_.residentKiB();
     table.add({fmt::format("cache rebuild, {} containers", count), "ms", seconds * 1e3});
     table.add({"memory per cached container", "B",

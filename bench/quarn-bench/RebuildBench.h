@@ -23,11 +23,15 @@ public:
     void runMemory(ResultTable& table);
 
 private:
-    // Seconds for the first lookup of a container of the class.
-    double firstLookup(std::uint64_t containerClass, const std::string& identifier,
+    struct Timing {
+        double seconds = 0; // wall-clock
+        double cpu = 0;     // CPU time of the side doing the work
+    };
+    // The first lookup of a container of the class.
+    Timing firstLookup(std::uint64_t containerClass, const std::string& identifier,
                        std::uint64_t expectedError) const;
-    // Seconds to list the directory and read and parse every metadata file.
-    static double readAndParseAll(const std::filesystem::path& classDirectory, int expected);
+    // Listing the directory and reading and parsing every metadata file.
+    static Timing readAndParseAll(const std::filesystem::path& classDirectory, int expected);
 
     const BenchOptions& options_;
     DaemonRunner& daemon_;

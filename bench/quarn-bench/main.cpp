@@ -59,18 +59,26 @@ void checkSetup(BenchOptions& options) {
 }
 
 void runAll(BenchOptions& options) {
-    LoadRoot root(options.work);
+    LoadRoot root(options.work, options.keepRoot);
     DaemonRunner daemon(options, root);
     ResultTable table;
     std::printf("quarn-bench: root %s, %d rounds of %.1f s, %d clients\n", root.path().c_str(),
                 options.rounds, options.seconds, options.clients);
     daemon.start();
-    LookupBench(options, daemon, root).run(table);
-    CreateBench(options, daemon, root).run(table);
+    if (options.runs("lookup")) {
+        LookupBench(options, daemon, root).run(table);
+    }
+    if (options.runs("create")) {
+        CreateBench(options, daemon, root).run(table);
+    }
     if (daemon.ownsDaemon()) {
         RebuildBench rebuild(options, daemon);
-        rebuild.runRebuild(table);
-        rebuild.runMemory(table);
+        if (options.runs("rebuild")) {
+            rebuild.runRebuild(table);
+        }
+        if (options.runs("memory")) {
+            rebuild.runMemory(table);
+        }
         daemon.stop();
     } else {
         table.skip("cache rebuild", "needs a daemon this tool starts (no --socket)");
@@ -110,6 +118,9 @@ int main(int argc, char** argv) {
     app.add_option("--memory-containers", options.memoryContainers)
         ->capture_default_str()
         ->check(CLI::Range(1, 1000000));
+    app.add_option("--only", options.only, "run one measure")
+        ->check(CLI::IsMember({"lookup", "create", "rebuild", "memory"}));
+    app.add_flag("--keep-root", options.keepRoot, "keep the temporary root and the daemon's log");
     app.add_option("--echo-server", echoSocket, "internal: serve the echo floor on this socket");
     app.add_option("--echo-reply", echoReply, "internal: the echo server's reply, CBOR in hex");
     CLI11_PARSE(app, argc, argv);
