@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 #include <sodium.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <climits>
@@ -62,12 +63,27 @@ LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {
     return table_;
 }
 
+// The path the kernel reports for a process is the one in the process's own
+// mount namespace: an unprivileged user may bind another file over a
+// registered program there. The running file must be the very file at that
+// path here.
+bool LinuxCodeSigningRegistry::isRegisteredFile(const CodeSigningRegistryEntry& entry, pid_t pid,
+                                                int exe) {
+    struct stat running {};
+    struct stat registered {};
+    if (::fstat(exe, &running) != 0 || ::stat(entry.program.c_str(), &registered) != 0 ||
+        running.st_dev != registered.st_dev || running.st_ino != registered.st_ino) {
+        QRN_LOG_ERROR(LogCategory::Vell,
+                      "The executable of pid {} is not the file {} of code-signing entry {}", pid,
+                      entry.program, entry.fileName);
+        return false;
+    }
+    return true;
+}
+
 bool LinuxCodeSigningRegistry::digestMatches(const CodeSigningRegistryEntry& entry, pid_t pid,
-                                             std::uint32_t startTime) {
-    // Through /proc/<pid>/exe, so the file hashed is the one running even
-    // when another has since been put at its path.
-    Descriptor exe(::open(procPath(pid, "exe").c_str(), O_RDONLY | O_CLOEXEC));
-    const auto digest = exe.valid() ? digests_.digestOf(exe.get()) : std::nullopt;
+                                             std::uint32_t startTime, int exe) {
+    const auto digest = digests_.digestOf(exe);
     if (!digest || !isSameProcess(pid, startTime)) {
         QRN_LOG_ERROR(LogCategory::Vell, "Cannot hash the executable of pid {} ({})", pid,
                       entry.program);
@@ -89,9 +105,6 @@ LinuxCodeSigningRegistry::infoForAuditToken(const IpcPeer::AuditToken& token) {
         return std::nullopt;
     }
     const auto pid = static_cast<pid_t>(fields.pid);
-    if (!isSameProcess(pid, fields.startTime)) {
-        return std::nullopt;
-    }
     const std::optional<std::string> program = executablePath(pid);
     const TablePtr table = currentTable();
     const auto found = program ? table->find(*program) : table->end();
@@ -99,10 +112,19 @@ LinuxCodeSigningRegistry::infoForAuditToken(const IpcPeer::AuditToken& token) {
         return std::nullopt;
     }
     const CodeSigningRegistryEntry& entry = *found->second;
-    if (entry.sha256 && !digestMatches(entry, pid, fields.startTime)) {
+    // Through /proc/<pid>/exe, so the file checked is the one running even
+    // when another has since been put at its path.
+    Descriptor exe(::open(procPath(pid, "exe").c_str(), O_RDONLY | O_CLOEXEC));
+    if (!exe.valid() || !isRegisteredFile(entry, pid, exe.get())) {
         return std::nullopt;
     }
-    // The pid may have been reused between the first check and the readlink.
+    if (entry.sha256 && !digestMatches(entry, pid, fields.startTime, exe.get())) {
+        return std::nullopt;
+    }
+    // Checked once, after the readlink: a process whose pid and start time
+    // still match now is the one whose executable was read, since a pid is
+    // never given back to a process that has ended. (Each check reads
+    // /proc/<pid>/stat, the dearest step of a request.)
     if (!isSameProcess(pid, fields.startTime)) {
         return std::nullopt;
     }

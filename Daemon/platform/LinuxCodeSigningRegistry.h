@@ -1,8 +1,9 @@
 #pragma once
 // CodeSigningRegistry over "<root>/etc/quarnd/codesign.d". A process is
 // matched by the executable the kernel reports for it ("/proc/<pid>/exe" of
-// the host, whatever the root prefix), and, when the entry carries a digest,
-// by the SHA-256 of that very file. The directory is reread when it changes;
+// the host, whatever the root prefix), which must be the very file at that
+// path in the daemon's view, and, when the entry carries a digest, by the
+// SHA-256 of that file. The directory is reread when it changes;
 // the check is a non-blocking poll at each lookup.
 
 #include "Daemon/platform/CodeSigningRegistry.h"
@@ -30,7 +31,10 @@ private:
 
     // The current table, reread first when the directory changed.
     TablePtr currentTable();
-    bool digestMatches(const CodeSigningRegistryEntry& entry, pid_t pid, std::uint32_t startTime);
+    // `exe` is an open descriptor of the process's running executable.
+    static bool isRegisteredFile(const CodeSigningRegistryEntry& entry, pid_t pid, int exe);
+    bool digestMatches(const CodeSigningRegistryEntry& entry, pid_t pid, std::uint32_t startTime,
+                       int exe);
 
     std::filesystem::path directory_;
     ExecutableDigestCache digests_;

@@ -10,7 +10,11 @@
 #include <sodium.h>
 
 #include <fcntl.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -102,6 +106,74 @@ TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
     EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
     fields.pid = 0;
     EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
+}
+
+// Runs `program` in a child, after binding `cover` over it in a mount
+// namespace of the child's own when `cover` is given; answers the child's pid
+// once it runs `program`, or -1 when that cannot be set up.
+static pid_t runCovered(const std::string& program, const std::string& cover) {
+    int ready[2];
+    if (::pipe2(ready, O_CLOEXEC) != 0) {
+        return -1;
+    }
+    const pid_t child = ::fork();
+    if (child == 0) {
+        if (!cover.empty() &&
+            (::unshare(CLONE_NEWNS) != 0 ||
+             ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+             ::mount(cover.c_str(), program.c_str(), nullptr, MS_BIND, nullptr) != 0)) {
+            ::_exit(1);
+        }
+        // The pipe closes on exec: the parent then knows the child runs it.
+        ::execl(program.c_str(), program.c_str(), "60", static_cast<char*>(nullptr));
+        ::_exit(1);
+    }
+    ::close(ready[1]);
+    char byte = 0;
+    while (::read(ready[0], &byte, 1) < 0 && errno == EINTR) {
+    }
+    ::close(ready[0]);
+    int status = 0;
+    if (child < 0 || ::waitpid(child, &status, WNOHANG) != 0) {
+        return -1;
+    }
+    return child;
+}
+
+static void stop(pid_t child) {
+    ::kill(child, SIGKILL);
+    ::waitpid(child, nullptr, 0);
+}
+
+TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotTheProgram) {
+    // Copies, so that each is a file of its own.
+    const std::filesystem::path program = root_.path() / "registered";
+    const std::filesystem::path impostor = root_.path() / "impostor";
+    std::filesystem::copy_file("/bin/sleep", program);
+    std::filesystem::copy_file("/bin/sleep", impostor);
+    write("registered.plist", entry(program.string(), "com.orvex.registered"));
+    LinuxCodeSigningRegistry registry(paths_);
+
+    const pid_t genuine = runCovered(program.string(), "");
+    ASSERT_GT(genuine, 0);
+    auto peer = IpcPeer::fromPID(genuine);
+    ASSERT_TRUE(peer);
+    EXPECT_TRUE(registry.infoForAuditToken(peer->auditToken()));
+    stop(genuine);
+
+    const pid_t covered = runCovered(program.string(), impostor.string());
+    if (covered < 0) {
+        GTEST_SKIP() << "no mount namespace for the test";
+    }
+    // The kernel names the registered path for it, as an unprivileged user
+    // in a user and mount namespace of its own could arrange.
+    EXPECT_EQ(std::filesystem::read_symlink("/proc/" + std::to_string(covered) + "/exe"), program);
+    peer = IpcPeer::fromPID(covered);
+    ASSERT_TRUE(peer);
+    quarn::test::LogCapture log;
+    EXPECT_FALSE(registry.infoForAuditToken(peer->auditToken()));
+    EXPECT_TRUE(log.contains("is not the file")) << log.all();
+    stop(covered);
 }
 
 TEST_F(CodeSigningRegistryTest, FollowsTheDirectoryAppearingAndEntriesComingAndGoing) {
