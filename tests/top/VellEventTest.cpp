@@ -6,6 +6,7 @@
 #include "Daemon/QRNCommandQueue.h"
 #include "Daemon/QRNCommandTable.h"
 #include "Daemon/QRNVellEvent.h"
+#include "Daemon/QRNVellReply.h"
 #include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 
@@ -171,6 +172,20 @@ TEST_F(VellEventTest, DeathRowDeletionRepliesOnceFromItsCompletion) {
     ASSERT_EQ(replies.size(), 1u);
     EXPECT_EQ(replies[0], dictionaryOf({{"ReplyError", Value(1u)}}));
     EXPECT_FALSE(std::filesystem::exists(deathrow / "A"));
+}
+
+TEST_F(VellEventTest, AReplyAndItsCopiesGoOutOnceBetweenThem) {
+    // A handler that replies from its completion keeps a copy; should the
+    // dispatcher then report a late failure, the client must still get one
+    // reply, not two that the next request would mistake for its own.
+    QRNVellReply reply(connection_);
+    QRNVellReply completionCopy = reply;
+    reply.sendWithError(40);
+    completionCopy.sendWithError(1);
+    reply.sendWithError(40);
+    std::vector<Value> replies = connection_->replies();
+    ASSERT_EQ(replies.size(), 1u);
+    EXPECT_EQ(replyError(replies[0]), 40u);
 }
 
 } // namespace
