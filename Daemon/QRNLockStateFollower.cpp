@@ -13,9 +13,12 @@ QRNLockStateFollower::QRNLockStateFollower(std::shared_ptr<LockState> lockState,
     : lockState_(std::move(lockState)), queue_(std::move(queue)) {}
 
 void QRNLockStateFollower::lockstated_notification_callback() {
+    // Asked under the lock: two reports racing must apply their states in
+    // the order they read them, or a stale "locked" could win over a newer
+    // "unlocked" and leave the queue suspended.
+    std::lock_guard guard(mutex_);
     const std::int32_t state = lockState_->state();
     QRN_LOG_DEBUG(LogCategory::Startup, "LockState={}", state);
-    std::lock_guard guard(mutex_);
     if (state == LockState::kLocked) {
         if (lastState_ != LockState::kLocked) {
             queue_->suspend();

@@ -31,9 +31,9 @@ private:
     const std::shared_ptr<LockState> lockState_;
     const std::shared_ptr<Queue> queue_;
 
-    // Guards lastState_ and the queue's suspension made from it: the call
-    // at start runs on the listener queue, the notifications on the main
-    // queue.
+    // Guards lastState_, the query of the state and the queue's suspension
+    // made from it: the call at start runs on the listener queue, the
+    // notifications on the main queue.
     mutable std::mutex mutex_;
     std::int32_t lastState_ = kInitialState;
 };
