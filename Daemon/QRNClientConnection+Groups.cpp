@@ -28,6 +28,15 @@ private:
     Value owner_;
 };
 
+// The global write lock for one scope.
+class GlobalWriteHold {
+public:
+    GlobalWriteHold() { write_lock_all_identifiers(); }
+    ~GlobalWriteHold() { unlock_all_identifiers(); }
+    GlobalWriteHold(const GlobalWriteHold&) = delete;
+    GlobalWriteHold& operator=(const GlobalWriteHold&) = delete;
+};
+
 } // namespace
 
 CodeResult<std::vector<std::string>>
@@ -62,6 +71,9 @@ QRNClientConnection::groupContainersForOwnerIdentifier(const std::string& owner,
         }
         // The owner's groups are the client's to reach for this request.
         setAllowGroupIdLookup(true);
+        // The lookups below take no lock of their own: without this one, two
+        // requests reaching the same new group would each create it.
+        GlobalWriteHold globalLock;
         auto groups =
             groupContainerIdentifiersForOwnerIdentifier(owner, groupContainerClass, false);
         if (!groups) {

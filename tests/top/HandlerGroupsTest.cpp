@@ -5,6 +5,7 @@
 
 #include "Daemon/QRNCommandHandlers.h"
 #include "Daemon/QRNCommandTable.h"
+#include "Daemon/QRNLocks.h"
 #include "Daemon/QRNVellReply.h"
 #include "Daemon/codesigning/QRNGroupManager.h"
 #include "Daemon/model/QRNContainerClass.h"
@@ -54,6 +55,19 @@ TEST_F(HandlerGroupsTest, GroupContainersOfAnOwnerSkipTheOnesThatCannotBeMade) {
     EXPECT_TRUE(std::filesystem::is_directory(pathIn(reply, "ReplyGroupContainerDict", "group.a")));
     EXPECT_TRUE(cached("group.b", kQRNContainerClassAppGroup));
     EXPECT_EQ(reply.get("ReplySandboxTokenDict"), nullptr);
+}
+
+TEST_F(HandlerGroupsTest, AnOwnersGroupsAreFoundAndMadeUnderTheGlobalWriteLock) {
+    // Its lookups take no lock of their own, so two requests that reach the
+    // same new group at once would each create one.
+    mapping_->appGroups[kVellClient] = arrayOf({Value("group.a")});
+    std::vector<std::int32_t> states;
+    mapping_->onQuery = [&states] {
+        states.push_back(QRNLocks::shared().snapshot().allReaderWriterState);
+    };
+    ASSERT_EQ(replyError(send(groupRequest(13, "Identifier", kVellClient))), 1u);
+    EXPECT_EQ(states, std::vector<std::int32_t>{-1});
+    EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
 }
 
 TEST_F(HandlerGroupsTest, AnotherOwnersGroupsNeedALookupGrant) {

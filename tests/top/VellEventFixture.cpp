@@ -43,12 +43,18 @@ Result<std::string> FakeSandboxExtensions::issueFileExtension(std::string_view e
 
 std::optional<Value>
 RecordedGroupsMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
+    if (onQuery) {
+        onQuery();
+    }
     auto found = appGroups.find(identifier);
     return found == appGroups.end() ? std::nullopt : std::optional<Value>(found->second);
 }
 
 std::optional<Value>
 RecordedGroupsMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    if (onQuery) {
+        onQuery();
+    }
     auto found = systemGroups.find(identifier);
     return found == systemGroups.end() ? std::nullopt : std::optional<Value>(found->second);
 }

@@ -18,6 +18,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
+#include <functional>
 #include <initializer_list>
 #include <map>
 #include <memory>
@@ -96,6 +97,8 @@ public:
     std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier) override;
     std::map<std::string, Value, std::less<>> appGroups;
     std::map<std::string, Value, std::less<>> systemGroups;
+    // Called at each query, for a test to look at what holds then.
+    std::function<void()> onQuery;
 };
 
 class VellEventFixture : public ::testing::Test {
