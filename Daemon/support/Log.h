@@ -3,7 +3,8 @@
 // through one distributing sink so that start-up can add the rotating file
 // (and tests a capture) after the loggers exist.
 //
-// Levels of the rotating log: 3 -> error, 5 (notice) -> info, 7 -> debug.
+// Levels of the rotating log: 3 -> error, 5 (notice) -> info, 6 (info) and
+// 7 -> debug.
 // "fault" messages go out at critical.
 
 #include <spdlog/sinks/dist_sink.h>
@@ -60,10 +61,19 @@ public:
 
 } // namespace quarn
 
+// The arguments are only evaluated when the line is written: descriptions
+// passed to debug lines on hot paths cost nothing otherwise.
 #define QRN_LOG_AT(category, level, ...)                                                           \
-    SPDLOG_LOGGER_CALL((&::quarn::Log::logger(category)), level, __VA_ARGS__)
+    do {                                                                                           \
+        auto& qrnLogger_ = ::quarn::Log::logger(category);                                         \
+        if (qrnLogger_.should_log(level)) {                                                        \
+            SPDLOG_LOGGER_CALL((&qrnLogger_), level, __VA_ARGS__);                                 \
+        }                                                                                          \
+    } while (0)
 #define QRN_LOG_DEBUG(category, ...) QRN_LOG_AT(category, spdlog::level::debug, __VA_ARGS__)
-#define QRN_LOG_INFO(category, ...) QRN_LOG_AT(category, spdlog::level::info, __VA_ARGS__)
+// Info (6) lies below the default level (5, notice) and spdlog has no level
+// between info and debug: info lines are written from the debug level on.
+#define QRN_LOG_INFO(category, ...) QRN_LOG_AT(category, spdlog::level::debug, __VA_ARGS__)
 #define QRN_LOG_NOTICE(category, ...) QRN_LOG_AT(category, spdlog::level::info, __VA_ARGS__)
 #define QRN_LOG_ERROR(category, ...) QRN_LOG_AT(category, spdlog::level::err, __VA_ARGS__)
 #define QRN_LOG_FAULT(category, ...) QRN_LOG_AT(category, spdlog::level::critical, __VA_ARGS__)
