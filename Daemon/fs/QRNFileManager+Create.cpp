@@ -19,6 +19,20 @@ constexpr int kDirectoryPathFlags = O_PATH | O_DIRECTORY;
 // `mode`. Existing levels (links among them, as for mkdir -p) are entered
 // as they are. Answers 0 or the errno of the failing step.
 int makePath(Env& env, const std::filesystem::path& url, mode_t mode) {
+    // Usually only the leaf is missing: its parent is entered in one step
+    // then, instead of a walk of every level. A missing parent is left to
+    // the walk.
+    const auto parent = url.parent_path();
+    const auto leaf = url.filename();
+    if (!parent.empty() && !leaf.empty() && leaf != "." && leaf != "..") {
+        if (auto opened = env.openat(AT_FDCWD, parent.c_str(), kDirectoryPathFlags)) {
+            EnvFd dir(env, *opened);
+            auto made = env.mkdirat(dir.get(), leaf.c_str(), mode);
+            if (made || made.error() != ENOENT) {
+                return made ? 0 : made.error();
+            }
+        }
+    }
     auto start = env.openat(AT_FDCWD, url.is_absolute() ? "/" : ".", kDirectoryPathFlags);
     if (!start) {
         return start.error();
