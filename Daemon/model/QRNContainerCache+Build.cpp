@@ -92,7 +92,10 @@ QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdenti
     }
     Entry entry;
     entry.sandboxPopulated = populateSandbox && !transient;
-    for (const auto& item : items ? *items : std::vector<QRNFileManager::Item>{}) {
+    // By reference: a conditional with a temporary on one side would copy
+    // the whole listing.
+    static const std::vector<QRNFileManager::Item> kNoItems;
+    for (const auto& item : items ? *items : kNoItems) {
         if (!containerURL(item.url, cls)) {
             continue;
         }
@@ -102,8 +105,15 @@ QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdenti
                           item.url.string());
             continue;
         }
-        auto metadata = QRNMetadata::readAndValidateMetadataAtFileUrl(
-            item.url / QRNMetadata::kFileName, userIdentity, true);
+        // The reader has made sure the record's user is this entry's; a record
+        // of this entry's class then lies in its class directory, since that
+        // is the directory listed. Only a record of another class needs the
+        // path check (which reports it), and the check is most of a read.
+        const auto file = item.url / QRNMetadata::kFileName;
+        auto metadata = QRNMetadata::readAndValidateMetadataAtFileUrl(file, userIdentity, false);
+        if (metadata && (*metadata)->containerClass() != cls) {
+            metadata = QRNMetadata::readAndValidateMetadataAtFileUrl(file, userIdentity, true);
+        }
         if (!metadata) {
             // Reported (making the error logs it) and left out of the entry.
             QRN_ERROR(kQRNErrorNoMetadata,
