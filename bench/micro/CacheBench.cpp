@@ -9,6 +9,8 @@
 
 #include <benchmark/benchmark.h>
 
+#include <malloc.h>
+
 #include <cstdio>
 #include <cstdlib>
 #include <map>
@@ -80,6 +82,29 @@ void BM_CacheLookupWithIdentity(benchmark::State& state) {
     }
 }
 BENCHMARK(BM_CacheLookupWithIdentity);
+
+// Heap held per cached container (all threads' arenas), as a counter:
+// the entry of a class directory of 5000 containers, built once.
+void BM_CacheHeapPerContainer(benchmark::State& state) {
+    constexpr int kMany = 5000;
+    constexpr std::uint64_t kPluginDataClass = 4;
+    auto& root = bench::BenchRoot::shared();
+    for (int i = 0; i < kMany; ++i) {
+        root.makeContainer(kPluginDataClass, "com.example.bench.heap" + std::to_string(i));
+    }
+    auto identity = *QRNContainerIdentity::containerIdentityWithUserIdentity(
+        root.mobile(), "com.example.bench.heap0", kPluginDataClass);
+    double perContainer = 0;
+    for (auto _ : state) {
+        const auto before = mallinfo2().uordblks;
+        auto found = QRNContainerCache::sharedInstance().containerForContainerIdentity(
+            identity, false, true, true);
+        benchmark::DoNotOptimize(found);
+        perContainer = static_cast<double>(mallinfo2().uordblks - before) / kMany;
+    }
+    state.counters["heap_B_per_container"] = perContainer;
+}
+BENCHMARK(BM_CacheHeapPerContainer)->Iterations(1);
 
 // Floor: the same number of shared records in an ordered map under a mutex.
 void BM_Floor_MapLookup(benchmark::State& state) {

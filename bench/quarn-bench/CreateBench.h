@@ -3,7 +3,8 @@
 // creation on, one client), against the bare system calls of the same work
 // done by this tool on the same file system: make the staging directory and
 // the class's subdirectories with their modes, write a metadata file of the
-// same size, rename the directory into place.
+// same size, rename the directory into place. Beside it, the same calls
+// plus an owner and a protection class attribute on every item.
 
 #include "BenchOptions.h"
 #include "DaemonRunner.h"
@@ -28,8 +29,10 @@ private:
         double cpu = 0;     // CPU time of the side doing the work
     };
     void createWithDaemon(int count, LatencySamples& samples, Totals& totals);
-    void createBare(int count, LatencySamples& samples, Totals& totals);
-    void createOneBare(const std::filesystem::path& name) const;
+    // `ownerAndClass` also gives every item the owner and the protection
+    // class attribute, as the daemon must: a second, informative floor.
+    void createBare(int count, bool ownerAndClass, LatencySamples& samples, Totals& totals);
+    void createOneBare(const std::filesystem::path& name, bool ownerAndClass) const;
 
     const BenchOptions& options_;
     DaemonRunner& daemon_;
