@@ -159,9 +159,8 @@ public:
     // that holds the bundle (or its parent for plug-in and VPN data);
     // otherwise, and whenever that choice is not clear, the client's own.
     // Code 76 only without a client identity.
-    CodeResult<QRNUserIdentityPtr>
-    userIdentityForContainerIdentifier(const std::string& identifier,
-                                       std::uint64_t containerClass);
+    CodeResult<QRNUserIdentityPtr> userIdentityForContainerIdentifier(const std::string& identifier,
+                                                                      std::uint64_t containerClass);
     // The same choice for the owner of group containers, except that finding
     // no persona for the owner fails with 76.
     CodeResult<QRNUserIdentityPtr> userIdentityForGroupOwner(const std::string& owner);
@@ -170,14 +169,13 @@ public:
     // The owner's group containers of the class (7 or 13) by group
     // identifier, made when missing. Grants group lookups for the rest of the
     // request. A group that cannot be made is logged and left out.
-    CodeResult<GroupContainers> groupContainersForOwnerIdentifier(const std::string& owner,
-                                                                  QRNUserIdentityPtr userIdentity,
-                                                                  std::uint64_t groupContainerClass);
+    CodeResult<GroupContainers>
+    groupContainersForOwnerIdentifier(const std::string& owner, QRNUserIdentityPtr userIdentity,
+                                      std::uint64_t groupContainerClass);
     // The group manager's answer, under the owner's identifier lock when asked.
     CodeResult<std::vector<std::string>>
     groupContainerIdentifiersForOwnerIdentifier(const std::string& owner,
-                                                std::uint64_t groupContainerClass,
-                                                bool useLocking);
+                                                std::uint64_t groupContainerClass, bool useLocking);
     // Bytes the container takes on disk.
     CodeResult<std::uint64_t>
     diskUsageWithContainerIdentity(const QRNContainerIdentityPtr& containerIdentity);
