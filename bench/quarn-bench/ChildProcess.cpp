@@ -12,12 +12,45 @@
 #include <cstring>
 #include <fstream>
 #include <iterator>
+#include <mutex>
+#include <set>
 #include <sstream>
 #include <thread>
 
 extern char** environ;
 
 namespace quarn::loadbench {
+
+namespace {
+
+// Children not yet reaped; guarded by liveMutex. Read at exit.
+std::mutex liveMutex;
+std::set<ChildProcess*> live;
+
+void stopLiveChildren() {
+    std::set<ChildProcess*> left;
+    {
+        std::lock_guard guard(liveMutex);
+        left.swap(live);
+    }
+    for (ChildProcess* child : left) {
+        child->stop(std::chrono::seconds(5));
+    }
+}
+
+void track(ChildProcess* child) {
+    static const bool registered = [] { return std::atexit(stopLiveChildren) == 0; }();
+    (void)registered;
+    std::lock_guard guard(liveMutex);
+    live.insert(child);
+}
+
+void untrack(ChildProcess* child) {
+    std::lock_guard guard(liveMutex);
+    live.erase(child);
+}
+
+} // namespace
 
 ChildProcess::ChildProcess(const std::filesystem::path& program,
                            const std::vector<std::string>& arguments,
@@ -39,12 +72,14 @@ ChildProcess::ChildProcess(const std::filesystem::path& program,
     if (err != 0) {
         fail("cannot start {}: {}", program.string(), std::strerror(err));
     }
+    track(this);
 }
 
 ChildProcess::~ChildProcess() {
     if (!reaped_) {
         stop();
     }
+    untrack(this);
 }
 
 bool ChildProcess::running() {

@@ -1,6 +1,8 @@
 #pragma once
 // A process the tool starts (the daemon, the echo server), its output sent
-// to a file, its resident memory read from /proc, ended with SIGTERM.
+// to a file, its resident memory read from /proc, ended with SIGTERM. When
+// the tool stops early (exit() skips the destructors) the processes still
+// running are ended too.
 
 #include <sys/types.h>
 
