@@ -1,10 +1,12 @@
-// Directory creation with mode, owner and data protection class.
+// Directory creation with mode, owner and data protection class. The new
+// directory is reached through its parent's descriptor, and class and owner
+// are set on a descriptor of the directory itself: no path is walked twice.
 
 #include "Daemon/fs/EnvFd.h"
 #include "Daemon/fs/QRNFileManager.h"
-#include "Daemon/support/ProtectionClassAttribute.h"
 
 #include <cerrno>
+#include <charconv>
 #include <cstring>
 #include <fcntl.h>
 #include <string>
@@ -13,24 +15,41 @@ namespace quarn {
 
 namespace {
 
+namespace fs = std::filesystem;
+
 constexpr int kDirectoryPathFlags = O_PATH | O_DIRECTORY;
+// The made (or found) directory itself: never a link.
+constexpr int kMadeDirectoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK;
+
+bool isPlainName(const std::string& name) {
+    return !name.empty() && name != "." && name != "..";
+}
+
+// The parent of the directory to make and the leaf's name in it.
+struct Leaf {
+    int parent = AT_FDCWD;
+    EnvFd ownedParent; // when the parent was opened here
+    std::string name;
+
+    void setParent(EnvFd fd) {
+        ownedParent = std::move(fd);
+        parent = ownedParent.get();
+    }
+};
 
 // mkdir -p by descriptor: every level that has to be made is made with
-// `mode`. Existing levels (links among them, as for mkdir -p) are entered
-// as they are. Answers 0 or the errno of the failing step.
-int makePath(Env& env, const std::filesystem::path& url, mode_t mode) {
+// `mode`; existing levels (links among them, as for mkdir -p) are entered
+// as they are. Answers the mkdir of the leaf's errno (0 when it was made,
+// EEXIST when it was there) or the errno of the failing step before it.
+int makePath(Env& env, const fs::path& url, mode_t mode, Leaf& leaf) {
     // Usually only the leaf is missing: its parent is entered in one step
     // then, instead of a walk of every level. A missing parent is left to
     // the walk.
-    const auto parent = url.parent_path();
-    const auto leaf = url.filename();
-    if (!parent.empty() && !leaf.empty() && leaf != "." && leaf != "..") {
-        if (auto opened = env.openat(AT_FDCWD, parent.c_str(), kDirectoryPathFlags)) {
-            EnvFd dir(env, *opened);
-            auto made = env.mkdirat(dir.get(), leaf.c_str(), mode);
-            if (made || made.error() != ENOENT) {
-                return made ? 0 : made.error();
-            }
+    if (auto opened = env.openat(AT_FDCWD, url.parent_path().c_str(), kDirectoryPathFlags)) {
+        leaf.setParent(EnvFd(env, *opened));
+        auto made = env.mkdirat(leaf.parent, leaf.name.c_str(), mode);
+        if (made || made.error() != ENOENT) {
+            return made ? 0 : made.error();
         }
     }
     auto start = env.openat(AT_FDCWD, url.is_absolute() ? "/" : ".", kDirectoryPathFlags);
@@ -38,21 +57,17 @@ int makePath(Env& env, const std::filesystem::path& url, mode_t mode) {
         return start.error();
     }
     EnvFd dir(env, *start);
-    auto relative = url.relative_path();
-    for (auto it = relative.begin(); it != relative.end(); ++it) {
-        const std::string name = it->string();
+    const fs::path relative = url.relative_path().parent_path();
+    for (const fs::path& component : relative) {
+        const std::string name = component.string();
         if (name.empty() || name == ".") {
             continue;
         }
-        const bool leaf = std::next(it) == relative.end();
         auto next = env.openat(dir.get(), name.c_str(), kDirectoryPathFlags);
         if (!next && next.error() == ENOENT) {
             auto made = env.mkdirat(dir.get(), name.c_str(), mode);
             if (!made && made.error() != EEXIST) {
                 return made.error();
-            }
-            if (leaf) {
-                return 0;
             }
             next = env.openat(dir.get(), name.c_str(), kDirectoryPathFlags);
         }
@@ -61,98 +76,233 @@ int makePath(Env& env, const std::filesystem::path& url, mode_t mode) {
         }
         dir = EnvFd(env, *next);
     }
-    return 0;
+    leaf.setParent(std::move(dir));
+    auto made = env.mkdirat(leaf.parent, leaf.name.c_str(), mode);
+    return made ? 0 : made.error();
 }
 
-// An existing item where a directory was asked for must be a directory
-// itself, not a link to one: class and owner are applied without following.
-int existingDirectoryError(Env& env, const std::filesystem::path& url) {
-    auto st = env.fstatat(AT_FDCWD, url.c_str(), AT_SYMLINK_NOFOLLOW);
-    if (!st) {
-        return st.error();
+// The parent must exist already.
+int makeLeaf(Env& env, const fs::path& url, mode_t mode, Leaf& leaf) {
+    auto opened = env.openat(AT_FDCWD, url.parent_path().c_str(), kDirectoryPathFlags);
+    if (!opened) {
+        return opened.error();
     }
-    return S_ISDIR(st->st_mode) ? 0 : ENOTDIR;
+    leaf.setParent(EnvFd(env, *opened));
+    auto made = env.mkdirat(leaf.parent, leaf.name.c_str(), mode);
+    return made ? 0 : made.error();
 }
 
 // Written through the Env (not the attribute helper's own call) so that
 // fault injection reaches it; same attribute and decimal text.
-SysStatus setProtectionClassOfDirectory(Env& env, int fd, int protectionClass) {
+SysStatus setProtectionClassOfDirectory(Env& env, int fd, const char* attribute,
+                                        int protectionClass) {
     if (protectionClass < 0) {
         return SysError(EINVAL);
     }
-    const std::string value = std::to_string(protectionClass);
-    return env.fsetxattr(fd, ProtectionClassAttribute::attributeName(), value.data(), value.size(),
-                         0);
+    char text[16];
+    const auto converted = std::to_chars(text, text + sizeof text, protectionClass);
+    return env.fsetxattr(fd, attribute, text, static_cast<std::size_t>(converted.ptr - text), 0);
 }
 
-} // namespace
+// Names the directory in messages; the path is only joined for a message.
+struct Where {
+    const fs::path& base;
+    const fs::path* relative = nullptr;
+    fs::path url() const { return relative ? base / *relative : base; }
+};
 
-Status QRNFileManager::createDirectoryAtURL(const std::filesystem::path& url,
-                                            bool withIntermediateDirectories, mode_t mode,
-                                            uid_t owner, int protectionClass) {
-    if (withIntermediateDirectories) {
-        int err = url.empty() ? ENOENT : makePath(*env_, url, mode);
-        if (err == 0 || err == EEXIST) {
-            err = existingDirectoryError(*env_, url);
-        }
-        if (err != 0) {
-            return QRN_UNEXPECTED(
-                QRN_POSIX_ERROR(err, "mkpath of {} failed: {}", url.string(), std::strerror(err)));
-        }
-    } else {
-        auto made = env_->mkdirat(AT_FDCWD, url.c_str(), mode);
-        int err = made ? 0 : made.error();
-        if (err == EEXIST) {
-            err = existingDirectoryError(*env_, url);
-        }
-        if (err != 0) {
-            return QRN_UNEXPECTED(
-                QRN_POSIX_ERROR(err, "mkdir of {} failed: {}", url.string(), std::strerror(err)));
-        }
-    }
-    if (protectionClass != kProtectionClassUnchanged) {
-        auto opened =
-            env_->openat(AT_FDCWD, url.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK);
-        if (!opened) {
-            int err = opened.error();
-            return QRN_UNEXPECTED(
-                QRN_POSIX_ERROR(err, "opendir of {} failed: {}", url.string(), std::strerror(err)));
-        }
-        EnvFd dir(*env_, *opened);
-        if (auto set = setProtectionClassOfDirectory(*env_, dir.get(), protectionClass); !set) {
+// What is applied to the leaf once it exists.
+struct Finish {
+    uid_t owner = 0; // 0: left alone
+    int protectionClass = QRNFileManager::kProtectionClassUnchanged;
+    bool keepOpen = false;
+    const char* verb = "mkpath";     // names the step in messages
+    const char* attribute = nullptr; // of the protection class
+};
+
+// A failed step, its errno and message; the public call makes the Error
+// (so that it names the call).
+struct Failure {
+    int err;
+    std::string message;
+};
+template <class T> using Made = Expected<T, Failure>;
+
+Unexpected<Failure> creationError(const Where& where, const char* verb, int err) {
+    return Unexpected(Failure{
+        err, fmt::format("{} of {} failed: {}", verb, where.url().string(), std::strerror(err))});
+}
+
+// Class, then owner, on the open directory.
+Made<void> applyClassAndOwner(Env& env, int fd, const Where& where, const Finish& finish,
+                              bool ownerNeeded) {
+    if (finish.protectionClass != QRNFileManager::kProtectionClassUnchanged) {
+        if (auto set =
+                setProtectionClassOfDirectory(env, fd, finish.attribute, finish.protectionClass);
+            !set) {
             int err = set.error();
-            return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "Failed to setclass({}) on directory {}: {}",
-                                                  protectionClass, url.string(),
-                                                  std::strerror(err)));
+            return Unexpected(Failure{err, fmt::format("Failed to setclass({}) on directory {}: {}",
+                                                       finish.protectionClass, where.url().string(),
+                                                       std::strerror(err))});
         }
     }
-    if (owner != 0) {
+    if (ownerNeeded) {
         // One number for user and group: container owners have equal ones.
-        auto chowned = env_->fchownat(AT_FDCWD, url.c_str(), owner, owner, AT_SYMLINK_NOFOLLOW);
-        if (!chowned) {
+        if (auto chowned = env.fchown(fd, finish.owner, finish.owner); !chowned) {
             int err = chowned.error();
-            return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "Failed to chown({},{}) {}: {}", owner,
-                                                  owner, url.string(), std::strerror(err)));
+            return Unexpected(
+                Failure{err, fmt::format("Failed to chown({},{}) {}: {}", finish.owner,
+                                         finish.owner, where.url().string(), std::strerror(err))});
         }
     }
     return {};
 }
 
-Status QRNFileManager::createDirectoryAtURL(const std::filesystem::path& url,
-                                            bool withIntermediateDirectories, mode_t mode,
-                                            Owner owner) {
+// `made`: the mkdir's errno. A directory that was there already must be a
+// directory itself, not a link to one; it is given an owner only when its
+// own differs.
+Made<EnvFd> finishLeaf(Env& env, const Leaf& leaf, const Where& where, int made,
+                       const Finish& finish) {
+    bool ownerNeeded = finish.owner != 0;
+    if (made == EEXIST) {
+        auto st = env.fstatat(leaf.parent, leaf.name.c_str(), AT_SYMLINK_NOFOLLOW);
+        made = !st ? st.error() : S_ISDIR(st->st_mode) ? 0 : ENOTDIR;
+        ownerNeeded =
+            ownerNeeded && st &&
+            (st->st_uid != finish.owner || st->st_gid != static_cast<gid_t>(finish.owner));
+    }
+    if (made != 0) {
+        return creationError(where, finish.verb, made);
+    }
+    const bool classNeeded = finish.protectionClass != QRNFileManager::kProtectionClassUnchanged;
+    if (!classNeeded && !ownerNeeded && !finish.keepOpen) {
+        return EnvFd();
+    }
+    auto opened = env.openat(leaf.parent, leaf.name.c_str(), kMadeDirectoryFlags);
+    if (!opened) {
+        // A link or a file swapped in since the mkdir is no directory of ours.
+        int err = opened.error() == ELOOP ? ENOTDIR : opened.error();
+        return creationError(where, "opendir", err);
+    }
+    EnvFd dir(env, *opened);
+    if (auto applied = applyClassAndOwner(env, dir.get(), where, finish, ownerNeeded); !applied) {
+        return Unexpected(applied.error());
+    }
+    return dir;
+}
+
+Made<EnvFd> createDirectory(Env& env, const fs::path& url, bool withIntermediateDirectories,
+                            mode_t mode, Finish finish) {
+    Leaf leaf{AT_FDCWD, EnvFd(), url.filename().string()};
+    if (url.empty() || !isPlainName(leaf.name)) {
+        // "/", "a/.." and the like: nothing to make but the whole path itself.
+        leaf.name = url.string();
+        auto made = url.empty() ? SysStatus(SysError(ENOENT))
+                                : env.mkdirat(AT_FDCWD, leaf.name.c_str(), mode);
+        finish.verb = withIntermediateDirectories ? "mkpath" : "mkdir";
+        return finishLeaf(env, leaf, Where{url}, made ? 0 : made.error(), finish);
+    }
+    int made = 0;
+    if (withIntermediateDirectories) {
+        made = makePath(env, url, mode, leaf);
+    } else {
+        made = makeLeaf(env, url, mode, leaf);
+        finish.verb = "mkdir";
+    }
+    return finishLeaf(env, leaf, Where{url}, made, finish);
+}
+
+// From `leaf.parent` down to the parent of `relative`'s last component,
+// making missing levels: only downwards, and never through a link.
+int walkToParent(Env& env, const fs::path& relative, mode_t mode, Leaf& leaf) {
+    if (relative.empty() || relative.is_absolute() || !isPlainName(leaf.name)) {
+        return EINVAL;
+    }
+    if (relative.native().find('/') == std::string::npos) {
+        return 0; // a name directly in the open directory
+    }
+    constexpr int kFlags = O_PATH | O_DIRECTORY | O_NOFOLLOW;
+    for (const fs::path& component : relative.parent_path()) {
+        const std::string name = component.string();
+        if (!isPlainName(name)) {
+            return EINVAL;
+        }
+        auto next = env.openat(leaf.parent, name.c_str(), kFlags);
+        if (!next && next.error() == ENOENT) {
+            auto made = env.mkdirat(leaf.parent, name.c_str(), mode);
+            if (!made && made.error() != EEXIST) {
+                return made.error();
+            }
+            next = env.openat(leaf.parent, name.c_str(), kFlags);
+        }
+        if (!next) {
+            return next.error();
+        }
+        leaf.setParent(EnvFd(env, *next));
+    }
+    return 0;
+}
+
+} // namespace
+
+Result<EnvFd> QRNFileManager::createAndOpenDirectoryAtURL(const fs::path& url,
+                                                          bool withIntermediateDirectories,
+                                                          mode_t mode, uid_t owner,
+                                                          int protectionClass) {
+    auto made =
+        createDirectory(*env_, url, withIntermediateDirectories, mode,
+                        Finish{owner, protectionClass, true, "mkpath", protectionAttribute_});
+    if (!made) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(made.error().err, "{}", made.error().message));
+    }
+    return std::move(*made);
+}
+
+Result<EnvFd> QRNFileManager::createAndOpenDirectoryInDirectory(const EnvFd& parent,
+                                                                const fs::path& parentURL,
+                                                                const fs::path& relative,
+                                                                mode_t mode, uid_t owner,
+                                                                int protectionClass) {
+    const Where where{parentURL, &relative};
+    Leaf leaf{parent.get(), EnvFd(), relative.filename().string()};
+    auto made = [&]() -> Made<EnvFd> {
+        if (int walked = walkToParent(*env_, relative, mode, leaf); walked != 0) {
+            return creationError(where, "mkpath", walked);
+        }
+        auto created = env_->mkdirat(leaf.parent, leaf.name.c_str(), mode);
+        return finishLeaf(*env_, leaf, where, created ? 0 : created.error(),
+                          Finish{owner, protectionClass, true, "mkpath", protectionAttribute_});
+    }();
+    if (!made) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(made.error().err, "{}", made.error().message));
+    }
+    return std::move(*made);
+}
+
+Status QRNFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories,
+                                            mode_t mode, uid_t owner, int protectionClass) {
+    auto made =
+        createDirectory(*env_, url, withIntermediateDirectories, mode,
+                        Finish{owner, protectionClass, false, "mkpath", protectionAttribute_});
+    if (!made) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(made.error().err, "{}", made.error().message));
+    }
+    return {};
+}
+
+Status QRNFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories,
+                                            mode_t mode, Owner owner) {
     return createDirectoryAtURL(url, withIntermediateDirectories, mode, owner.uid,
                                 kProtectionClassUnchanged);
 }
 
-Status QRNFileManager::createDirectoryAtURL(const std::filesystem::path& url,
-                                            bool withIntermediateDirectories, mode_t mode,
-                                            ProtectionClass protectionClass) {
+Status QRNFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories,
+                                            mode_t mode, ProtectionClass protectionClass) {
     return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, protectionClass.value);
 }
 
-Status QRNFileManager::createDirectoryAtURL(const std::filesystem::path& url,
-                                            bool withIntermediateDirectories, mode_t mode) {
+Status QRNFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories,
+                                            mode_t mode) {
     return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0,
                                 kProtectionClassUnchanged);
 }

@@ -2,6 +2,7 @@
 
 #include "Daemon/fs/Env.h"
 #include "Daemon/fs/LinuxEnv.h"
+#include "Daemon/support/ProtectionClassAttribute.h"
 #include "Daemon/support/QRNDaemonContext.h"
 
 #include <fcntl.h>
@@ -19,7 +20,8 @@ QRNFileManager::QRNFileManager(QRNDaemonContext& context)
     : QRNFileManager(context, envOfContext(context)) {}
 
 QRNFileManager::QRNFileManager(QRNDaemonContext& context, std::shared_ptr<Env> env)
-    : context_(&context), env_(std::move(env)) {}
+    : context_(&context), env_(std::move(env)),
+      protectionAttribute_(ProtectionClassAttribute::attributeName()) {}
 
 QRNFileManager& QRNFileManager::defaultManager() {
     return QRNDaemonContext::current().instance<QRNFileManager>();

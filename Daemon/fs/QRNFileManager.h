@@ -15,6 +15,7 @@
 // +Create, +Remove, +Copy, +Move, +Traverse, +Listing, +Containment, +ACL,
 // +Ownership, +Protection, +DiskUsage.
 
+#include "Daemon/fs/EnvFd.h"
 #include "Daemon/support/QRNError.h"
 
 #include <fcntl.h>
@@ -98,6 +99,19 @@ public:
                                 mode_t mode, ProtectionClass protectionClass);
     Status createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories,
                                 mode_t mode);
+    // As createDirectoryAtURL, answering the directory open (never through
+    // a link at its name) for making items below it without walking its
+    // path again.
+    Result<EnvFd> createAndOpenDirectoryAtURL(const std::filesystem::path& url,
+                                              bool withIntermediateDirectories, mode_t mode,
+                                              uid_t owner, int protectionClass);
+    // The same below the open directory `parent` (whose path is `parentURL`,
+    // for messages): `relative` goes only downwards, its missing levels are
+    // made with `mode`, and no link is followed on the way.
+    Result<EnvFd> createAndOpenDirectoryInDirectory(const EnvFd& parent,
+                                                    const std::filesystem::path& parentURL,
+                                                    const std::filesystem::path& relative,
+                                                    mode_t mode, uid_t owner, int protectionClass);
 
     Status moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst);
     Status moveItemIfExistsAtURL(const std::filesystem::path& src,
@@ -175,6 +189,9 @@ public:
 private:
     QRNDaemonContext* context_;
     std::shared_ptr<Env> env_;
+    // The attribute holding a protection class: the daemon's effective user,
+    // which picks its namespace, does not change while it runs.
+    const char* protectionAttribute_;
 };
 
 } // namespace quarn

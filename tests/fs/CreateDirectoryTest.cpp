@@ -139,5 +139,80 @@ TEST_F(CreateDirectoryTest, ClassAndOwnerFailuresAreReportedWithTheirMessages) {
     EXPECT_FALSE(existsNoFollow(base() / "x" / "y"));
 }
 
+TEST_F(CreateDirectoryTest, ExistingDirectoryWithItsOwnerAlreadyIsNotChownedAgain) {
+    auto env = std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>());
+    QRNFileManager manager(root_.context(), env);
+    auto dir = base() / "owned";
+    fs::create_directories(dir);
+    ASSERT_EQ(::chown(dir.c_str(), kMobileUID, kMobileUID), 0);
+
+    const auto chowns = env->count(EnvCall::Chown);
+    ASSERT_TRUE(manager.createDirectoryAtURL(dir, true, 0755, kMobileUID, -1));
+    EXPECT_EQ(env->count(EnvCall::Chown), chowns);
+
+    ASSERT_EQ(::chown(dir.c_str(), kMobileUID, 0), 0); // the group differs
+    ASSERT_TRUE(manager.createDirectoryAtURL(dir, true, 0755, kMobileUID, -1));
+    EXPECT_EQ(lstatOf(dir).st_gid, kMobileUID);
+}
+
+TEST_F(CreateDirectoryTest, OpenedDirectoryIsTheMadeOneAndTakesChildrenBelowIt) {
+    fs::create_directories(base());
+    auto top = manager().createAndOpenDirectoryAtURL(base() / "top", true, 0755, kMobileUID, 0);
+    ASSERT_TRUE(top);
+    struct stat opened {};
+    ASSERT_EQ(::fstat(top->get(), &opened), 0);
+    EXPECT_EQ(opened.st_ino, lstatOf(base() / "top").st_ino);
+
+    // Missing levels are made with the mode; only the leaf gets owner and class.
+    auto deep = manager().createAndOpenDirectoryInDirectory(*top, base() / "top", "a/b", 0711,
+                                                            kMobileUID, 3);
+    ASSERT_TRUE(deep);
+    EXPECT_EQ(lstatOf(base() / "top" / "a").st_mode & 07777, 0711u);
+    EXPECT_EQ(lstatOf(base() / "top" / "a").st_uid, 0u);
+    EXPECT_EQ(lstatOf(base() / "top" / "a" / "b").st_uid, kMobileUID);
+    EXPECT_EQ(xattrOf(base() / "top" / "a" / "b", kProtectionClassAttribute), "3");
+
+    auto child = manager().createAndOpenDirectoryInDirectory(*deep, base() / "top" / "a" / "b", "c",
+                                                             0755, kMobileUID, 2);
+    ASSERT_TRUE(child);
+    EXPECT_EQ(xattrOf(base() / "top" / "a" / "b" / "c", kProtectionClassAttribute), "2");
+    // Made again: success, the class is set again.
+    auto again = manager().createAndOpenDirectoryInDirectory(*top, base() / "top", "a/b/c", 0755,
+                                                             kMobileUID, 4);
+    ASSERT_TRUE(again);
+    EXPECT_EQ(xattrOf(base() / "top" / "a" / "b" / "c", kProtectionClassAttribute), "4");
+}
+
+TEST_F(CreateDirectoryTest, RelativeCreationStaysBelowItsDirectoryAndFollowsNoLink) {
+    fs::create_directories(base() / "top");
+    fs::create_directories(base() / "outside");
+    fs::create_directory_symlink(base() / "outside", base() / "top" / "link");
+    auto top = manager().createAndOpenDirectoryAtURL(base() / "top", false, 0755, 0, -1);
+    ASSERT_TRUE(top);
+
+    for (const char* relative : {"../escaped", "/abs", "", "a/../b", "."}) {
+        auto made = manager().createAndOpenDirectoryInDirectory(*top, base() / "top", relative,
+                                                                0755, 0, -1);
+        ASSERT_FALSE(made) << relative;
+        EXPECT_TRUE(made.error().isPOSIX(EINVAL)) << relative;
+    }
+    EXPECT_FALSE(existsNoFollow(base() / "escaped"));
+
+    auto through = manager().createAndOpenDirectoryInDirectory(*top, base() / "top", "link/x", 0755,
+                                                               kMobileUID, 1);
+    ASSERT_FALSE(through);
+    EXPECT_TRUE(through.error().isPOSIX(ENOTDIR));
+    EXPECT_EQ(
+        through.error().message.rfind("mkpath of " + (base() / "top" / "link" / "x").string(), 0),
+        0u);
+    auto atLink = manager().createAndOpenDirectoryInDirectory(*top, base() / "top", "link", 0755,
+                                                              kMobileUID, 1);
+    ASSERT_FALSE(atLink);
+    EXPECT_TRUE(atLink.error().isPOSIX(ENOTDIR));
+    EXPECT_FALSE(existsNoFollow(base() / "outside" / "x"));
+    EXPECT_EQ(lstatOf(base() / "outside").st_uid, 0u);
+    EXPECT_FALSE(xattrOf(base() / "outside", kProtectionClassAttribute));
+}
+
 } // namespace
 } // namespace quarn::test
