@@ -118,7 +118,10 @@ QRNClientIdentity::_bundleIdentifierFromAuditToken(const AuditToken& auditToken)
 
 QRNClientIdentityPtr
 QRNClientIdentity::clientIdentityWithVellConnection(const IpcConnection& connection) {
-    const IpcPeer& peer = connection.peer();
+    return clientIdentityWithPeer(connection.peer());
+}
+
+QRNClientIdentityPtr QRNClientIdentity::clientIdentityWithPeer(const IpcPeer& peer) {
     const auto pid = static_cast<std::int32_t>(peer.pid());
     const AuditToken& token = peer.auditToken();
     QRNUserIdentityPtr userIdentity =

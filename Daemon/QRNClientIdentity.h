@@ -51,6 +51,9 @@ public:
     // no code-signing identifier or no user identity. The installer service
     // gets the same object back for as long as its audit token is the same.
     static QRNClientIdentityPtr clientIdentityWithVellConnection(const IpcConnection& connection);
+    // The same for a process known by its peer description (the writer of
+    // a message may be another process than the one that connected).
+    static QRNClientIdentityPtr clientIdentityWithPeer(const IpcPeer& peer);
     // The code-signing identifier of the process behind `auditToken`.
     static Result<std::string> _bundleIdentifierFromAuditToken(const AuditToken& auditToken);
 

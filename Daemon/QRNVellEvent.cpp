@@ -1,6 +1,7 @@
 #include "Daemon/QRNVellEvent.h"
 
 #include "Daemon/QRNClientConnection.h"
+#include "Daemon/QRNClientIdentityCache.h"
 #include "Daemon/QRNCommandQueue.h"
 #include "Daemon/QRNCommandTable.h"
 #include "Daemon/QRNOperationGuard.h"
@@ -99,10 +100,10 @@ void registerCallerEntitlements(const QRNClientIdentity& identity,
 // the client's bundle identifier for the log.
 std::string runCommand(const QRNCommandTableEntry& entry,
                        const std::shared_ptr<IpcConnection>& connection, const Value& request,
-                       QRNVellReply& reply, std::uint64_t& error) {
+                       QRNClientIdentityCache& identities, QRNVellReply& reply,
+                       std::uint64_t& error) {
     auto commandQueue = std::make_shared<QRNCommandQueue>();
-    const QRNClientIdentityPtr identity =
-        QRNClientIdentity::clientIdentityWithVellConnection(*connection);
+    const QRNClientIdentityPtr identity = identities.identityFor(*connection);
     const std::shared_ptr<QRNClientConnection> client =
         checkEntitlementsAndInitClientObject(identity, entry, commandQueue, error);
     if (!client) {
@@ -145,6 +146,12 @@ std::shared_ptr<QRNClientConnection> checkEntitlementsAndInitClientObject(
 
 void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
                          const IpcConnection::Event& event) {
+    QRNClientIdentityCache identities;
+    QRNProcessVellEvent(connection, event, identities);
+}
+
+void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
+                         const IpcConnection::Event& event, QRNClientIdentityCache& identities) {
     if (event.kind == IpcConnection::Event::Kind::Invalidated) {
         return;
     }
@@ -177,7 +184,7 @@ void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
         error = kQRNErrorInvalidCommand;
     } else {
         entry = &QRNCommandTable::entries()[command];
-        client = runCommand(*entry, connection, request, reply, error);
+        client = runCommand(*entry, connection, request, identities, reply, error);
     }
     signpost.end(fmt::format(" command={}  clientIdentifier={} ", command, client));
     QRN_LOG_NOTICE(LogCategory::Vell, "command={}, client={}, error={}", command, client, error);

@@ -11,10 +11,15 @@
 namespace quarn {
 
 class QRNClientConnection;
+class QRNClientIdentityCache;
 class QRNCommandQueue;
 struct QRNCommandTableEntry;
 
-// Called on the connection's strand for every event of a client connection.
+// Called on the connection's thread for every event of a client connection.
+// `identities` is the connection's own cache of its writers' identities.
+void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
+                         const IpcConnection::Event& event, QRNClientIdentityCache& identities);
+// The same with the writer identified afresh.
 void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
                          const IpcConnection::Event& event);
 

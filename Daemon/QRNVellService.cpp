@@ -1,5 +1,6 @@
 #include "Daemon/QRNVellService.h"
 
+#include "Daemon/QRNClientIdentityCache.h"
 #include "Daemon/QRNVellEvent.h"
 #include "Daemon/platform/IpcListener.h"
 #include "Daemon/platform/Paths.h"
@@ -26,7 +27,13 @@ bool QRNVellService::start(const Paths& paths) {
         listener_->start([queue = listenerQueue_](std::shared_ptr<IpcConnection> connection) {
             // Behind initialisation on the listener queue.
             queue->async([connection = std::move(connection)] {
-                connection->setEventHandler(QRNProcessVellEvent);
+                // The connection's events come one at a time, so its cache
+                // of writer identities needs no lock.
+                connection->setEventHandler(
+                    [identities = std::make_shared<QRNClientIdentityCache>()](
+                        const std::shared_ptr<IpcConnection>& c, const IpcConnection::Event& e) {
+                        QRNProcessVellEvent(c, e, *identities);
+                    });
                 // Quality-of-service classes have no meaning here.
                 connection->resume();
             });

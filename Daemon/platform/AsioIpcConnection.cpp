@@ -4,8 +4,10 @@
 #include "Daemon/platform/IpcFrame.h"
 #include "Daemon/support/Log.h"
 
-#include <asio/write.hpp>
+#include <sys/socket.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
 #include <exception>
 
@@ -21,12 +23,42 @@ constexpr std::size_t kKeptWriteBuffer = 64 * 1024;
 // until it catches up.
 constexpr std::size_t kMaxQueuedReplyBytes = 4 * 1024 * 1024;
 
+// Room for the credentials only: descriptors a client sends along do not
+// fit, so the kernel drops them instead of installing them here.
+constexpr std::size_t kControlBytes = CMSG_SPACE(sizeof(ucred));
+
+// The writer of the bytes one recvmsg returned. With SO_PASSCRED every
+// read carries one, and the kernel never returns the bytes of two writers
+// in one read.
+IpcConnection::Sender senderOf(msghdr& message) {
+    IpcConnection::Sender sender{0, static_cast<uid_t>(-1), static_cast<gid_t>(-1)};
+    for (cmsghdr* c = CMSG_FIRSTHDR(&message); c; c = CMSG_NXTHDR(&message, c)) {
+        if (c->cmsg_level != SOL_SOCKET) {
+            continue;
+        }
+        if (c->cmsg_type == SCM_CREDENTIALS && c->cmsg_len >= CMSG_LEN(sizeof(ucred))) {
+            ucred credentials;
+            std::memcpy(&credentials, CMSG_DATA(c), sizeof credentials);
+            sender = {credentials.pid, credentials.uid, credentials.gid};
+        } else if (c->cmsg_type == SCM_RIGHTS) {
+            // Should one fit after all, it is not kept.
+            const std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+            for (std::size_t i = 0; i < count; ++i) {
+                int fd;
+                std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
+                ::close(fd);
+            }
+        }
+    }
+    return sender;
+}
+
 } // namespace
 
 AsioIpcConnection::AsioIpcConnection(std::shared_ptr<IpcServiceCore> core, Socket socket,
                                      IpcPeer peer, Limits limits)
-    : core_(std::move(core)), socket_(std::move(socket)), strand_(socket_.get_executor()),
-      peer_(std::move(peer)), limits_(limits) {}
+    : core_(std::move(core)), socket_(std::move(socket)), executor_(socket_.get_executor()),
+      fd_(socket_.native_handle()), peer_(std::move(peer)), limits_(limits) {}
 
 AsioIpcConnection::~AsioIpcConnection() {
     core_->remove(this);
@@ -38,7 +70,7 @@ void AsioIpcConnection::setEventHandler(EventHandler handler) {
 }
 
 void AsioIpcConnection::resume() {
-    if (!core_->post(strand_, [self = shared_from_this()] { self->onResume(); })) {
+    if (!core_->post(executor_, [self = shared_from_this()] { self->onResume(); })) {
         // The service has stopped: drop what the handler holds.
         std::lock_guard lock(pendingHandlerMutex_);
         pendingHandler_ = nullptr;
@@ -46,27 +78,17 @@ void AsioIpcConnection::resume() {
 }
 
 void AsioIpcConnection::cancel() {
-    // Posted even from the strand, so that a handler cancelling its own
+    // Posted even from the context, so that a handler cancelling its own
     // connection hears Invalidated only after it has returned.
-    core_->post(strand_, [self = shared_from_this()] { self->end(); });
+    endFromAnyThread();
 }
 
 void AsioIpcConnection::shutDown() {
-    asio::post(strand_, [self = shared_from_this()] { self->end(); });
+    asio::post(executor_, [self = shared_from_this()] { self->end(); });
 }
 
-void AsioIpcConnection::sendReply(const Value& reply) {
-    if (strand_.running_in_this_thread()) {
-        queueReply(reply);
-        return;
-    }
-    std::vector<std::uint8_t> frame;
-    if (!IpcFrame::appendMessage(reply, false, frame)) {
-        return;
-    }
-    core_->post(strand_, [self = shared_from_this(), frame = std::move(frame)]() mutable {
-        self->queueFrame(std::move(frame));
-    });
+void AsioIpcConnection::endFromAnyThread() {
+    core_->post(executor_, [self = shared_from_this()] { self->end(); });
 }
 
 void AsioIpcConnection::onResume() {
@@ -91,32 +113,83 @@ void AsioIpcConnection::onResume() {
     readMore();
 }
 
+bool AsioIpcConnection::readingPaused() {
+    std::lock_guard lock(writeMutex_);
+    return queuedBytes_ > kMaxQueuedReplyBytes;
+}
+
+// Waits for readiness and reads with recvmsg then, since asio's reads drop
+// the credentials that come with the bytes.
 void AsioIpcConnection::readMore() {
-    if (!resumed_ || reading_ || ended_ || queuedBytes_ > kMaxQueuedReplyBytes) {
+    if (!resumed_ || reading_ || ended_ || readingPaused()) {
         return;
     }
     reading_ = true;
-    socket_.async_read_some(
-        asio::buffer(readBuffer_.data() + readEnd_, readBuffer_.size() - readEnd_),
-        [self = shared_from_this()](const asio::error_code& error, std::size_t bytes) {
-            self->onRead(error, bytes);
-        });
+    socket_.async_wait(
+        Socket::wait_read,
+        [self = shared_from_this()](const asio::error_code& error) { self->onReadable(error); });
 }
 
-void AsioIpcConnection::onRead(const asio::error_code& error, std::size_t bytes) {
+void AsioIpcConnection::onReadable(const asio::error_code& error) {
     reading_ = false;
     if (ended_) {
         return;
     }
     if (error) {
-        if (error != asio::error::eof && error != asio::error::connection_reset) {
-            QRN_LOG_ERROR(LogCategory::Vell, "Reading from pid {} failed: {}", peer_.pid(),
-                          error.message());
-        }
+        QRN_LOG_ERROR(LogCategory::Vell, "Reading from pid {} failed: {}", peer_.pid(),
+                      error.message());
         return end();
     }
-    readEnd_ += bytes;
-    deliverBufferedFrames();
+    switch (receive()) {
+    case Received::Bytes:
+        return deliverBufferedFrames();
+    case Received::Again:
+        return readMore();
+    case Received::Ended:
+        return;
+    }
+}
+
+AsioIpcConnection::Received AsioIpcConnection::receive() {
+    iovec space{readBuffer_.data() + readEnd_, readBuffer_.size() - readEnd_};
+    alignas(cmsghdr) unsigned char control[kControlBytes];
+    msghdr message{};
+    message.msg_iov = &space;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    ssize_t n;
+    do {
+        n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    } while (n < 0 && errno == EINTR);
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+        return Received::Again;
+    }
+    if (n < 0 && errno != ECONNRESET) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Reading from pid {} failed: {}", peer_.pid(),
+                      std::strerror(errno));
+    }
+    if (n <= 0) {
+        end();
+        return Received::Ended;
+    }
+    if (!acceptSender(senderOf(message))) {
+        return Received::Ended;
+    }
+    readEnd_ += static_cast<std::size_t>(n);
+    return Received::Bytes;
+}
+
+// Unread input is always the start of a frame; bytes of another writer
+// cannot complete it: the frame would be neither's request.
+bool AsioIpcConnection::acceptSender(const Sender& sender) {
+    if (readEnd_ > readStart_ && sender != unreadSender_) {
+        refuse(fmt::format("a frame holds bytes written by pid {} and by pid {}", unreadSender_.pid,
+                           sender.pid));
+        return false;
+    }
+    unreadSender_ = sender;
+    return true;
 }
 
 // Hands every complete frame in the buffer to the handler, one after the
@@ -204,55 +277,123 @@ void AsioIpcConnection::refuse(const std::string& why) {
     end();
 }
 
-void AsioIpcConnection::queueReply(const Value& reply) {
-    if (ended_) {
+// Sends from the calling thread: the reply of a request goes out on the
+// thread that ran it, without a hand-over to the connection's context.
+void AsioIpcConnection::sendReply(const Value& reply) {
+    std::lock_guard lock(writeMutex_);
+    if (writeClosed_ || writeFailed_) {
         return;
     }
-    std::vector<std::uint8_t> frame = std::move(spareWriteBuffer_);
-    frame.clear();
-    if (IpcFrame::appendMessage(reply, false, frame)) {
-        queueFrame(std::move(frame));
+    encodeBuffer_.clear();
+    if (!IpcFrame::appendMessage(reply, false, encodeBuffer_)) {
+        return;
+    }
+    if (!writeQueue_.empty() || awaitingWrite_) {
+        // Behind earlier replies, which the context is writing.
+        queuedBytes_ += encodeBuffer_.size();
+        writeQueue_.push_back(std::move(encodeBuffer_));
+        encodeBuffer_ = {};
+        return;
+    }
+    if (!startWrite(encodeBuffer_)) {
+        awaitingWrite_ = true;
+        core_->post(executor_, [self = shared_from_this()] { self->awaitWritable(); });
+    }
+    if (encodeBuffer_.capacity() > kKeptWriteBuffer) {
+        encodeBuffer_ = {};
     }
 }
 
-void AsioIpcConnection::queueFrame(std::vector<std::uint8_t> frame) {
-    if (ended_) {
-        return;
+// Writes what the socket takes of `frame` now; the rest, if any, is queued
+// and false answered (also after a failure, which ends the connection).
+bool AsioIpcConnection::startWrite(std::vector<std::uint8_t>& frame) {
+    std::size_t sent = 0;
+    while (sent < frame.size()) {
+        const ssize_t n =
+            ::send(fd_, frame.data() + sent, frame.size() - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK) {
+            QRN_LOG_DEBUG(LogCategory::Vell, "Writing to pid {} failed: {}", peer_.pid(),
+                          std::strerror(errno));
+            writeFailed_ = true;
+            endFromAnyThread();
+            return true;
+        }
+        if (n < 0) {
+            break;
+        }
+        sent += static_cast<std::size_t>(n);
+    }
+    if (sent == frame.size()) {
+        return true;
     }
     queuedBytes_ += frame.size();
+    frontWritten_ = sent;
     writeQueue_.push_back(std::move(frame));
-    if (!writing_) {
-        writeNext();
+    frame = {};
+    return false;
+}
+
+// Writes queued frames until the socket is full; true once the queue is
+// empty (or the connection failed).
+bool AsioIpcConnection::flushLocked() {
+    while (!writeQueue_.empty() && !writeFailed_) {
+        std::vector<std::uint8_t>& front = writeQueue_.front();
+        const ssize_t n = ::send(fd_, front.data() + frontWritten_, front.size() - frontWritten_,
+                                 MSG_DONTWAIT | MSG_NOSIGNAL);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+            return false;
+        }
+        if (n < 0) {
+            QRN_LOG_DEBUG(LogCategory::Vell, "Writing to pid {} failed: {}", peer_.pid(),
+                          std::strerror(errno));
+            writeFailed_ = true;
+            break;
+        }
+        frontWritten_ += static_cast<std::size_t>(n);
+        if (frontWritten_ < front.size()) {
+            continue;
+        }
+        queuedBytes_ -= front.size();
+        frontWritten_ = 0;
+        writeQueue_.pop_front();
     }
+    return true;
 }
 
-// One write at a time: frames of two writes could interleave otherwise.
-void AsioIpcConnection::writeNext() {
-    writing_ = true;
-    asio::async_write(socket_, asio::buffer(writeQueue_.front()),
-                      [self = shared_from_this()](const asio::error_code& error, std::size_t) {
-                          self->onWritten(error);
-                      });
-}
-
-void AsioIpcConnection::onWritten(const asio::error_code& error) {
-    writing_ = false;
+void AsioIpcConnection::awaitWritable() {
     if (ended_) {
-        writeQueue_.clear();
         return;
     }
-    if (error) {
-        QRN_LOG_DEBUG(LogCategory::Vell, "Writing to pid {} failed: {}", peer_.pid(),
-                      error.message());
+    socket_.async_wait(
+        Socket::wait_write,
+        [self = shared_from_this()](const asio::error_code& error) { self->onWritable(error); });
+}
+
+void AsioIpcConnection::onWritable(const asio::error_code& error) {
+    if (ended_) {
+        return;
+    }
+    bool failed = static_cast<bool>(error);
+    bool more = false;
+    {
+        std::lock_guard lock(writeMutex_);
+        if (!failed) {
+            more = !flushLocked();
+            failed = writeFailed_;
+        }
+        awaitingWrite_ = more && !failed;
+    }
+    if (failed) {
         return end();
     }
-    queuedBytes_ -= writeQueue_.front().size();
-    if (writeQueue_.front().capacity() <= kKeptWriteBuffer) {
-        spareWriteBuffer_ = std::move(writeQueue_.front());
-    }
-    writeQueue_.pop_front();
-    if (!writeQueue_.empty()) {
-        writeNext();
+    if (more) {
+        return awaitWritable();
     }
     readMore(); // in case a backlog of replies had stopped reading
 }
@@ -262,13 +403,14 @@ void AsioIpcConnection::end() {
         return;
     }
     ended_ = true;
+    {
+        std::lock_guard lock(writeMutex_);
+        writeClosed_ = true;
+        writeQueue_.clear();
+        queuedBytes_ = 0;
+    }
     asio::error_code ignored;
     socket_.close(ignored);
-    // A write in flight still points into the front buffer.
-    while (writeQueue_.size() > (writing_ ? 1 : 0)) {
-        writeQueue_.pop_back();
-    }
-    queuedBytes_ = 0;
     const std::size_t open = core_->remove(this);
     QRN_LOG_DEBUG(LogCategory::Vell, "Connection of pid {} ended; {} open", peer_.pid(), open);
     deliverInvalidated();

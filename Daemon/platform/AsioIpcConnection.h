@@ -1,9 +1,12 @@
 #pragma once
-// A client connection of the request service on asio. Everything it does
-// runs on its strand: reading frames, decoding them, calling the event
-// handler synchronously (so the next frame is read only after the handler
-// returned), writing replies and ending. Calls from other threads post to
-// the strand.
+// A client connection of the request service on asio, pinned to one context
+// of the pool (one thread). Reading, decoding, calling the event handler
+// (inline, so the next frame is read only after the handler returned) and
+// ending run on that context; calls from other threads post to it.
+//
+// Replies go out from the thread that sends them: straight onto the socket
+// with a non-blocking send while nothing waits in the queue, else queued
+// and written by the context once the socket takes more.
 //
 // Pending asynchronous operations hold the connection alive.
 
@@ -11,11 +14,11 @@
 #include "Daemon/platform/IpcServiceCore.h"
 
 #include <asio/local/stream_protocol.hpp>
-#include <asio/strand.hpp>
 
 #include <cstdint>
 #include <deque>
 #include <mutex>
+#include <optional>
 #include <span>
 #include <string>
 #include <vector>
@@ -25,18 +28,22 @@ namespace quarn {
 class AsioIpcConnection final : public IpcConnection,
                                 public std::enable_shared_from_this<AsioIpcConnection> {
 public:
-    using Strand = asio::strand<asio::io_context::executor_type>;
-    using Socket = asio::basic_stream_socket<asio::local::stream_protocol, Strand>;
+    using Executor = asio::io_context::executor_type;
+    using Socket = asio::basic_stream_socket<asio::local::stream_protocol, Executor>;
     struct Limits {
         std::size_t maxFrameBytes = 0;
         std::size_t maxNesting = 0;
     };
 
+    // `socket` asks for its writers' credentials (SO_PASSCRED).
     AsioIpcConnection(std::shared_ptr<IpcServiceCore> core, Socket socket, IpcPeer peer,
                       Limits limits);
     ~AsioIpcConnection() override;
 
     const IpcPeer& peer() const override { return peer_; }
+    // The writer of the unread input, which is the message being handled
+    // while its handler runs.
+    std::optional<Sender> messageSender() const override { return unreadSender_; }
     void setEventHandler(EventHandler handler) override;
     void resume() override;
     void sendReply(const Value& reply) override;
@@ -47,43 +54,60 @@ public:
     void shutDown();
 
 private:
+    enum class Received { Bytes, Again, Ended };
+
     void onResume();
     void readMore();
-    void onRead(const asio::error_code& error, std::size_t bytes);
+    void onReadable(const asio::error_code& error);
+    Received receive();
+    bool acceptSender(const Sender& sender);
     void deliverBufferedFrames();
     bool deliverFrame(std::span<const std::uint8_t> body, bool expectsReply);
     void prepareBufferFor(std::size_t frameBytes);
     void refuse(const std::string& why);
-    void queueReply(const Value& reply);
-    void queueFrame(std::vector<std::uint8_t> frame);
-    void writeNext();
-    void onWritten(const asio::error_code& error);
+    bool readingPaused();
+
+    bool flushLocked();
+    bool startWrite(std::vector<std::uint8_t>& frame);
+    void awaitWritable();
+    void onWritable(const asio::error_code& error);
+    void endFromAnyThread();
     void end();
     void deliverInvalidated();
 
-    // Declared first so that it outlives the socket and strand it runs.
+    // Declared first so that it outlives the socket and context it runs.
     std::shared_ptr<IpcServiceCore> core_;
     Socket socket_;
-    const Strand strand_; // the socket's, kept apart for calls from other threads
+    const Executor executor_; // the socket's, kept apart for calls from other threads
+    const int fd_;            // the socket's; written to only under writeMutex_
     const IpcPeer peer_;
     const Limits limits_;
 
     std::mutex pendingHandlerMutex_; // guards pendingHandler_
     EventHandler pendingHandler_;    // set by setEventHandler, taken by resume
 
-    // The rest is touched on the strand only.
+    // The rest up to writeMutex_ is touched on the context only.
     EventHandler handler_;
     bool resumed_ = false;
     bool ended_ = false;
     bool invalidated_ = false;
     bool reading_ = false;
-    bool writing_ = false;
     std::vector<std::uint8_t> readBuffer_; // [readStart_, readEnd_) is unread input
     std::size_t readStart_ = 0;
     std::size_t readEnd_ = 0;
+    // The writer of the unread input; a frame is one writer's bytes.
+    Sender unreadSender_;
+
+    // Guards the fields below and every write to the socket: replies come
+    // from any thread, and the bytes of two frames must not interleave.
+    std::mutex writeMutex_;
+    bool writeClosed_ = false;   // set by end(); later replies are dropped
+    bool awaitingWrite_ = false; // the context waits for room and drains the queue
+    bool writeFailed_ = false;   // an end is on its way
     std::deque<std::vector<std::uint8_t>> writeQueue_;
+    std::size_t frontWritten_ = 0; // bytes of the front frame already sent
     std::size_t queuedBytes_ = 0;
-    std::vector<std::uint8_t> spareWriteBuffer_;
+    std::vector<std::uint8_t> encodeBuffer_;
 };
 
 } // namespace quarn

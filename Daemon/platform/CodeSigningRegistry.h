@@ -9,6 +9,7 @@
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/support/Value.h"
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -30,6 +31,12 @@ public:
     // when its executable matches no entry, or when the entry's digest does
     // not match the executable.
     virtual std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) = 0;
+
+    // A number that changes whenever the registry's answers may have
+    // changed, rereading the registry first when it changed; answers
+    // computed under one generation hold until it changes. Cheap enough to
+    // ask on every request. A registry that never changes keeps 0.
+    virtual std::uint64_t generation() { return 0; }
 };
 
 } // namespace quarn

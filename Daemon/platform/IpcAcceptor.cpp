@@ -4,8 +4,10 @@
 
 #include <cerrno>
 #include <chrono>
+#include <cstring>
 #include <exception>
 #include <fcntl.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 namespace quarn {
@@ -15,6 +17,14 @@ namespace {
 // Out of descriptors or memory the listening socket stays readable; waiting
 // a little keeps the pool from spinning on it.
 constexpr std::chrono::milliseconds kBackOff{100};
+
+// Every message then carries the credentials of the process that wrote it.
+// Set on the listening socket too: an accepted socket inherits it, so no
+// byte written between accept and the setsockopt below goes unstamped.
+bool passCredentials(int fd) {
+    const int on = 1;
+    return ::setsockopt(fd, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) == 0;
+}
 
 bool isResourceShortage(const asio::error_code& error) {
     if (error.category() != asio::system_category()) {
@@ -28,8 +38,8 @@ bool isResourceShortage(const asio::error_code& error) {
 
 IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
                          IpcListener::ConnectionHandler handler)
-    : core_(std::move(core)), limits_(limits), handler_(std::move(handler)), acceptor_(core_->io()),
-      backOffTimer_(core_->io()) {}
+    : core_(std::move(core)), limits_(limits), handler_(std::move(handler)),
+      acceptor_(core_->io(0)), backOffTimer_(core_->io(0)) {}
 
 Status IpcAcceptor::adopt(int listeningFd) {
     std::lock_guard lock(mutex_);
@@ -39,6 +49,12 @@ Status IpcAcceptor::adopt(int listeningFd) {
         ::close(listeningFd);
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(error.value(), "Cannot listen on descriptor {}: {}",
                                               listeningFd, error.message()));
+    }
+    if (!passCredentials(listeningFd)) {
+        const int err = errno;
+        acceptor_.close(error);
+        return QRN_UNEXPECTED(
+            QRN_POSIX_ERROR(err, "Cannot ask for credentials on descriptor {}", listeningFd));
     }
     return {};
 }
@@ -60,7 +76,7 @@ void IpcAcceptor::acceptNext() {
     if (closed_) {
         return;
     }
-    acceptor_.async_accept(asio::make_strand(core_->io()),
+    acceptor_.async_accept(core_->nextContext(),
                            [self = shared_from_this()](const asio::error_code& error,
                                                        AsioIpcConnection::Socket socket) {
                                self->onAccepted(error, std::move(socket));
@@ -81,6 +97,11 @@ void IpcAcceptor::onAccepted(const asio::error_code& error, AsioIpcConnection::S
 
 void IpcAcceptor::handOver(AsioIpcConnection::Socket socket) {
     ::fcntl(socket.native_handle(), F_SETFD, FD_CLOEXEC);
+    if (!passCredentials(socket.native_handle())) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: no credentials: {}",
+                      std::strerror(errno));
+        return;
+    }
     auto peer = IpcPeer::fromSocket(socket.native_handle());
     if (!peer) {
         QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection whose client is unknown: {}",

@@ -1,7 +1,8 @@
 #pragma once
 // The listening side of the request service: accepts one connection at a
-// time, identifies its peer, gives it a strand of its own and hands it,
-// not yet resumed, to the listener's connection handler.
+// time on the first context, identifies its peer, pins it to a context of
+// the pool and hands it, not yet resumed, to the listener's connection
+// handler.
 
 #include "Daemon/platform/AsioIpcConnection.h"
 #include "Daemon/platform/IpcListener.h"

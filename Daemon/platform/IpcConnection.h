@@ -9,13 +9,25 @@
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/support/Value.h"
 
+#include <sys/types.h>
+
 #include <functional>
 #include <memory>
+#include <optional>
 
 namespace quarn {
 
 class IpcConnection {
 public:
+    // The process that wrote a message's bytes, as the kernel stamped them
+    // on the socket. A pid of 0 is a writer that cannot be named (another
+    // pid namespace, or bytes that came without credentials).
+    struct Sender {
+        pid_t pid = 0;
+        uid_t uid = 0;
+        gid_t gid = 0;
+        bool operator==(const Sender&) const = default;
+    };
     struct Event {
         enum class Kind {
             Message,     // a request dictionary
@@ -31,6 +43,10 @@ public:
     virtual ~IpcConnection() = default;
 
     virtual const IpcPeer& peer() const = 0;
+    // The writer of the message whose handler is running, for that handler
+    // only; none when the transport cannot tell, and then the connection's
+    // peer is taken as the writer.
+    virtual std::optional<Sender> messageSender() const { return std::nullopt; }
 
     // Both before resume(); a connection never resumed reads nothing.
     virtual void setEventHandler(EventHandler handler) = 0;

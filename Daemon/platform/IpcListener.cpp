@@ -9,7 +9,6 @@
 #include <algorithm>
 #include <exception>
 #include <mutex>
-#include <optional>
 #include <thread>
 #include <vector>
 
@@ -17,10 +16,10 @@ namespace quarn {
 
 namespace {
 
-void runPool(IpcServiceCore& core) {
+void runContext(asio::io_context& io) {
     for (;;) {
         try {
-            core.io().run();
+            io.run();
             return;
         } catch (const std::exception& e) {
             QRN_LOG_FAULT(LogCategory::Vell, "A request service thread caught: {}", e.what());
@@ -36,11 +35,12 @@ struct IpcListener::Impl {
     const Options options;
     // The pool threads hold the core too, so that it is never destroyed
     // from inside its own run().
-    const std::shared_ptr<IpcServiceCore> core = std::make_shared<IpcServiceCore>();
+    const std::shared_ptr<IpcServiceCore> core =
+        std::make_shared<IpcServiceCore>(std::max<std::size_t>(1, options.workerThreads));
 
     std::mutex mutex; // guards the fields below: start and stop may come from any thread
     std::shared_ptr<IpcAcceptor> acceptor;
-    std::optional<asio::executor_work_guard<asio::io_context::executor_type>> workGuard;
+    std::vector<asio::executor_work_guard<asio::io_context::executor_type>> workGuards;
     std::vector<std::thread> threads;
     bool started = false;
     bool stopped = false;
@@ -80,10 +80,9 @@ Status IpcListener::start(ConnectionHandler onConnection) {
         return adopted;
     }
     impl_->acceptor = std::move(acceptor);
-    impl_->workGuard.emplace(impl_->core->io().get_executor());
-    const std::size_t count = std::max<std::size_t>(1, impl_->options.workerThreads);
-    for (std::size_t i = 0; i < count; ++i) {
-        impl_->threads.emplace_back([core = impl_->core] { runPool(*core); });
+    for (std::size_t i = 0; i < impl_->core->contextCount(); ++i) {
+        impl_->workGuards.emplace_back(impl_->core->io(i).get_executor());
+        impl_->threads.emplace_back([core = impl_->core, i] { runContext(core->io(i)); });
     }
     impl_->started = true;
     impl_->acceptor->start();
@@ -119,10 +118,10 @@ void IpcListener::stop() {
         for (const auto& connection : impl_->core->connections()) {
             connection->shutDown();
         }
-        impl_->workGuard.reset();
+        impl_->workGuards.clear();
         threads = std::move(impl_->threads);
     }
-    const bool onPool = impl_->core->io().get_executor().running_in_this_thread();
+    const bool onPool = impl_->core->runningOnPool();
     for (auto& thread : threads) {
         // A pool thread cannot join itself; the threads hold what they use.
         if (onPool) {

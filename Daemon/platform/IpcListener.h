@@ -2,7 +2,8 @@
 // The request service: a Unix stream socket (or the one systemd hands over)
 // accepting client connections, and a pool of worker threads on which the
 // requests of one connection run one at a time while different connections
-// run concurrently.
+// run concurrently. Each connection stays on one worker thread, given round
+// robin; each message carries the credentials of the process that wrote it.
 //
 // Frame: a 4-byte little-endian length N, one flag byte (bit 0: the sender
 // expects a reply; other bits must be clear), then N bytes holding one CBOR

@@ -1,6 +1,26 @@
 #include "Daemon/platform/IpcServiceCore.h"
 
+#include <algorithm>
+
 namespace quarn {
+
+IpcServiceCore::IpcServiceCore(std::size_t contexts) {
+    contexts_.reserve(std::max<std::size_t>(1, contexts));
+    for (std::size_t i = 0; i < std::max<std::size_t>(1, contexts); ++i) {
+        // One thread runs each context.
+        contexts_.push_back(std::make_unique<asio::io_context>(1));
+    }
+}
+
+asio::io_context& IpcServiceCore::nextContext() {
+    return *contexts_[nextContext_.fetch_add(1, std::memory_order_relaxed) % contexts_.size()];
+}
+
+bool IpcServiceCore::runningOnPool() const {
+    return std::any_of(contexts_.begin(), contexts_.end(), [](const auto& context) {
+        return context->get_executor().running_in_this_thread();
+    });
+}
 
 void IpcServiceCore::closeGate() {
     std::lock_guard lock(gateMutex_);

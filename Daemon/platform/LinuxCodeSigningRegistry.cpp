@@ -56,11 +56,18 @@ LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {
                 CodeSigningRegistryLoader::load(directory_, ::geteuid() == 0));
             std::lock_guard guard(tableMutex_);
             table_ = std::move(table);
+            generation_.fetch_add(1);
         }
         loaded_.store(true);
     }
     std::lock_guard guard(tableMutex_);
     return table_;
+}
+
+std::uint64_t LinuxCodeSigningRegistry::generation() {
+    // Rereads first, so a change made before this call is counted.
+    currentTable();
+    return generation_.load();
 }
 
 // The path the kernel reports for a process is the one in the process's own

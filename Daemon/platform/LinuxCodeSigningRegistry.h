@@ -23,6 +23,8 @@ public:
     explicit LinuxCodeSigningRegistry(const Paths& paths);
 
     std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) override;
+    // Bumped by every reread of the directory.
+    std::uint64_t generation() override;
 
     const std::filesystem::path& directory() const { return directory_; }
 
@@ -46,9 +48,11 @@ private:
     // Set once the first read is in table_; until then lookups wait for it.
     std::atomic<bool> loaded_{false};
 
-    // Guards table_ (swapped by a reload, copied out by lookups).
+    // Guards table_ (swapped by a reload, copied out by lookups) and the
+    // writes of generation_.
     std::mutex tableMutex_;
     TablePtr table_;
+    std::atomic<std::uint64_t> generation_{0}; // written with table_
 };
 
 } // namespace quarn
