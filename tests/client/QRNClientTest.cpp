@@ -4,10 +4,9 @@
 
 #include "Client/QRNClient.h"
 
-#include "Daemon/platform/IpcFrame.h"
-
 #include "FakeServer.h"
 #include "common/TempRoot.h"
+#include "common/shared/FrameSocket.h"
 
 #include <gtest/gtest.h>
 
@@ -33,11 +32,7 @@ Value request(std::uint64_t command) {
 // A reply frame whose header and body are as given.
 FakeServer::Response rawFrame(std::uint32_t declaredLength, std::uint8_t flags,
                               std::vector<std::uint8_t> body, bool closeAfter) {
-    auto header = IpcFrame::encodeHeader(declaredLength, false);
-    std::vector<std::uint8_t> bytes(header.begin(), header.end());
-    bytes[4] = flags;
-    bytes.insert(bytes.end(), body.begin(), body.end());
-    return {bytes, closeAfter};
+    return {FrameSocket::rawFrame(declaredLength, flags, body), closeAfter};
 }
 
 } // namespace

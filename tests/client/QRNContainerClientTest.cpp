@@ -5,6 +5,7 @@
 #include "Client/QRNContainerClient.h"
 
 #include "FakeServer.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -12,14 +13,6 @@ using namespace quarn;
 using namespace quarn::test;
 
 namespace {
-
-Value dictionaryOf(std::initializer_list<std::pair<const char*, Value>> entries) {
-    Value dictionary = Value::dictionary();
-    for (const auto& [key, value] : entries) {
-        dictionary.set(key, value);
-    }
-    return dictionary;
-}
 
 Value withError(std::uint64_t code, Value keys = Value::dictionary()) {
     keys.set("ReplyError", code);

@@ -1,23 +1,17 @@
 #include "DaemonHarness.h"
 
-#include "Daemon/platform/FirstBootMarker.h"
 #include "Daemon/platform/Paths.h"
-#include "HexCbor.h"
+#include "common/shared/FrameSocket.h"
+#include "common/shared/HexCbor.h"
 
 #include <gtest/gtest.h>
 
 #include <signal.h>
-#include <stdlib.h>
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <unistd.h>
 
-#include <cstring>
 #include <fstream>
 #include <iostream>
 #include <iterator>
 #include <sstream>
-#include <stdexcept>
 #include <thread>
 
 namespace quarn::test {
@@ -25,22 +19,6 @@ namespace quarn::test {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
-void writeFile(const std::filesystem::path& file, std::string_view contents) {
-    std::filesystem::create_directories(file.parent_path());
-    std::ofstream(file, std::ios::trunc) << contents;
-}
-
-// One connect attempt, without the client library's error logging: a
-// socket that is not there yet is the normal case while polling.
-bool acceptsConnections(const std::filesystem::path& socketPath) {
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-    Descriptor fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    return fd.valid() &&
-           ::connect(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-}
 
 std::vector<std::string> lines(const std::string& text) {
     std::vector<std::string> result;
@@ -64,59 +42,29 @@ bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds
     return true;
 }
 
-std::uint64_t replyError(const Value& reply) {
-    const Value* error = reply.get("ReplyError");
-    return error ? error->asUInt64().value_or(0) : 0;
-}
-
 DaemonHarness::DaemonHarness() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "quarn-it.XXXXXX").string();
-    if (!::mkdtemp(pattern.data())) {
-        throw std::runtime_error("mkdtemp failed");
-    }
-    root_ = pattern;
-    stderrFile_ = root_ / "quarnd.stderr";
-    writeAccounts();
-    clients_.emplace(QUARN_TEST_CLIENT_PATH, root_ / "clients",
-                     Paths(root_).configDirectory() / "codesign.d");
+    stderrFile_ = root() / "quarnd.stderr";
+    root_.writeFile("/etc/os-release", "ID=quarnos\n"
+                                       "VERSION_ID=1.0\n"
+                                       "BUILD_ID=1A100\n"
+                                       "VARIANT_ID=internal\n");
+    clients_.emplace(QUARN_TEST_CLIENT_PATH, root() / "clients",
+                     Paths(root()).configDirectory() / "codesign.d");
     if (clients_->copied()) {
         std::cout << "note: the test clients are copies, not hard links (another file system)\n";
     }
 }
 
-DaemonHarness::~DaemonHarness() {
-    daemon_.reset(); // kills a daemon still running
-    (void)FirstBootMarker(root_).remove();
-    std::error_code ignored;
-    std::filesystem::remove_all(root_, ignored);
-}
-
-void DaemonHarness::writeAccounts() const {
-    writeFile(*this / "/etc/passwd",
-              "root:x:0:0:root:/private/var/root:/bin/sh\n"
-              "_installd:x:33:33:installer:/private/var/installer:/bin/false\n"
-              "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n");
-    writeFile(*this / "/etc/group", "wheel:x:0:\n"
-                                    "_installd:x:33:\n"
-                                    "mobile:x:501:\n"
-                                    "systemusers:x:1501:mobile\n");
-    writeFile(*this / "/etc/os-release", "ID=quarnos\n"
-                                         "VERSION_ID=1.0\n"
-                                         "BUILD_ID=1A100\n"
-                                         "VARIANT_ID=internal\n");
-    std::filesystem::create_directories(*this / "/private/var/mobile");
-}
-
 std::filesystem::path DaemonHarness::operator/(std::string_view absolute) const {
-    return Paths(root_).resolve(absolute);
+    return root_ / absolute;
 }
 
 std::filesystem::path DaemonHarness::runDirectory() const {
-    return Paths(root_).runDirectory();
+    return Paths(root()).runDirectory();
 }
 
 std::filesystem::path DaemonHarness::socketPath() const {
-    return QRNClient::socketPathForRoot(root_);
+    return QRNClient::socketPathForRoot(root());
 }
 
 bool DaemonHarness::spawn(std::vector<std::string> environment) {
@@ -124,7 +72,7 @@ bool DaemonHarness::spawn(std::vector<std::string> environment) {
         std::filesystem::exists(stderrFile_) ? std::filesystem::file_size(stderrFile_) : 0;
     ChildProcess::Spec spec;
     spec.program = QUARN_DAEMON_PATH;
-    spec.arguments = {"--root", root_.string(), "--foreground", "--log-level", "debug"};
+    spec.arguments = {"--root", root().string(), "--foreground", "--log-level", "debug"};
     spec.environment = std::move(environment);
     spec.stderrFile = stderrFile_;
     auto spawned = ChildProcess::spawn(spec);
@@ -140,7 +88,9 @@ bool DaemonHarness::spawn(std::vector<std::string> environment) {
 bool DaemonHarness::waitUntilAccepting() {
     const Clock::time_point deadline = Clock::now() + kWaitLimit;
     while (daemon_ && Clock::now() < deadline) {
-        if (acceptsConnections(socketPath())) {
+        // Without the client library's error logging: a socket that is not
+        // there yet is the normal case while polling.
+        if (FrameSocket::accepts(socketPath())) {
             return true;
         }
         // Doubles as the pause between attempts, and ends early on a crash.

@@ -10,6 +10,8 @@
 #include "Client/QRNClient.h"
 #include "ClientPrograms.h"
 #include "Daemon/support/Value.h"
+#include "common/shared/RequestValues.h"
+#include "common/shared/ScratchRoot.h"
 
 #include <chrono>
 #include <cstddef>
@@ -34,13 +36,10 @@ public:
     };
 
     DaemonHarness();
-    // Kills a daemon still running, removes the first-boot marker of the
-    // root and the root itself.
-    ~DaemonHarness();
     DaemonHarness(const DaemonHarness&) = delete;
     DaemonHarness& operator=(const DaemonHarness&) = delete;
 
-    const std::filesystem::path& root() const { return root_; }
+    const std::filesystem::path& root() const { return root_.path(); }
     // An absolute device path taken below the root.
     std::filesystem::path operator/(std::string_view absolute) const;
     std::filesystem::path runDirectory() const;
@@ -77,20 +76,16 @@ public:
     Value request(const Value& request) const;
 
 private:
-    void writeAccounts() const;
-
-    std::filesystem::path root_;
+    ScratchRoot root_{{.withMobileUser = true, .installContext = false}, "quarn-it"};
     std::filesystem::path stderrFile_;
     std::size_t runLogStart_ = 0; // where the current run's stderr begins
     std::optional<ClientPrograms> clients_;
-    std::optional<ChildProcess> daemon_;
+    std::optional<ChildProcess>
+        daemon_; // last: a daemon still running is killed before the root goes
 };
 
 // Polls `condition` until it holds or `limit` has passed; answers its last value.
 bool waitUntil(const std::function<bool()>& condition,
                std::chrono::milliseconds limit = DaemonHarness::kWaitLimit);
-
-// "ReplyError" of a reply; 0 when there is none.
-std::uint64_t replyError(const Value& reply);
 
 } // namespace quarn::test

@@ -11,7 +11,6 @@
 #include <memory>
 #include <optional>
 #include <span>
-#include <vector>
 
 namespace quarn::test {
 
@@ -31,16 +30,7 @@ public:
     // True when the daemon ends the connection before sending anything.
     bool waitForClose();
 
-    // Header (with `flags` as the flag byte) and body.
-    static std::vector<std::uint8_t> rawFrame(std::span<const std::uint8_t> body,
-                                              std::uint8_t flags);
-    static std::vector<std::uint8_t> frame(const Value& message, std::uint8_t flags);
-
 private:
-    // Reads exactly `into.size()` bytes; false on the end of the stream,
-    // an error, or the wait limit.
-    bool readExactly(std::span<std::uint8_t> into);
-
     std::unique_ptr<Descriptor> fd_;
 };
 

@@ -11,7 +11,7 @@
 // 3 a request went unanswered.
 
 #include "Client/QRNClient.h"
-#include "HexCbor.h"
+#include "common/shared/HexCbor.h"
 
 #include <cstdio>
 #include <iostream>

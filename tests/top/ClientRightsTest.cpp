@@ -10,6 +10,7 @@
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -17,18 +18,6 @@ using namespace quarn;
 using namespace quarn::test;
 
 namespace {
-
-Value dictionaryOf(std::initializer_list<std::pair<const char*, Value>> entries) {
-    Value dictionary = Value::dictionary();
-    for (const auto& [key, value] : entries) {
-        dictionary.set(key, value);
-    }
-    return dictionary;
-}
-
-Value arrayOf(std::initializer_list<Value> items) {
-    return Value(Value::Array(items));
-}
 
 class ClientRightsTest : public TempRootTest {
 protected:

@@ -9,21 +9,12 @@
 
 namespace quarn::test {
 
-Value dictionaryOf(std::initializer_list<std::pair<const char*, Value>> entries) {
-    Value dictionary = Value::dictionary();
-    for (const auto& [key, value] : entries) {
-        dictionary.set(key, value);
-    }
-    return dictionary;
-}
-
-Value arrayOf(std::initializer_list<Value> items) {
-    return Value(Value::Array(items));
-}
-
-std::uint64_t replyError(const Value& reply) {
-    const Value* error = reply.get("ReplyError");
-    return error ? error->asUInt64().value_or(0) : 0;
+IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body, bool expectsReply) {
+    IpcConnection::Event event;
+    event.kind = kind;
+    event.body = std::move(body);
+    event.expectsReply = expectsReply;
+    return event;
 }
 
 FakeIpcConnection::FakeIpcConnection()
@@ -43,20 +34,21 @@ Result<std::string> FakeSandboxExtensions::issueFileExtension(std::string_view e
 
 std::optional<Value>
 RecordedGroupsMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
-    if (onQuery) {
-        onQuery();
-    }
-    auto found = appGroups.find(identifier);
-    return found == appGroups.end() ? std::nullopt : std::optional<Value>(found->second);
+    return recorded(appGroups, identifier);
 }
 
 std::optional<Value>
 RecordedGroupsMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    return recorded(systemGroups, identifier);
+}
+
+std::optional<Value> RecordedGroupsMapping::recorded(const Records& records,
+                                                     std::string_view identifier) const {
     if (onQuery) {
         onQuery();
     }
-    auto found = systemGroups.find(identifier);
-    return found == systemGroups.end() ? std::nullopt : std::optional<Value>(found->second);
+    auto found = records.find(identifier);
+    return found == records.end() ? std::nullopt : std::optional<Value>(found->second);
 }
 
 VellEventFixture::VellEventFixture()
@@ -79,7 +71,7 @@ void VellEventFixture::setClient(const std::string& identifier, Value entitlemen
 
 std::vector<Value> VellEventFixture::dispatch(const Value& request) {
     const std::size_t before = connection_->replies().size();
-    QRNProcessVellEvent(connection_, {IpcConnection::Event::Kind::Message, request, true});
+    QRNProcessVellEvent(connection_, eventOf(IpcConnection::Event::Kind::Message, request, true));
     std::vector<Value> replies = connection_->replies();
     return {replies.begin() + static_cast<std::ptrdiff_t>(before), replies.end()};
 }

@@ -14,6 +14,7 @@
 #include "Daemon/platform/SandboxExtensions.h"
 
 #include "common/TempRoot.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -31,11 +32,6 @@
 namespace quarn::test {
 
 inline constexpr const char* kVellClient = "com.example.vellclient";
-
-Value dictionaryOf(std::initializer_list<std::pair<const char*, Value>> entries);
-Value arrayOf(std::initializer_list<Value> items);
-// "ReplyError" of a reply; 0 when it has none.
-std::uint64_t replyError(const Value& reply);
 
 class FakeIpcConnection : public IpcConnection {
 public:
@@ -95,11 +91,18 @@ public:
     using QRNCodeSigningMapping::QRNCodeSigningMapping;
     std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view identifier) override;
     std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier) override;
-    std::map<std::string, Value, std::less<>> appGroups;
-    std::map<std::string, Value, std::less<>> systemGroups;
+    using Records = std::map<std::string, Value, std::less<>>;
+    Records appGroups;
+    Records systemGroups;
     // Called at each query, for a test to look at what holds then.
     std::function<void()> onQuery;
+
+private:
+    std::optional<Value> recorded(const Records& records, std::string_view identifier) const;
 };
+
+// An event of `kind` from the connection's peer.
+IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body, bool expectsReply);
 
 class VellEventFixture : public ::testing::Test {
 protected:

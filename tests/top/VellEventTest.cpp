@@ -46,16 +46,16 @@ TEST_F(VellEventTest, AMissingOrMistypedCommandRunsCommandZero) {
 }
 
 TEST_F(VellEventTest, AMessageWithoutReplyContextCancelsTheConnection) {
-    QRNProcessVellEvent(
-        connection_,
-        {IpcConnection::Event::Kind::Message,
-         dictionaryOf({{"ContainerClass", Value(2u)}, {"CreateIfNecessary", Value(true)}}), false});
+    QRNProcessVellEvent(connection_, eventOf(IpcConnection::Event::Kind::Message,
+                                             dictionaryOf({{"ContainerClass", Value(2u)},
+                                                           {"CreateIfNecessary", Value(true)}}),
+                                             false));
     EXPECT_TRUE(connection_->cancelled());
     EXPECT_TRUE(connection_->replies().empty());
     EXPECT_FALSE(cached(kVellClient, kQRNContainerClassAppData));
 
     auto quiet = std::make_shared<FakeIpcConnection>();
-    QRNProcessVellEvent(quiet, {IpcConnection::Event::Kind::Invalidated, Value(), true});
+    QRNProcessVellEvent(quiet, eventOf(IpcConnection::Event::Kind::Invalidated, Value(), true));
     EXPECT_FALSE(quiet->cancelled());
     EXPECT_TRUE(quiet->replies().empty());
 }
@@ -85,6 +85,8 @@ TEST_F(VellEventTest, EntitlementsAdmitToCommands) {
         {"no entitlements, own personas", none, 32, 1},
         {"no entitlements, own groups", none, 13, 1},
         {"no entitlements, own system groups", none, 16, 1},
+        {"no entitlements, group identifiers", none, 14, 55},
+        {"no entitlements, info values", none, 5, 55},
         {"wipe as a boolean",
          dictionaryOf({{"com.orvex.private.Quarn.wipeContainer", Value(true)}}), 11, 55},
         {"wipe as a list",

@@ -1,7 +1,8 @@
 #pragma once
 // Request and reply dictionaries as hex text of their CBOR bytes: the form
 // in which the test client takes requests on its command line and prints
-// replies, one per line.
+// replies, one per line, and in which the load tool hands its echo server
+// the reply to send.
 
 #include "Daemon/support/QRNError.h"
 #include "Daemon/support/Value.h"
