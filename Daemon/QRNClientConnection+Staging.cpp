@@ -18,6 +18,8 @@
 #include "Daemon/support/UUID.h"
 
 #include <algorithm>
+#include <utility>
+#include <vector>
 
 namespace quarn {
 
@@ -35,6 +37,46 @@ bool isExcludedFromAppUserData(const std::string& name) {
     return std::find(excluded.begin(), excluded.end(), name) != excluded.end();
 }
 
+mode_t subdirectoryModeForClass(std::uint64_t cls) {
+    return QRNContainerClass::isSystem(cls) ? kSystemSubdirectoryMode : kContainerDirectoryMode;
+}
+
+uid_t subdirectoryOwnerForClass(std::uint64_t cls, const QRNMetadata& metadata) {
+    if (QRNContainerClass::isBundle(cls)) {
+        return QRNPlatformConstants::kInstallationUID;
+    }
+    if (QRNContainerClass::isSystem(cls)) {
+        return kSystemSubdirectoryOwner;
+    }
+    return metadata.userIdentity()->posixUIDForContainerClass(cls);
+}
+
+// An open directory and its path relative to the container.
+struct MadeParent {
+    const EnvFd& dir;
+    std::string name;
+};
+
+// The deepest directory already made (and held open) that contains `name`,
+// and the rest of `name` below it; the container itself when there is none.
+std::pair<MadeParent, std::string>
+nearestMadeParent(const std::vector<std::pair<std::string, EnvFd>>& made, const EnvFd& container,
+                  const std::string& name) {
+    const std::pair<std::string, EnvFd>* nearest = nullptr;
+    for (const auto& entry : made) {
+        const std::string& candidate = entry.first;
+        if (name.size() > candidate.size() && name.compare(0, candidate.size(), candidate) == 0 &&
+            name[candidate.size()] == '/' &&
+            (!nearest || candidate.size() > nearest->first.size())) {
+            nearest = &entry;
+        }
+    }
+    if (!nearest) {
+        return {MadeParent{container, std::string()}, name};
+    }
+    return {MadeParent{nearest->second, nearest->first}, name.substr(nearest->first.size() + 1)};
+}
+
 } // namespace
 
 CodeResult<QRNMetadataPtr>
@@ -48,10 +90,11 @@ QRNClientConnection::_buildInStaging(const QRNContainerIdentity& identity, const
     if (staging) {
         *staging /= uuid.string();
     }
-    Status made = staging ? _createTopLevelContainerDirectory(
-                                *staging, cls, userIdentity->posixUIDForContainerClass(cls))
-                          : QRN_UNEXPECTED(QRN_ERROR(kQRNErrorInvalidPath,
-                                                     "No staging directory for class {}", cls));
+    Result<EnvFd> made =
+        staging ? _createTopLevelContainerDirectory(*staging, cls,
+                                                    userIdentity->posixUIDForContainerClass(cls))
+                : QRN_UNEXPECTED(
+                      QRN_ERROR(kQRNErrorInvalidPath, "No staging directory for class {}", cls));
     if (!made) {
         QRN_ERROR(kQRNErrorCreateStagingFailed, "Failed to create staging dir at {} : {}",
                   staging ? staging->string() : "(null)", made.error().description());
@@ -79,36 +122,48 @@ QRNClientConnection::_buildInStaging(const QRNContainerIdentity& identity, const
                           staging->string(), acl.error().description());
         }
     }
-    if (auto subdirectories = _createSubDirectories(*staging, *metadata); !subdirectories) {
+    if (auto subdirectories = _createSubDirectories(*made, *staging, *metadata); !subdirectories) {
         return QRN_CODE(subdirectories.error());
     }
     return QRNMetadataPtr(metadata);
 }
 
-Status QRNClientConnection::_createTopLevelContainerDirectory(const std::filesystem::path& url,
-                                                              std::uint64_t containerClass,
-                                                              uid_t owner) {
+Result<EnvFd>
+QRNClientConnection::_createTopLevelContainerDirectory(const std::filesystem::path& url,
+                                                       std::uint64_t containerClass, uid_t owner) {
     if (QRNContainerClass::isBundle(containerClass)) {
         owner = QRNPlatformConstants::kInstallationUID;
     } else if (QRNContainerClass::isSystem(containerClass)) {
         owner = QRNPlatformConstants::kSystemContainerUID;
     }
-    return QRNFileManager::defaultManager().createDirectoryAtURL(url, true, kContainerDirectoryMode,
-                                                                 owner, 0);
+    return QRNFileManager::defaultManager().createAndOpenDirectoryAtURL(
+        url, true, kContainerDirectoryMode, owner, 0);
 }
 
 CodeResult<void>
 QRNClientConnection::_createSubDirectories(const std::filesystem::path& containerURL,
                                            const QRNMetadata& metadata) {
-    const std::uint64_t cls = metadata.containerClass();
-    mode_t mode = kContainerDirectoryMode;
-    uid_t owner = metadata.userIdentity()->posixUIDForContainerClass(cls);
-    if (QRNContainerClass::isBundle(cls)) {
-        owner = QRNPlatformConstants::kInstallationUID;
-    } else if (QRNContainerClass::isSystem(cls)) {
-        mode = kSystemSubdirectoryMode;
-        owner = kSystemSubdirectoryOwner;
+    // Recreating the structure of a container whose directory went missing
+    // makes the directory again too, as making each path would.
+    auto container = QRNFileManager::defaultManager().createAndOpenDirectoryAtURL(
+        containerURL, true, subdirectoryModeForClass(metadata.containerClass()), 0,
+        QRNFileManager::kProtectionClassUnchanged);
+    if (!container) {
+        QRN_ERROR(kQRNErrorCreateDirFailed, "Failed to create sub-dir for {} at {} (protClass: {})",
+                  metadata.identifier(), containerURL.string(),
+                  _dataProtectionClassForContainerMetadata(metadata));
+        return QRN_CODE(kQRNErrorCreateDirFailed);
     }
+    return _createSubDirectories(*container, containerURL, metadata);
+}
+
+CodeResult<void>
+QRNClientConnection::_createSubDirectories(const EnvFd& container,
+                                           const std::filesystem::path& containerURL,
+                                           const QRNMetadata& metadata) {
+    const std::uint64_t cls = metadata.containerClass();
+    const mode_t mode = subdirectoryModeForClass(cls);
+    const uid_t owner = subdirectoryOwnerForClass(cls, metadata);
     auto names =
         QRNDaemonContext::current().instance<ContainerLibrary>().subdirectoryNamesForClass(cls);
     if (!names) {
@@ -122,18 +177,26 @@ QRNClientConnection::_createSubDirectories(const std::filesystem::path& containe
                   metadata.identifier(), containerURL.string());
     // Data containers keep the daemon's own items readable whatever the lock state.
     const bool isDataClass = QRNContainerClass::isPerUser(cls);
+    // Made so far, open: "Library/Caches" is made in "Library" without
+    // walking to it again.
+    std::vector<std::pair<std::string, EnvFd>> made;
+    QRNFileManager& fileManager = QRNFileManager::defaultManager();
     for (const std::string& name : *names) {
         const std::int32_t protectionClass =
             isDataClass && isExcludedFromAppUserData(name) ? 0 : containerProtectionClass;
-        const std::filesystem::path url = containerURL / name;
-        if (auto made = QRNFileManager::defaultManager().createDirectoryAtURL(
-                url, true, mode, owner, protectionClass);
-            !made) {
+        const auto [parent, relative] = nearestMadeParent(made, container, name);
+        std::optional<std::filesystem::path> nestedURL;
+        const std::filesystem::path& parentURL =
+            parent.name.empty() ? containerURL : nestedURL.emplace(containerURL / parent.name);
+        auto directory = fileManager.createAndOpenDirectoryInDirectory(
+            parent.dir, parentURL, relative, mode, owner, protectionClass);
+        if (!directory) {
             QRN_ERROR(kQRNErrorCreateDirFailed,
                       "Failed to create sub-dir for {} at {} (protClass: {})",
-                      metadata.identifier(), url.string(), protectionClass);
+                      metadata.identifier(), (containerURL / name).string(), protectionClass);
             return QRN_CODE(kQRNErrorCreateDirFailed);
         }
+        made.emplace_back(name, std::move(*directory));
     }
     return {};
 }

@@ -36,6 +36,7 @@
 
 namespace quarn {
 
+class EnvFd;
 class QRNCommandQueue;
 class QRNDaemonContext;
 class QRNMetadata;
@@ -104,9 +105,14 @@ public:
                                                  bool createIfNecessary, bool transient,
                                                  bool useLocking, bool* existed = nullptr);
 
-    Status _createTopLevelContainerDirectory(const std::filesystem::path& url,
-                                             std::uint64_t containerClass, uid_t owner);
+    // Answers the new directory open, for building the container below it.
+    Result<EnvFd> _createTopLevelContainerDirectory(const std::filesystem::path& url,
+                                                    std::uint64_t containerClass, uid_t owner);
     CodeResult<void> _createSubDirectories(const std::filesystem::path& containerURL,
+                                           const QRNMetadata& metadata);
+    // The same in the container directory already open as `container`.
+    CodeResult<void> _createSubDirectories(const EnvFd& container,
+                                           const std::filesystem::path& containerURL,
                                            const QRNMetadata& metadata);
     std::int32_t _dataProtectionClassForContainerMetadata(const QRNMetadata& metadata);
 

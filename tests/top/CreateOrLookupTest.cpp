@@ -105,6 +105,23 @@ TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtection
     }
 }
 
+TEST_F(CreateOrLookupTest, RecreatedStructureIsNeverMadeThroughALinkInTheContainer) {
+    auto made = create(kClientBundle, kQRNContainerClassAppData);
+    ASSERT_TRUE(made);
+    const std::filesystem::path url = made->url();
+    const std::filesystem::path outside = root_.path() / "outside";
+    std::filesystem::create_directories(outside);
+    std::filesystem::remove_all(url / "Library");
+    std::filesystem::create_directory_symlink(outside, url / "Library");
+
+    auto recreated = privileged()->recreateDefaultStructureWithContainerIdentity(
+        identity(kClientBundle, kQRNContainerClassAppData));
+    ASSERT_FALSE(recreated);
+    EXPECT_EQ(recreated.error(), kQRNErrorCreateDirFailed);
+    EXPECT_TRUE(namesIn(outside).empty());
+    EXPECT_EQ(lstatOf(outside).st_uid, 0u);
+}
+
 TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
     // Entitlements choose protection classes for data containers only.
     entitlementsAskFor(QRNDataProtectionManager::kProtectionComplete);
