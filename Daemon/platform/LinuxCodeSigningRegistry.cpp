@@ -46,7 +46,7 @@ LinuxCodeSigningRegistry::LinuxCodeSigningRegistry(const Paths& paths)
     [[maybe_unused]] static const int sodiumReady = sodium_init();
 }
 
-LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {
+void LinuxCodeSigningRegistry::reloadIfChanged() {
     if (!loaded_.load() || monitor_.hasPendingChanges()) {
         std::lock_guard reload(reloadMutex_);
         // Consumed after the watch is (re)made and before the directory is
@@ -60,13 +60,17 @@ LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {
         }
         loaded_.store(true);
     }
+}
+
+LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {
+    reloadIfChanged();
     std::lock_guard guard(tableMutex_);
     return table_;
 }
 
 std::uint64_t LinuxCodeSigningRegistry::generation() {
     // Rereads first, so a change made before this call is counted.
-    currentTable();
+    reloadIfChanged();
     return generation_.load();
 }
 

@@ -31,6 +31,8 @@ public:
 private:
     using TablePtr = std::shared_ptr<const CodeSigningRegistryLoader::Table>;
 
+    // Rereads the directory when it changed.
+    void reloadIfChanged();
     // The current table, reread first when the directory changed.
     TablePtr currentTable();
     // `exe` is an open descriptor of the process's running executable.
