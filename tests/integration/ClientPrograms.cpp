@@ -22,7 +22,6 @@ enum class Digest { None, OfProgram, Wrong };
 struct Definition {
     std::string_view name;
     Value entitlements; // none: the entry has no "Entitlements"
-    bool sandboxed = false;
     Digest digest = Digest::None;
 };
 
@@ -40,16 +39,15 @@ std::vector<Definition> definitions() {
     const Value lookup = Value(
         Value::Dictionary{{"appData", Value(Value::Array{Value(P::identifierOf(P::kAllowed))})}});
     return {
-        {P::kAllowed, allowed, false, Digest::OfProgram},
-        {P::kNone, Value(), false, Digest::None},
-        {P::kLookup, granting("lookup", lookup), false, Digest::None},
-        {P::kWipeBool, granting("wipeContainer", true), false, Digest::None},
+        {P::kAllowed, allowed, Digest::OfProgram},
+        {P::kNone, Value(), Digest::None},
+        {P::kLookup, granting("lookup", lookup), Digest::None},
+        {P::kWipeBool, granting("wipeContainer", true), Digest::None},
         {P::kWipeArray,
          granting("wipeContainer", Value(Value::Array{Value(P::identifierOf(P::kWipeArray))})),
-         false, Digest::None},
-        {P::kTestability, granting("testability", true), false, Digest::None},
-        {P::kSandboxed, allowed, true, Digest::None},
-        {P::kBadDigest, allowed, false, Digest::Wrong},
+         Digest::None},
+        {P::kTestability, granting("testability", true), Digest::None},
+        {P::kBadDigest, allowed, Digest::Wrong},
     };
 }
 
@@ -92,8 +90,7 @@ ClientPrograms::ClientPrograms(const std::filesystem::path& clientProgram,
     for (const Definition& definition : definitions()) {
         install(clientProgram, definition.name);
         Value::Dictionary entry{{"Program", pathOf(definition.name).string()},
-                                {"Identifier", identifierOf(definition.name)},
-                                {"Sandboxed", definition.sandboxed}};
+                                {"Identifier", identifierOf(definition.name)}};
         if (!definition.entitlements.isNone()) {
             entry.emplace("Entitlements", definition.entitlements);
         }

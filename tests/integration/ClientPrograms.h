@@ -25,8 +25,6 @@ public:
     static constexpr std::string_view kWipeArray = "wipe-array";
     // Only "testability".
     static constexpr std::string_view kTestability = "testability";
-    // "allowed", sandboxed.
-    static constexpr std::string_view kSandboxed = "sandboxed";
     // "allowed", but the entry's digest is not the executable's.
     static constexpr std::string_view kBadDigest = "bad-digest";
 

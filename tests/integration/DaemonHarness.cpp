@@ -11,7 +11,6 @@
 #include <fstream>
 #include <iostream>
 #include <iterator>
-#include <sstream>
 #include <thread>
 
 namespace quarn::test {
@@ -19,15 +18,6 @@ namespace quarn::test {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
-std::vector<std::string> lines(const std::string& text) {
-    std::vector<std::string> result;
-    std::istringstream in(text);
-    for (std::string line; std::getline(in, line);) {
-        result.push_back(line);
-    }
-    return result;
-}
 
 } // namespace
 
@@ -150,14 +140,16 @@ DaemonHarness::ClientRun DaemonHarness::runClient(std::string_view program,
     for (const Value& request : requests) {
         spec.arguments.push_back(HexCbor::encode(request));
     }
-    spec.captureStdout = true;
+    spec.stdoutFile = root() / "clients" / ("run-" + std::to_string(++clientRuns_) + ".out");
     ClientRun run;
     auto child = ChildProcess::spawn(spec);
     if (!child) {
         run.failure = child.error().description();
         return run;
     }
-    for (const std::string& line : lines(child->readStdout(kWaitLimit))) {
+    run.exit = child->waitFor(kWaitLimit);
+    std::ifstream out(spec.stdoutFile);
+    for (std::string line; std::getline(out, line);) {
         if (line.starts_with('!')) {
             run.failure = line.substr(1);
             break;
@@ -169,7 +161,6 @@ DaemonHarness::ClientRun DaemonHarness::runClient(std::string_view program,
         }
         run.replies.push_back(std::move(*reply));
     }
-    run.exit = child->waitFor(kWaitLimit);
     return run;
 }
 

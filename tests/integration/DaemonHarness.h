@@ -6,10 +6,10 @@
 //
 // Every wait is bounded by kWaitLimit; none of them measures anything.
 
-#include "ChildProcess.h"
 #include "Client/QRNClient.h"
 #include "ClientPrograms.h"
 #include "Daemon/support/Value.h"
+#include "common/shared/ChildProcess.h"
 #include "common/shared/RequestValues.h"
 #include "common/shared/ScratchRoot.h"
 
@@ -78,7 +78,8 @@ public:
 private:
     ScratchRoot root_{{.withMobileUser = true, .installContext = false}, "quarn-it"};
     std::filesystem::path stderrFile_;
-    std::size_t runLogStart_ = 0; // where the current run's stderr begins
+    std::size_t runLogStart_ = 0;        // where the current run's stderr begins
+    mutable std::size_t clientRuns_ = 0; // names each client run's output file
     std::optional<ClientPrograms> clients_;
     std::optional<ChildProcess>
         daemon_; // last: a daemon still running is killed before the root goes

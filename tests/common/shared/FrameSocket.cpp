@@ -7,6 +7,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
@@ -123,9 +124,10 @@ bool FrameSocket::writeAll(int fd, std::span<const std::uint8_t> bytes) {
 std::vector<std::uint8_t> FrameSocket::rawFrame(std::uint32_t length, std::uint8_t flags,
                                                 std::span<const std::uint8_t> body) {
     const auto header = IpcFrame::encodeHeader(length, false);
-    std::vector<std::uint8_t> bytes(header.begin(), header.end());
+    std::vector<std::uint8_t> bytes(header.size() + body.size());
+    std::copy(header.begin(), header.end(), bytes.begin());
     bytes[IpcFrame::kHeaderSize - 1] = flags;
-    bytes.insert(bytes.end(), body.begin(), body.end());
+    std::copy(body.begin(), body.end(), bytes.begin() + IpcFrame::kHeaderSize);
     return bytes;
 }
 

@@ -1,8 +1,8 @@
 #pragma once
-// A child process of a test: the daemon, or one run of the test client.
-// Spawned with its stdin on /dev/null, its stdout captured through a pipe
-// or discarded, and its stderr appended to a file. Waits are bounded: a
-// child that hangs fails the test instead of hanging it.
+// A child process of a test or a benchmark: the daemon, a test client, an
+// echo server. Spawned with its stdin on /dev/null and its stdout and
+// stderr appended to files. Waits are bounded: a child that hangs fails
+// the test instead of hanging it.
 
 #include "Daemon/support/Descriptor.h"
 #include "Daemon/support/QRNError.h"
@@ -26,8 +26,8 @@ public:
         // Added to the test's environment, which loses the systemd
         // hand-over variables (LISTEN_*, NOTIFY_SOCKET) first.
         std::vector<std::string> environment;
-        bool captureStdout = false;
-        std::filesystem::path stderrFile; // empty: the test's own stderr
+        std::filesystem::path stdoutFile; // empty: /dev/null
+        std::filesystem::path stderrFile; // empty: the parent's own stderr
     };
 
     // How a child ended, as waitpid reported it.
@@ -49,17 +49,13 @@ public:
     // Waits up to `limit` for the child to end; none when it is still running.
     std::optional<Exit> waitFor(std::chrono::milliseconds limit);
     void signal(int signo) const;
-    // Everything the child writes to stdout until it closes it, or until
-    // `limit` has passed (then the child is killed).
-    std::string readStdout(std::chrono::milliseconds limit);
 
 private:
-    ChildProcess(pid_t pid, std::unique_ptr<Descriptor> pidfd, std::unique_ptr<Descriptor> out)
-        : pid_(pid), pidfd_(std::move(pidfd)), stdout_(std::move(out)) {}
+    ChildProcess(pid_t pid, std::unique_ptr<Descriptor> pidfd)
+        : pid_(pid), pidfd_(std::move(pidfd)) {}
 
     pid_t pid_ = -1;
     std::unique_ptr<Descriptor> pidfd_;
-    std::unique_ptr<Descriptor> stdout_;
     std::optional<Exit> exit_;
 };
 

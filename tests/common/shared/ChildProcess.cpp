@@ -8,7 +8,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <array>
 #include <cerrno>
 #include <cstring>
 #include <fmt/format.h>
@@ -19,8 +18,6 @@ extern char** environ;
 namespace quarn::test {
 
 namespace {
-
-using Clock = std::chrono::steady_clock;
 
 // A child must not take over a socket or a notification channel that a
 // service manager handed to the test.
@@ -88,15 +85,9 @@ std::string ChildProcess::Exit::description() const {
 Result<ChildProcess> ChildProcess::spawn(const Spec& spec) {
     FileActions files;
     posix_spawn_file_actions_addopen(&files.actions, 0, "/dev/null", O_RDONLY, 0);
-    std::array<int, 2> pipe{-1, -1};
-    if (spec.captureStdout) {
-        if (::pipe2(pipe.data(), O_CLOEXEC) != 0) {
-            return QRN_UNEXPECTED(QRN_POSIX_ERROR(errno, "pipe: {}", std::strerror(errno)));
-        }
-        posix_spawn_file_actions_adddup2(&files.actions, pipe[1], 1);
-    } else {
-        posix_spawn_file_actions_addopen(&files.actions, 1, "/dev/null", O_WRONLY, 0);
-    }
+    posix_spawn_file_actions_addopen(
+        &files.actions, 1, spec.stdoutFile.empty() ? "/dev/null" : spec.stdoutFile.c_str(),
+        O_WRONLY | O_CREAT | O_APPEND, 0644);
     if (!spec.stderrFile.empty()) {
         posix_spawn_file_actions_addopen(&files.actions, 2, spec.stderrFile.c_str(),
                                          O_WRONLY | O_CREAT | O_APPEND, 0644);
@@ -107,10 +98,6 @@ Result<ChildProcess> ChildProcess::spawn(const Spec& spec) {
     pid_t pid = -1;
     const int err = ::posix_spawn(&pid, spec.program.c_str(), &files.actions, nullptr,
                                   pointersTo(arguments).data(), pointersTo(environment).data());
-    auto out = std::make_unique<Descriptor>(pipe[0]);
-    if (pipe[1] >= 0) {
-        ::close(pipe[1]);
-    }
     if (err != 0) {
         return QRN_UNEXPECTED(
             QRN_POSIX_ERROR(err, "cannot spawn {}: {}", spec.program.string(), std::strerror(err)));
@@ -122,12 +109,11 @@ Result<ChildProcess> ChildProcess::spawn(const Spec& spec) {
         ::waitpid(pid, nullptr, 0);
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(openErr, "pidfd_open: {}", std::strerror(openErr)));
     }
-    return ChildProcess(pid, std::move(pidfd), std::move(out));
+    return ChildProcess(pid, std::move(pidfd));
 }
 
 ChildProcess::ChildProcess(ChildProcess&& other) noexcept
-    : pid_(std::exchange(other.pid_, -1)), pidfd_(std::move(other.pidfd_)),
-      stdout_(std::move(other.stdout_)), exit_(other.exit_) {}
+    : pid_(std::exchange(other.pid_, -1)), pidfd_(std::move(other.pidfd_)), exit_(other.exit_) {}
 
 ChildProcess::~ChildProcess() {
     if (pid_ > 0 && !exit_) {
@@ -154,29 +140,6 @@ void ChildProcess::signal(int signo) const {
     if (pid_ > 0 && !exit_) {
         ::kill(pid_, signo);
     }
-}
-
-std::string ChildProcess::readStdout(std::chrono::milliseconds limit) {
-    std::string text;
-    const Clock::time_point deadline = Clock::now() + limit;
-    while (stdout_ && stdout_->valid()) {
-        const auto left =
-            std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now());
-        if (left.count() <= 0 || pollFor(stdout_->get(), left) <= 0) {
-            signal(SIGKILL);
-            break;
-        }
-        char chunk[4096];
-        const ssize_t n = ::read(stdout_->get(), chunk, sizeof chunk);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            break;
-        }
-        text.append(chunk, static_cast<std::size_t>(n));
-    }
-    return text;
 }
 
 } // namespace quarn::test
