@@ -2,58 +2,18 @@
 
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
-#include "Daemon/platform/LinuxPlatform.h"
-#include "Daemon/platform/Paths.h"
 
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
-#include <stdlib.h>
 
 namespace quarn::bench {
-
-namespace {
-
-void writeFile(const std::filesystem::path& path, const char* contents) {
-    std::filesystem::create_directories(path.parent_path());
-    std::ofstream(path, std::ios::trunc) << contents;
-}
-
-} // namespace
 
 BenchRoot& BenchRoot::shared() {
     static BenchRoot root;
     return root;
 }
 
-BenchRoot::BenchRoot() {
-    std::string tmpl = (std::filesystem::temp_directory_path() / "quarn-micro.XXXXXX").string();
-    if (!mkdtemp(tmpl.data())) {
-        std::perror("mkdtemp");
-        std::exit(1);
-    }
-    root_ = tmpl;
-    Paths paths(root_);
-    writeFile(paths.resolve("/etc/passwd"),
-              "root:x:0:0:root:/private/var/root:/bin/sh\n"
-              "_installd:x:33:33:installer:/private/var/installer:/bin/false\n"
-              "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n");
-    writeFile(paths.resolve("/etc/group"), "wheel:x:0:\n"
-                                           "_installd:x:33:\n"
-                                           "mobile:x:501:\n"
-                                           "systemusers:x:1501:mobile\n");
-    std::filesystem::create_directories(paths.resolve("/private/var/mobile"));
-    context_ = std::make_shared<QRNDaemonContext>(root_);
-    installLinuxPlatform(*context_);
-    QRNDaemonContext::setCurrent(context_);
-}
-
-BenchRoot::~BenchRoot() {
-    QRNDaemonContext::setCurrent(nullptr);
-    context_.reset();
-    std::error_code ec;
-    std::filesystem::remove_all(root_, ec);
-}
+BenchRoot::BenchRoot() : root_(test::ScratchRoot::Options{}, "quarn-micro") {}
 
 QRNUserIdentityPtr BenchRoot::mobile() {
     return QRNUserIdentitySharedCache::defaultUserIdentity();

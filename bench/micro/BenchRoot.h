@@ -1,14 +1,10 @@
 #pragma once
-// A throw-away root prefix shared by every micro-benchmark of one run: its
-// own etc/passwd and etc/group (user "mobile" 501/501, home
-// "/private/var/mobile", group "systemusers"), a daemon context with the
-// Linux platform made current on it. Made on first use, removed at exit.
+// The throw-away root shared by every micro-benchmark of one run, with a
+// daemon context current on it; made on first use, removed at exit.
 
 #include "Daemon/model/QRNMetadata.h"
-#include "Daemon/support/QRNDaemonContext.h"
+#include "common/shared/ScratchRoot.h"
 
-#include <filesystem>
-#include <memory>
 #include <string>
 
 namespace quarn::bench {
@@ -16,12 +12,7 @@ namespace quarn::bench {
 class BenchRoot {
 public:
     static BenchRoot& shared();
-    ~BenchRoot();
-    BenchRoot(const BenchRoot&) = delete;
-    BenchRoot& operator=(const BenchRoot&) = delete;
 
-    const std::filesystem::path& path() const { return root_; }
-    QRNDaemonContext& context() { return *context_; }
     // The mobile user's identity.
     QRNUserIdentityPtr mobile();
 
@@ -32,8 +23,7 @@ public:
 private:
     BenchRoot();
 
-    std::filesystem::path root_;
-    std::shared_ptr<QRNDaemonContext> context_;
+    test::ScratchRoot root_;
 };
 
 } // namespace quarn::bench

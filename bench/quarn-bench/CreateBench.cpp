@@ -9,6 +9,7 @@
 #include "Daemon/model/QRNMetadata.h"
 #include "Daemon/support/ProtectionClassAttribute.h"
 #include "Daemon/support/UUID.h"
+#include "common/shared/RequestValues.h"
 
 #include <fmt/format.h>
 
@@ -66,7 +67,7 @@ CreateBench::CreateBench(const BenchOptions& options, DaemonRunner& daemon, Load
 
 void CreateBench::createWithDaemon(int count, LatencySamples& samples, Totals& totals) {
     FrameClient client(daemon_.socket());
-    const ChildProcess* process = daemon_.process();
+    const ServerProcess* process = daemon_.process();
     const double cpuBefore = process ? process->cpuSeconds() : 0;
     const auto begin = Clock::now();
     for (int i = 0; i < count; ++i) {
@@ -75,8 +76,7 @@ void CreateBench::createWithDaemon(int count, LatencySamples& samples, Totals& t
             client.roundTrip(containerRequest(identifierAt(made_++), kAppDataClass, true));
         samples.add(nanosecondsSince(start));
         const Value* existed = reply.get("ReplyExisted");
-        if (FrameClient::replyError(reply) != kReplySuccess || !existed ||
-            existed->asBool() != false) {
+        if (test::replyError(reply) != kReplySuccess || !existed || existed->asBool() != false) {
             fail("create failed: {}", reply.description());
         }
     }

@@ -2,6 +2,7 @@
 
 #include "Fail.h"
 #include "FrameClient.h"
+#include "common/shared/RequestValues.h"
 
 #include <cstdio>
 #include <thread>
@@ -34,7 +35,7 @@ void DaemonRunner::start() {
         stop();
     }
     const std::size_t cleanups = root_.notificationCount(kCleanupComplete);
-    process_ = std::make_unique<ChildProcess>(
+    process_ = std::make_unique<ServerProcess>(
         options_.daemon, std::vector<std::string>{"--root", root_.path().string()},
         root_.path() / "quarnd.out");
     ++starts_;
@@ -57,7 +58,7 @@ void DaemonRunner::start() {
 void DaemonRunner::waitUntilServing() {
     FrameClient client(socket_);
     const Value reply = client.roundTrip(Value(Value::Dictionary{{"Command", Value(33u)}}));
-    if (FrameClient::replyError(reply) != kInvalidCommand) {
+    if (test::replyError(reply) != kInvalidCommand) {
         fail("unexpected answer to an invalid command: {}", reply.description());
     }
 }

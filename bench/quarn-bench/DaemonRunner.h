@@ -5,8 +5,8 @@
 // someone else runs, which can be neither restarted nor weighed.
 
 #include "BenchOptions.h"
-#include "ChildProcess.h"
 #include "LoadRoot.h"
+#include "ServerProcess.h"
 
 #include <filesystem>
 #include <memory>
@@ -28,7 +28,7 @@ public:
     void stop();
     long residentKiB() const;
     // The daemon process, when this tool started it.
-    const ChildProcess* process() const { return process_.get(); }
+    const ServerProcess* process() const { return process_.get(); }
 
 private:
     void waitUntilServing();
@@ -36,7 +36,7 @@ private:
     const BenchOptions& options_;
     LoadRoot& root_;
     std::filesystem::path socket_;
-    std::unique_ptr<ChildProcess> process_;
+    std::unique_ptr<ServerProcess> process_;
     int starts_ = 0;
 };
 

@@ -26,12 +26,8 @@ public:
     // Sends the request with the reply flag and decodes the reply; stops
     // the tool when the connection fails or the reply does not decode.
     Value roundTrip(const Value& request);
-    // The reply's "ReplyError" (0 when it has none).
-    static std::uint64_t replyError(const Value& reply);
 
 private:
-    void readExactly(std::uint8_t* into, std::size_t size);
-
     int fd_ = -1;
     std::vector<std::uint8_t> body_; // reused for every reply
 };

@@ -7,10 +7,9 @@
 // where and how the daemon would. Removed, with the root's first-boot
 // marker, when the tool ends.
 
-#include "Daemon/support/QRNDaemonContext.h"
+#include "common/shared/ScratchRoot.h"
 
 #include <filesystem>
-#include <memory>
 
 namespace quarn::loadbench {
 
@@ -22,19 +21,17 @@ public:
     LoadRoot(const LoadRoot&) = delete;
     LoadRoot& operator=(const LoadRoot&) = delete;
 
-    const std::filesystem::path& path() const { return root_; }
-    QRNDaemonContext& context() { return *context_; }
+    const std::filesystem::path& path() const { return root_.path(); }
+    QRNDaemonContext& context() { return root_.context(); }
     std::filesystem::path socketPath() const;
     // Lines in the notification file of `name` (one per post).
     std::size_t notificationCount(const char* name) const;
 
 private:
-    void writeAccounts() const;
     void writeRegistryEntry() const;
 
-    std::filesystem::path root_;
+    test::ScratchRoot root_;
     bool keep_;
-    std::shared_ptr<QRNDaemonContext> context_;
 };
 
 } // namespace quarn::loadbench

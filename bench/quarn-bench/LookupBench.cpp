@@ -1,11 +1,12 @@
 #include "LookupBench.h"
 
-#include "ChildProcess.h"
 #include "Fail.h"
 #include "FrameClient.h"
 #include "Requests.h"
+#include "ServerProcess.h"
 
-#include "Daemon/platform/CborCodec.h"
+#include "common/shared/HexCbor.h"
+#include "common/shared/RequestValues.h"
 
 #include <fmt/format.h>
 
@@ -43,13 +44,13 @@ Value LookupBench::prepare() {
     for (int i = 0; i < std::max(1, options_.clients); ++i) {
         const std::string identifier = fmt::format("com.orvex.bench.lookup{:03}", i);
         const Value created = client.roundTrip(containerRequest(identifier, kAppDataClass, true));
-        if (FrameClient::replyError(created) != kReplySuccess) {
+        if (test::replyError(created) != kReplySuccess) {
             fail("creating {} failed: {}", identifier, created.description());
         }
         requests_.push_back(containerRequest(identifier, kAppDataClass, false));
     }
     const Value reply = client.roundTrip(requests_.front());
-    if (FrameClient::replyError(reply) != kReplySuccess) {
+    if (test::replyError(reply) != kReplySuccess) {
         fail("lookup failed: {}", reply.description());
     }
     return reply;
@@ -67,7 +68,7 @@ void LookupBench::clientLoop(const std::filesystem::path& socket, const Value& r
         const auto start = Clock::now();
         const Value reply = client.roundTrip(request);
         const auto end = Clock::now();
-        if (FrameClient::replyError(reply) != kReplySuccess) {
+        if (test::replyError(reply) != kReplySuccess) {
             fail("lookup failed under load: {}", reply.description());
         }
         out.add(static_cast<std::uint64_t>(
@@ -79,7 +80,7 @@ void LookupBench::clientLoop(const std::filesystem::path& socket, const Value& r
 }
 
 LookupBench::Run LookupBench::measure(const std::filesystem::path& socket,
-                                      const ChildProcess* server, int clients,
+                                      const ServerProcess* server, int clients,
                                       double seconds) const {
     std::vector<LatencySamples> perClient(static_cast<std::size_t>(clients));
     std::vector<std::thread> threads;
@@ -119,9 +120,9 @@ LookupBench::Run LookupBench::measure(const std::filesystem::path& socket,
 void LookupBench::run(ResultTable& table) {
     const Value reply = prepare();
     const auto echoSocket = root_.path() / "echo.sock";
-    ChildProcess echo(
+    ServerProcess echo(
         std::filesystem::read_symlink("/proc/self/exe"),
-        {"--echo-server", echoSocket.string(), "--echo-reply", toHex(CborCodec::encode(reply))},
+        {"--echo-server", echoSocket.string(), "--echo-reply", test::HexCbor::encode(reply)},
         root_.path() / "echo.out");
     if (!echo.waitForSocket(echoSocket, std::chrono::seconds(10))) {
         fail("the echo server did not start");

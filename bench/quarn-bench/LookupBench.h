@@ -6,11 +6,11 @@
 // so a machine busy with other work disturbs both sides alike.
 
 #include "BenchOptions.h"
-#include "ChildProcess.h"
 #include "DaemonRunner.h"
 #include "LatencySamples.h"
 #include "LoadRoot.h"
 #include "ResultTable.h"
+#include "ServerProcess.h"
 
 #include "Daemon/support/Value.h"
 
@@ -39,7 +39,7 @@ private:
     // One container per client; answers the reply a lookup gets.
     Value prepare();
     // `server`, when known, is weighed for its CPU time.
-    Run measure(const std::filesystem::path& socket, const ChildProcess* server, int clients,
+    Run measure(const std::filesystem::path& socket, const ServerProcess* server, int clients,
                 double seconds) const;
     static void clientLoop(const std::filesystem::path& socket, const Value& request,
                            const std::atomic<bool>& go, std::atomic<int>& ready,

@@ -7,6 +7,7 @@
 #include "Requests.h"
 
 #include "Daemon/model/QRNMetadata.h"
+#include "common/shared/RequestValues.h"
 
 #include <fmt/format.h>
 #include <plist/plist.h>
@@ -45,14 +46,14 @@ RebuildBench::Timing RebuildBench::firstLookup(std::uint64_t containerClass,
                                                const std::string& identifier,
                                                std::uint64_t expectedError) const {
     FrameClient client(daemon_.socket());
-    const ChildProcess* process = daemon_.process();
+    const ServerProcess* process = daemon_.process();
     const double cpuBefore = process ? process->cpuSeconds() : 0;
     const auto start = Clock::now();
     const Value reply = client.roundTrip(containerRequest(identifier, containerClass, false));
     Timing timing;
     timing.seconds = std::chrono::duration<double>(Clock::now() - start).count();
     timing.cpu = process ? process->cpuSeconds() - cpuBefore : 0;
-    if (FrameClient::replyError(reply) != expectedError) {
+    if (test::replyError(reply) != expectedError) {
         fail("lookup of {} in class {}: {}", identifier, containerClass, reply.description());
     }
     return timing;

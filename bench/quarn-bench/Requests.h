@@ -1,12 +1,10 @@
 #pragma once
-// The requests the tool sends, and the hex form in which a reply is handed
-// to the echo server.
+// The requests the tool sends.
 
 #include "Daemon/support/Value.h"
 
 #include <cstdint>
 #include <string>
-#include <vector>
 
 namespace quarn::loadbench {
 
@@ -21,9 +19,5 @@ inline Value containerRequest(const std::string& identifier, std::uint64_t conta
                                    {"CreateIfNecessary", Value(create)},
                                    {"Transient", Value(false)}});
 }
-
-std::string toHex(const std::vector<std::uint8_t>& bytes);
-// Empty on anything that is not an even number of hex digits.
-std::vector<std::uint8_t> fromHex(const std::string& text);
 
 } // namespace quarn::loadbench

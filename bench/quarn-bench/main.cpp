@@ -12,10 +12,9 @@
 #include "LoadRoot.h"
 #include "LookupBench.h"
 #include "RebuildBench.h"
-#include "Requests.h"
 #include "ResultTable.h"
 
-#include "Daemon/platform/CborCodec.h"
+#include "common/shared/HexCbor.h"
 
 #include <CLI/CLI.hpp>
 
@@ -36,7 +35,7 @@ constexpr const char* kBuiltDaemon = "";
 #endif
 
 [[noreturn]] void runEchoServer(const std::string& socket, const std::string& replyHex) {
-    auto reply = quarn::CborCodec::decode(fromHex(replyHex));
+    auto reply = quarn::test::HexCbor::decode(replyHex);
     if (!reply) {
         fail("--echo-reply is not a CBOR message in hex");
     }

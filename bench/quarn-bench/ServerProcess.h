@@ -1,29 +1,31 @@
 #pragma once
-// A process the tool starts (the daemon, the echo server), its output sent
-// to a file, its resident memory read from /proc, ended with SIGTERM. When
-// the tool stops early (exit() skips the destructors) the processes still
-// running are ended too.
+// A server the tool starts (the daemon, the echo server), its output sent
+// to a file, its resident memory and CPU time read from /proc, ended with
+// SIGTERM. When the tool stops early (exit() skips the destructors) the
+// servers still running are ended too.
+
+#include "common/shared/ChildProcess.h"
 
 #include <sys/types.h>
 
 #include <chrono>
 #include <filesystem>
+#include <optional>
 #include <string>
 #include <vector>
 
 namespace quarn::loadbench {
 
-class ChildProcess {
+class ServerProcess {
 public:
     // Starts `program` with `arguments`; stdout and stderr go to `output`.
-    ChildProcess(const std::filesystem::path& program, const std::vector<std::string>& arguments,
-                 const std::filesystem::path& output);
-    ~ChildProcess(); // stop() if still running
-    ChildProcess(const ChildProcess&) = delete;
-    ChildProcess& operator=(const ChildProcess&) = delete;
+    ServerProcess(const std::filesystem::path& program, const std::vector<std::string>& arguments,
+                  const std::filesystem::path& output);
+    ~ServerProcess(); // stop() if still running
+    ServerProcess(const ServerProcess&) = delete;
+    ServerProcess& operator=(const ServerProcess&) = delete;
 
-    pid_t pid() const { return pid_; }
-    bool running();
+    pid_t pid() const { return process_->pid(); }
     // Polls until `socket` accepts; false when the process ends or the
     // time runs out first.
     bool waitForSocket(const std::filesystem::path& socket, std::chrono::seconds timeout);
@@ -36,9 +38,7 @@ public:
     int stop(std::chrono::seconds grace = std::chrono::seconds(20));
 
 private:
-    pid_t pid_ = -1;
-    int status_ = 0;
-    bool reaped_ = false;
+    std::optional<test::ChildProcess> process_;
 };
 
 } // namespace quarn::loadbench
