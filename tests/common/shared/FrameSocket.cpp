@@ -40,6 +40,22 @@ int closed(int fd) {
     return -1;
 }
 
+// Repeats `step` (one recv or send of what is left) until every byte has
+// gone; false at the end of the stream or on an error.
+template <class Byte, class Step> bool whole(std::span<Byte> bytes, Step step) {
+    while (!bytes.empty()) {
+        const ssize_t n = step(bytes);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            return false;
+        }
+        bytes = bytes.subspan(static_cast<std::size_t>(n));
+    }
+    return true;
+}
+
 } // namespace
 
 int FrameSocket::connectTo(const std::filesystem::path& socketPath) {
@@ -94,31 +110,12 @@ std::optional<FrameSocket::Frame> FrameSocket::readFrame(int fd, std::vector<std
 }
 
 bool FrameSocket::readExactly(int fd, std::span<std::uint8_t> into) {
-    while (!into.empty()) {
-        const ssize_t n = ::recv(fd, into.data(), into.size(), 0);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        into = into.subspan(static_cast<std::size_t>(n));
-    }
-    return true;
+    return whole(into, [fd](auto left) { return ::recv(fd, left.data(), left.size(), 0); });
 }
 
 bool FrameSocket::writeAll(int fd, std::span<const std::uint8_t> bytes) {
-    while (!bytes.empty()) {
-        const ssize_t n = ::send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        bytes = bytes.subspan(static_cast<std::size_t>(n));
-    }
-    return true;
+    return whole(bytes,
+                 [fd](auto left) { return ::send(fd, left.data(), left.size(), MSG_NOSIGNAL); });
 }
 
 std::vector<std::uint8_t> FrameSocket::rawFrame(std::uint32_t length, std::uint8_t flags,
