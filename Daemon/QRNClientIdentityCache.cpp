@@ -13,16 +13,6 @@ namespace quarn {
 
 namespace {
 
-// A process whose pidfd cannot be polled counts as gone: its entry is not
-// trusted, since its pid might name another process by now.
-bool hasExited(const IpcPeer& peer) {
-    if (peer.pidfd() < 0) {
-        return true;
-    }
-    pollfd p{peer.pidfd(), POLLIN, 0};
-    return ::poll(&p, 1, 0) != 0;
-}
-
 // The writer as a peer: the connecting process as described at accept, as
 // long as its ids are those it connected with; any other from its pid.
 std::optional<IpcPeer> peerOf(const IpcConnection& connection,
@@ -38,8 +28,16 @@ std::optional<IpcPeer> peerOf(const IpcConnection& connection,
 
 } // namespace
 
-bool QRNClientIdentityCache::isStillValid(const Entry& entry, std::uint64_t registryGeneration) {
-    if (entry.registryGeneration != registryGeneration || hasExited(entry.peer)) {
+bool QRNClientIdentityCache::isStillValid(const Entry& entry, CodeSigningRegistry& registry,
+                                          std::uint64_t& registryGeneration) {
+    // Whether the writer has exited (its pidfd turns readable) is asked in
+    // the same system call as whether the registry changed: both are asked
+    // on every message. A process whose pidfd cannot be polled counts as
+    // gone: its pid might name another process by now.
+    pollfd exit{entry.peer.pidfd(), POLLIN, 0};
+    registryGeneration = registry.generationPolling(exit);
+    if (entry.peer.pidfd() < 0 || exit.revents != 0 ||
+        entry.registryGeneration != registryGeneration) {
         return false;
     }
     if (!entry.identity) {
@@ -56,16 +54,17 @@ QRNClientIdentityPtr QRNClientIdentityCache::identityFor(const IpcConnection& co
     const IpcPeer& connected = connection.peer();
     const IpcConnection::Sender sender = connection.messageSender().value_or(
         IpcConnection::Sender{connected.pid(), connected.uid(), connected.gid()});
+    auto& registry = QRNDaemonContext::current().instance<CodeSigningRegistry>();
     // Read before the identity is made: a reload during the making shows
     // as a newer generation at the next request.
-    const std::uint64_t generation =
-        QRNDaemonContext::current().instance<CodeSigningRegistry>().generation();
+    std::uint64_t generation = 0;
     const auto found = std::find_if(entries_.begin(), entries_.end(),
                                     [&](const Entry& entry) { return entry.sender == sender; });
-    if (found != entries_.end()) {
-        if (isStillValid(*found, generation)) {
-            return found->identity;
-        }
+    if (found == entries_.end()) {
+        generation = registry.generation();
+    } else if (isStillValid(*found, registry, generation)) {
+        return found->identity;
+    } else {
         entries_.erase(found);
     }
     std::optional<IpcPeer> peer = peerOf(connection, sender);

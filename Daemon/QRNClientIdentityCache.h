@@ -41,7 +41,9 @@ private:
         QRNClientIdentityPtr identity;
     };
 
-    static bool isStillValid(const Entry& entry, std::uint64_t registryGeneration);
+    // Also answers the registry's current generation.
+    static bool isStillValid(const Entry& entry, CodeSigningRegistry& registry,
+                             std::uint64_t& registryGeneration);
 
     std::vector<Entry> entries_;
 };

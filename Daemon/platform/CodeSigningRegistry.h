@@ -9,6 +9,8 @@
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/support/Value.h"
 
+#include <poll.h>
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -37,6 +39,12 @@ public:
     // computed under one generation hold until it changes. Cheap enough to
     // ask on every request. A registry that never changes keeps 0.
     virtual std::uint64_t generation() { return 0; }
+    // generation(), polling `other` (whose revents are set) on the way:
+    // one system call instead of two where the registry polls for changes.
+    virtual std::uint64_t generationPolling(pollfd& other) {
+        ::poll(&other, 1, 0);
+        return generation();
+    }
 };
 
 } // namespace quarn

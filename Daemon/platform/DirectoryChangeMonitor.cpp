@@ -38,6 +38,17 @@ bool DirectoryChangeMonitor::hasPendingChanges() const {
     return ::poll(&fd, 1, 0) != 0; // an error too: look rather than miss a change
 }
 
+bool DirectoryChangeMonitor::hasPendingChangesPolling(pollfd& other) const {
+    if (!inotify_.valid() || !armed_.load()) {
+        ::poll(&other, 1, 0);
+        return true;
+    }
+    pollfd fds[2] = {other, {inotify_.get(), POLLIN, 0}};
+    const int ready = ::poll(fds, 2, 0);
+    other.revents = fds[0].revents;
+    return ready < 0 || fds[1].revents != 0;
+}
+
 bool DirectoryChangeMonitor::consumeChanges() {
     if (!inotify_.valid()) {
         return true;

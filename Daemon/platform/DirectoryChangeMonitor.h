@@ -6,6 +6,8 @@
 
 #include "Daemon/support/Descriptor.h"
 
+#include <poll.h>
+
 #include <atomic>
 #include <filesystem>
 
@@ -20,6 +22,9 @@ public:
     // Whether events wait to be consumed (or the monitor has never been
     // asked, or cannot watch at all). Safe from any thread; reads nothing.
     bool hasPendingChanges() const;
+    // The same, polling `other` (whose revents are set) in the same system
+    // call, for a caller that checks both on a hot path.
+    bool hasPendingChangesPolling(pollfd& other) const;
 
     // True on the first call, and whenever a change may have happened since
     // the previous call; consumes the pending events. The watch is (re)made

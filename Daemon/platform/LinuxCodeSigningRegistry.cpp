@@ -48,18 +48,30 @@ LinuxCodeSigningRegistry::LinuxCodeSigningRegistry(const Paths& paths)
 
 void LinuxCodeSigningRegistry::reloadIfChanged() {
     if (!loaded_.load() || monitor_.hasPendingChanges()) {
-        std::lock_guard reload(reloadMutex_);
-        // Consumed after the watch is (re)made and before the directory is
-        // read, so a change during the read is seen by the next lookup.
-        if (monitor_.consumeChanges()) {
-            auto table = std::make_shared<const CodeSigningRegistryLoader::Table>(
-                CodeSigningRegistryLoader::load(directory_, ::geteuid() == 0));
-            std::lock_guard guard(tableMutex_);
-            table_ = std::move(table);
-            generation_.fetch_add(1);
-        }
-        loaded_.store(true);
+        reload();
     }
+}
+
+std::uint64_t LinuxCodeSigningRegistry::generationPolling(pollfd& other) {
+    const bool changed = monitor_.hasPendingChangesPolling(other);
+    if (!loaded_.load() || changed) {
+        reload();
+    }
+    return generation_.load();
+}
+
+void LinuxCodeSigningRegistry::reload() {
+    std::lock_guard serialised(reloadMutex_);
+    // Consumed after the watch is (re)made and before the directory is
+    // read, so a change during the read is seen by the next lookup.
+    if (monitor_.consumeChanges()) {
+        auto table = std::make_shared<const CodeSigningRegistryLoader::Table>(
+            CodeSigningRegistryLoader::load(directory_, ::geteuid() == 0));
+        std::lock_guard guard(tableMutex_);
+        table_ = std::move(table);
+        generation_.fetch_add(1);
+    }
+    loaded_.store(true);
 }
 
 LinuxCodeSigningRegistry::TablePtr LinuxCodeSigningRegistry::currentTable() {

@@ -25,6 +25,7 @@ public:
     std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) override;
     // Bumped by every reread of the directory.
     std::uint64_t generation() override;
+    std::uint64_t generationPolling(pollfd& other) override;
 
     const std::filesystem::path& directory() const { return directory_; }
 
@@ -33,6 +34,8 @@ private:
 
     // Rereads the directory when it changed.
     void reloadIfChanged();
+    // Rereads it if changes are still pending once the reload lock is held.
+    void reload();
     // The current table, reread first when the directory changed.
     TablePtr currentTable();
     // `exe` is an open descriptor of the process's running executable.
