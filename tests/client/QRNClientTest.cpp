@@ -7,6 +7,7 @@
 #include "FakeServer.h"
 #include "common/TempRoot.h"
 #include "common/shared/FrameSocket.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -24,9 +25,7 @@ QRNClient adopt(FakeServer& server, QRNClient::Options options = {}) {
 }
 
 Value request(std::uint64_t command) {
-    Value value = Value::dictionary();
-    value.set("Command", command);
-    return value;
+    return dictionaryOf({{"Command", Value(command)}});
 }
 
 // A reply frame whose header and body are as given.
