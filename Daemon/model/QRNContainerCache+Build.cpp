@@ -8,6 +8,8 @@
 #include "Daemon/support/Signpost.h"
 #include "Daemon/support/UUID.h"
 
+#include <malloc.h>
+
 #include <cerrno>
 #include <exception>
 #include <typeinfo>
@@ -16,11 +18,14 @@ namespace quarn {
 
 bool QRNContainerCache::containerURL(const std::filesystem::path& url,
                                      std::uint64_t isValidForContainerClass) const {
-    const std::string name = url.filename().string();
+    return containerName(url.filename().native(), isValidForContainerClass);
+}
+
+bool QRNContainerCache::containerName(std::string_view name, std::uint64_t cls) const {
     if (UUID::parse(name)) {
         return true;
     }
-    switch (isValidForContainerClass) {
+    switch (cls) {
     case kQRNContainerClassSystemData:
         return whitelist_->systemContainerIdIsWellknown(name);
     case kQRNContainerClassSystemGroup:
@@ -58,6 +63,9 @@ QRNContainerCache::_lock_rebuild(const QRNUserIdentityPtr& userIdentity, std::ui
         interval.end(fmt::format("{} containers", built->containers.size()));
         EntryMap& entries = transient ? transient_ : permanent_;
         auto [stored, inserted] = entries.insert_or_assign(key, std::move(*built));
+        // The scan's reads leave freed memory behind (the listing, every
+        // parsed file) that the allocator keeps resident unless told.
+        ::malloc_trim(0);
         return &stored->second;
     } catch (const std::exception& e) {
         return QRN_UNEXPECTED(
@@ -95,42 +103,49 @@ QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdenti
     // By reference: a conditional with a temporary on one side would copy
     // the whole listing.
     static const std::vector<QRNFileManager::Item> kNoItems;
+    QRNMetadata::ReadMemo memo;
+    std::string file; // reused: no path object per container
     for (const auto& item : items ? *items : kNoItems) {
-        if (!containerURL(item.url, cls)) {
+        const std::string& url = item.url.native();
+        const std::string_view name = std::string_view(url).substr(url.rfind('/') + 1);
+        if (!containerName(name, cls)) {
             continue;
         }
         if (!item.isDirectory) {
             // A link or file under a container's name is never trusted as one.
             QRN_LOG_DEBUG(LogCategory::Cache, "Cache: {}{}: skipping non-directory {}", key, suffix,
-                          item.url.string());
+                          url);
             continue;
         }
         // The reader has made sure the record's user is this entry's; a record
         // of this entry's class then lies in its class directory, since that
         // is the directory listed. Only a record of another class needs the
         // path check (which reports it), and the check is most of a read.
-        const auto file = item.url / QRNMetadata::kFileName;
-        auto metadata = QRNMetadata::readAndValidateMetadataAtFileUrl(file, userIdentity, false);
+        file.assign(url).append("/").append(QRNMetadata::kFileName);
+        auto metadata =
+            QRNMetadata::readAndValidateMetadataAtFilePath(file, userIdentity, false, &memo);
         if (metadata && (*metadata)->containerClass() != cls) {
-            metadata = QRNMetadata::readAndValidateMetadataAtFileUrl(file, userIdentity, true);
+            metadata =
+                QRNMetadata::readAndValidateMetadataAtFilePath(file, userIdentity, true, &memo);
         }
         if (!metadata) {
             // Reported (making the error logs it) and left out of the entry.
             QRN_ERROR(kQRNErrorNoMetadata,
                       "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, "
                       "class: {}",
-                      key, suffix, item.url.string(), item.url.filename().string(), cls);
+                      key, suffix, url, name, cls);
             continue;
         }
         // A later record with the same identifier replaces the earlier.
-        entry.containers.insert_or_assign((*metadata)->identifier(), *metadata);
-        if (entry.sandboxPopulated && shouldRegisterSandboxMappingWithUserIdentity(
-                                          userIdentity, (*metadata)->identifier(), cls)) {
-            if (int err = _lock_mapContainer(entry, *userIdentity, **metadata); err != 0) {
+        Slot& slot = storeRecord(entry, std::move(*metadata));
+        const std::string& identifier = slot.record->identifier();
+        if (entry.sandboxPopulated &&
+            shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, cls)) {
+            if (int err = _lock_mapContainer(slot, *userIdentity); err != 0) {
                 QRN_LOG_ERROR(LogCategory::Sandbox,
                               "Failed to set container mapping during create/lookup operation "
                               "of {}, {}",
-                              (*metadata)->identifier(), err);
+                              identifier, err);
             }
         }
     }

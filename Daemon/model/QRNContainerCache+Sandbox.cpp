@@ -41,7 +41,7 @@ std::uint64_t QRNContainerCache::sandboxItemTypeForClass(std::uint64_t cls) {
 std::optional<QRNContainerCache::SandboxMapping>
 QRNContainerCache::sandboxMappingFor(const QRNUserIdentity& userIdentity,
                                      const std::string& identifier, std::uint64_t cls,
-                                     const std::filesystem::path& url) {
+                                     const std::string& url) {
     const std::uint64_t itemType = sandboxItemTypeForClass(cls);
     if (itemType == 0) {
         if (!QRNContainerClass::isBundle(cls)) {
@@ -57,7 +57,7 @@ QRNContainerCache::sandboxMappingFor(const QRNUserIdentity& userIdentity,
     mapping.item.identifier = identifier;
     mapping.item.containerClass = cls;
     mapping.item.personaID = static_cast<std::int32_t>(userIdentity.kernelPersonaID());
-    mapping.item.path = url.string();
+    mapping.item.path = url;
     return mapping;
 }
 
@@ -103,7 +103,7 @@ int QRNContainerCache::setSandboxContainerMappingForUserIdentity(
     if (!userIdentity) {
         return EINVAL;
     }
-    auto mapping = sandboxMappingFor(*userIdentity, identifier, containerClass, url);
+    auto mapping = sandboxMappingFor(*userIdentity, identifier, containerClass, url.native());
     return mapping ? pushSandboxMapping(*mapping) : 0;
 }
 
@@ -113,25 +113,39 @@ bool QRNContainerCache::shouldRegisterSandboxMappingWithUserIdentity(
     return true;
 }
 
-int QRNContainerCache::_lock_mapContainer(Entry& entry, const QRNUserIdentity& userIdentity,
-                                          const QRNMetadata& metadata) {
+QRNContainerCache::SandboxMapping QRNContainerCache::pushedMapping(const Slot& slot) {
+    const QRNMetadata& pushed = *slot.pushed;
+    SandboxMapping mapping;
+    mapping.uid = slot.pushedUID;
+    mapping.item.itemType = sandboxItemTypeForClass(pushed.containerClass());
+    mapping.item.identifier = pushed.identifier();
+    mapping.item.containerClass = pushed.containerClass();
+    mapping.item.personaID = slot.pushedPersona;
+    mapping.item.path = pushed.urlString();
+    return mapping;
+}
+
+int QRNContainerCache::_lock_mapContainer(Slot& slot, const QRNUserIdentity& userIdentity) {
     _lock_assertOwned(__func__);
+    const QRNMetadata& metadata = *slot.record;
     auto mapping = sandboxMappingFor(userIdentity, metadata.identifier(), metadata.containerClass(),
-                                     metadata.url());
+                                     metadata.urlString());
     if (!mapping) {
         return 0;
     }
     if (int err = pushSandboxMapping(*mapping); err != 0) {
         return err;
     }
-    entry.pushed.insert_or_assign(metadata.identifier(), std::move(*mapping));
+    slot.pushed = slot.record;
+    slot.pushedUID = mapping->uid;
+    slot.pushedPersona = mapping->item.personaID;
     return 0;
 }
 
 void QRNContainerCache::_lock_populateSandbox(Entry& entry, const QRNUserIdentity& userIdentity) {
     _lock_assertOwned(__func__);
-    for (const auto& [identifier, metadata] : entry.containers) {
-        if (int err = _lock_mapContainer(entry, userIdentity, *metadata); err != 0) {
+    for (auto& [identifier, slot] : entry.containers) {
+        if (int err = _lock_mapContainer(slot, userIdentity); err != 0) {
             QRN_LOG_ERROR(LogCategory::Sandbox,
                           "Failed to set container mapping during create/lookup "
                           "operation of {}, "
@@ -142,13 +156,12 @@ void QRNContainerCache::_lock_populateSandbox(Entry& entry, const QRNUserIdentit
     entry.sandboxPopulated = true;
 }
 
-void QRNContainerCache::_lock_unmapContainer(Entry& entry, const QRNUserIdentity& userIdentity,
+void QRNContainerCache::_lock_unmapContainer(const Slot* slot, const QRNUserIdentity& userIdentity,
                                              std::uint64_t cls, const std::string& identifier) {
     _lock_assertOwned(__func__);
     std::optional<SandboxMapping> mapping;
-    if (auto pushed = entry.pushed.find(identifier); pushed != entry.pushed.end()) {
-        mapping = std::move(pushed->second);
-        entry.pushed.erase(pushed);
+    if (slot && slot->pushed) {
+        mapping = pushedMapping(*slot);
     } else {
         // Not pushed by this entry (it was not built, or was dropped since):
         // the sandbox may still hold one from an earlier push; the path is no

@@ -122,7 +122,24 @@ QRNContainerCache::_lock_find(const Entry& entry, const QRNContainerIdentity& id
     if (found == entry.containers.end()) {
         return nullptr;
     }
-    return uuidMatches(identity, *found->second) ? found->second : nullptr;
+    const MetadataPtr& record = found->second.record;
+    return uuidMatches(identity, *record) ? record : nullptr;
+}
+
+QRNContainerCache::Slot& QRNContainerCache::storeRecord(Entry& entry, MetadataPtr record) {
+    auto found = entry.containers.find(record->identifier());
+    if (found == entry.containers.end()) {
+        const std::string_view key = record->identifier();
+        Slot slot;
+        slot.record = std::move(record);
+        return entry.containers.emplace(key, std::move(slot)).first->second;
+    }
+    // The key views the old record's identifier: re-key before that record
+    // may go (a pushed slot keeps it).
+    auto node = entry.containers.extract(found);
+    node.mapped().record = std::move(record);
+    node.key() = node.mapped().record->identifier();
+    return entry.containers.insert(std::move(node)).position->second;
 }
 
 bool QRNContainerCache::uuidMatches(const QRNContainerIdentity& identity,
@@ -164,7 +181,7 @@ QRNContainerCache::containerForContainerIdentity(const QRNContainerIdentityPtr& 
                                         "Cache: {}{}: Container Not Found with ID: {}", key,
                                         transientSuffix(transient), identity->identifier()));
     }
-    if (metadata->url().empty()) {
+    if (metadata->urlString().empty()) {
         return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorInvalidCacheInput, "Cache: {}{}: nil URL from {}",
                                         key, transientSuffix(transient), identity->identifier()));
     }
@@ -188,8 +205,8 @@ QRNContainerCache::allContainersForUserIdentity(const QRNUserIdentityPtr& userId
     }
     std::vector<MetadataPtr> all;
     all.reserve((*entry)->containers.size());
-    for (const auto& [identifier, metadata] : (*entry)->containers) {
-        all.push_back(metadata);
+    for (const auto& [identifier, slot] : (*entry)->containers) {
+        all.push_back(slot.record);
     }
     return all;
 }
@@ -211,7 +228,7 @@ Status QRNContainerCache::addContainerMetadata(const MetadataPtr& metadata,
             QRN_ERROR(kQRNErrorInvalidCacheInput, "Invalid input: URL: {}", url.string()));
     }
     MetadataPtr record = metadata;
-    if (metadata->url() != url) {
+    if (metadata->urlString() != url.native()) {
         record =
             std::make_shared<const QRNMetadata>(metadata->containerIdentity(), metadata->info(),
                                                 url, metadata->userManagedAssetsDirName());
@@ -223,12 +240,12 @@ Status QRNContainerCache::addContainerMetadata(const MetadataPtr& metadata,
     if (!entry) {
         return QRN_UNEXPECTED(entry.error());
     }
-    (*entry)->containers.insert_or_assign(record->identifier(), record);
+    Slot& slot = storeRecord(**entry, record);
     QRN_LOG_INFO(LogCategory::Cache, "Cache: {}{}: Added Identifier: {}", cacheKey(*user, cls),
                  transientSuffix(transient), record->identifier());
     if (updateSandbox && !transient &&
         shouldRegisterSandboxMappingWithUserIdentity(user, record->identifier(), cls)) {
-        if (int err = _lock_mapContainer(**entry, *user, *record); err != 0) {
+        if (int err = _lock_mapContainer(slot, *user); err != 0) {
             QRN_LOG_ERROR(LogCategory::Sandbox, "Failed to set container mapping of {}, {}",
                           record->identifier(), err);
         }
@@ -251,16 +268,17 @@ Status QRNContainerCache::removeContainerForUserIdentity(const QRNUserIdentityPt
     const std::string key = cacheKey(*userIdentity, contentClass);
     Locker locked(*this);
     EntryMap& entries = transient ? transient_ : permanent_;
-    Entry unbuilt; // stands in when the entry is not built: nothing cached,
-                   // nothing recorded
-    auto found = entries.find(key);
-    Entry& entry = found == entries.end() ? unbuilt : found->second;
-    if (entry.containers.erase(identifier) != 0) {
-        QRN_LOG_INFO(LogCategory::Cache, "Cache: {}{}: Removed Identifier: {}", key,
-                     transientSuffix(transient), identifier);
+    std::optional<Slot> removed;
+    if (auto found = entries.find(key); found != entries.end()) {
+        if (auto node = found->second.containers.extract(identifier)) {
+            removed = std::move(node.mapped());
+            QRN_LOG_INFO(LogCategory::Cache, "Cache: {}{}: Removed Identifier: {}", key,
+                         transientSuffix(transient), identifier);
+        }
     }
     if (!transient) {
-        _lock_unmapContainer(entry, *userIdentity, contentClass, identifier);
+        _lock_unmapContainer(removed ? &*removed : nullptr, *userIdentity, contentClass,
+                             identifier);
     }
     return {};
 }
@@ -275,8 +293,11 @@ void QRNContainerCache::invalidateUserIdentity(const QRNUserIdentityPtr& userIde
         for (std::uint64_t cls = kQRNContainerClassAppBundle; cls < kQRNContainerClassMax; ++cls) {
             const std::string key = cacheKey(*userIdentity, cls);
             if (auto found = permanent_.find(key); found != permanent_.end()) {
-                for (const auto& [identifier, mapping] : found->second.pushed) {
-                    if (int err = pullSandboxMapping(mapping); err != 0) {
+                for (const auto& [identifier, slot] : found->second.containers) {
+                    if (!slot.pushed) {
+                        continue;
+                    }
+                    if (int err = pullSandboxMapping(pushedMapping(slot)); err != 0) {
                         QRN_LOG_ERROR(LogCategory::Sandbox,
                                       "Failed to remove container mapping of [{}], class: {}",
                                       identifier, cls);

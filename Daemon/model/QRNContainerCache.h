@@ -118,14 +118,24 @@ public:
     void setRebuildGate(RebuildGate gate);
 
 private:
-    // A mapping as it was pushed, so exactly it can be removed again.
+    // A mapping to push or remove.
     struct SandboxMapping {
         std::uint32_t uid = 0;
         SandboxItem item;
     };
+    // One container of an entry: its record and, once its mapping is pushed,
+    // the record and owner it was pushed with, so exactly that mapping can be
+    // removed again (the record is shared, not copied).
+    struct Slot {
+        MetadataPtr record;
+        MetadataPtr pushed;
+        std::uint32_t pushedUID = 0;
+        std::int32_t pushedPersona = 0;
+    };
     struct Entry {
-        std::map<std::string, MetadataPtr, std::less<>> containers; // by identifier
-        std::map<std::string, SandboxMapping, std::less<>> pushed;  // by identifier
+        // By identifier; each key views its slot's record's identifier, so a
+        // record is replaced together with its key (storeRecord).
+        std::map<std::string_view, Slot, std::less<>> containers;
         bool sandboxPopulated = false;
     };
     using EntryMap = std::unordered_map<std::string, Entry>;
@@ -154,6 +164,8 @@ private:
     Result<Entry*> _lock_entryFor(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
                                   bool transient, bool populateSandbox);
     MetadataPtr _lock_find(const Entry& entry, const QRNContainerIdentity& identity) const;
+    // Inserts or replaces the identifier's record; the slot of the record.
+    static Slot& storeRecord(Entry& entry, MetadataPtr record);
     // False only for a concrete identity whose UUID is not the record's.
     static bool uuidMatches(const QRNContainerIdentity& identity, const QRNMetadata& metadata);
 
@@ -163,6 +175,8 @@ private:
     Result<Entry> _lock_scanClassDirectory(const QRNUserIdentityPtr& userIdentity,
                                            std::uint64_t cls, bool transient, bool populateSandbox);
     void runRebuildGate(std::uint64_t cls);
+    // containerURL for an item's last component.
+    bool containerName(std::string_view name, std::uint64_t cls) const;
 
     // --- Sandbox (+Sandbox) ---
     // The mapping for a container of the class; none for classes that are
@@ -170,17 +184,20 @@ private:
     static std::optional<SandboxMapping> sandboxMappingFor(const QRNUserIdentity& userIdentity,
                                                            const std::string& identifier,
                                                            std::uint64_t cls,
-                                                           const std::filesystem::path& url);
+                                                           const std::string& url);
     static std::uint64_t sandboxItemTypeForClass(std::uint64_t cls);
     int pushSandboxMapping(const SandboxMapping& mapping);
     int pullSandboxMapping(const SandboxMapping& mapping);
-    // Pushes the container's mapping and remembers it in the entry; 0 or
-    // the sandbox's errno.
-    int _lock_mapContainer(Entry& entry, const QRNUserIdentity& userIdentity,
-                           const QRNMetadata& metadata);
+    // The mapping a slot's push made.
+    static SandboxMapping pushedMapping(const Slot& slot);
+    // Pushes the mapping of the slot's record and remembers it in the slot;
+    // 0 or the sandbox's errno.
+    int _lock_mapContainer(Slot& slot, const QRNUserIdentity& userIdentity);
     void _lock_populateSandbox(Entry& entry, const QRNUserIdentity& userIdentity);
-    void _lock_unmapContainer(Entry& entry, const QRNUserIdentity& userIdentity, std::uint64_t cls,
-                              const std::string& identifier);
+    // Removes the mapping of a slot taken out of its entry, or of a
+    // container the entry does not hold (`slot` null).
+    void _lock_unmapContainer(const Slot* slot, const QRNUserIdentity& userIdentity,
+                              std::uint64_t cls, const std::string& identifier);
     MetadataPtr _lock_containerFromKernelSandbox(const QRNContainerIdentity& identity);
     std::optional<SandboxItem> findKernelSandboxItem(std::uint32_t uid,
                                                      const SandboxMapping& wanted) const;

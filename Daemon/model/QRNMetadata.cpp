@@ -7,8 +7,7 @@
 namespace quarn {
 
 QRNMetadata::QRNMetadata(QRNConcreteContainerIdentityPtr containerIdentity, Value info,
-                         std::filesystem::path url,
-                         std::optional<std::string> userManagedAssetsDirName)
+                         std::string url, std::optional<std::string> userManagedAssetsDirName)
     : containerIdentity_(std::move(containerIdentity)), info_(std::move(info)),
       url_(std::move(url)), userManagedAssetsDirName_(std::move(userManagedAssetsDirName)) {}
 
@@ -64,7 +63,7 @@ std::string QRNMetadata::description() const {
                        "identifier = {}, info = {}, url = {}, userManagedAssetsDirName = {}>",
                        fmt::ptr(this), userIdentity()->description(), uuid().string(),
                        containerClass(), identifier(),
-                       info_.isNone() ? std::string("(null)") : info_.description(), url_.string(),
+                       info_.isNone() ? std::string("(null)") : info_.description(), url_,
                        userManagedAssetsDirName_.value_or("(null)"));
 }
 

@@ -34,9 +34,10 @@ public:
     static constexpr std::string_view kLegacyPersonaKey = "QRNMetadataPersona";
     static constexpr std::string_view kVersion = "2";
 
-    // `info` is a dictionary or none; `url` the container directory.
-    QRNMetadata(QRNConcreteContainerIdentityPtr containerIdentity, Value info,
-                std::filesystem::path url, std::optional<std::string> userManagedAssetsDirName);
+    // `info` is a dictionary or none; `url` the container directory (a path
+    // converts).
+    QRNMetadata(QRNConcreteContainerIdentityPtr containerIdentity, Value info, std::string url,
+                std::optional<std::string> userManagedAssetsDirName);
 
     // Writes the file at `url` (the metadata file's own URL) through a
     // temporary file in the staging directory of the record's user and
@@ -52,13 +53,30 @@ public:
     readAndValidateMetadataAtFileUrl(const std::filesystem::path& url,
                                      const QRNUserIdentityPtr& userIdentity, bool checkClassPath);
 
+    // What one run of reads (a class-directory scan) shares: files of one
+    // directory carry the same stored user identity, and turning it into an
+    // identity is much of a read. Kept for one run only, so the identity
+    // cache's answers stay current.
+    struct ReadMemo {
+        Value stored;
+        QRNUserIdentityPtr userIdentity;
+    };
+    // The same, for a path held as a string (no path object is built).
+    static CodeResult<QRNMetadataPtr>
+    readAndValidateMetadataAtFilePath(const std::string& path,
+                                      const QRNUserIdentityPtr& userIdentity, bool checkClassPath,
+                                      ReadMemo* memo);
+
     const QRNConcreteContainerIdentityPtr& containerIdentity() const { return containerIdentity_; }
     const QRNUserIdentityPtr& userIdentity() const { return containerIdentity_->userIdentity(); }
     const UUID& uuid() const { return containerIdentity_->uuid(); }
     std::uint64_t containerClass() const { return containerIdentity_->containerClass(); }
     const std::string& identifier() const { return containerIdentity_->identifier(); }
     const Value& info() const { return info_; }
-    const std::filesystem::path& url() const { return url_; }
+    // Kept as a string: a path object holds every component apart, several
+    // times the string's size in every cached record.
+    std::filesystem::path url() const { return url_; }
+    const std::string& urlString() const { return url_; }
     const std::optional<std::string>& userManagedAssetsDirName() const {
         return userManagedAssetsDirName_;
     }
@@ -70,7 +88,7 @@ public:
 private:
     QRNConcreteContainerIdentityPtr containerIdentity_;
     Value info_;
-    std::filesystem::path url_;
+    std::string url_;
     std::optional<std::string> userManagedAssetsDirName_;
 };
 

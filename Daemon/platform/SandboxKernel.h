@@ -4,12 +4,14 @@
 // The daemon pushes a mapping when a container becomes live and removes it
 // when the container goes; the launcher reads it back to confine a process.
 
+#include <compare>
 #include <cstdint>
 #include <functional>
 #include <map>
 #include <mutex>
+#include <set>
 #include <string>
-#include <tuple>
+#include <string_view>
 #include <vector>
 
 namespace quarn {
@@ -48,11 +50,39 @@ public:
     std::size_t count(std::uint32_t uid) const;
 
 private:
-    using Key = std::tuple<std::uint64_t, std::string, std::uint64_t, std::int32_t>;
-    static Key keyOf(const SandboxItem& item);
+    // What names a mapping, viewing a stored one or a caller's item.
+    struct KeyView {
+        std::uint64_t itemType;
+        std::string_view identifier;
+        std::uint64_t containerClass;
+        std::int32_t personaID;
+        friend auto operator<=>(const KeyView&, const KeyView&) = default;
+    };
+    // One mapping as held: the identifier and the path share one string,
+    // since a table of every container of the device is kept in memory.
+    struct Stored {
+        std::uint64_t itemType;
+        std::uint64_t containerClass;
+        std::int32_t personaID;
+        std::uint32_t identifierLength;
+        std::string text; // identifier, then path
+
+        KeyView key() const {
+            return {itemType, std::string_view(text).substr(0, identifierLength), containerClass,
+                    personaID};
+        }
+        SandboxItem item() const;
+    };
+    struct Less {
+        using is_transparent = void;
+        static KeyView view(const Stored& s) { return s.key(); }
+        static const KeyView& view(const KeyView& k) { return k; }
+        bool operator()(const auto& a, const auto& b) const { return view(a) < view(b); }
+    };
+    static KeyView keyOf(const SandboxItem& item);
 
     mutable std::mutex mutex_; // guards users_
-    std::map<std::uint32_t, std::map<Key, SandboxItem>> users_;
+    std::map<std::uint32_t, std::set<Stored, Less>> users_;
 };
 
 } // namespace quarn

@@ -260,6 +260,66 @@ Result<Value> fromNode(plist_t node, std::size_t depth) {
     }
 }
 
+Status checkNode(plist_t node, std::size_t depth);
+
+// Children walked with libplist's iterators: indexed access walks a list.
+Status checkArray(plist_t node, std::size_t depth) {
+    plist_array_iter raw = nullptr;
+    plist_array_new_iter(node, &raw);
+    MallocPtr<void> iter(raw);
+    for (;;) {
+        plist_t item = nullptr;
+        plist_array_next_item(node, iter.get(), &item);
+        if (!item) {
+            return {};
+        }
+        if (auto checked = checkNode(item, depth + 1); !checked) {
+            return checked;
+        }
+    }
+}
+
+Status checkDictionary(plist_t node, std::size_t depth) {
+    plist_dict_iter raw = nullptr;
+    plist_dict_new_iter(node, &raw);
+    MallocPtr<void> iter(raw);
+    for (;;) {
+        plist_t item = nullptr;
+        plist_dict_next_item(node, iter.get(), nullptr, &item);
+        if (!item) {
+            return {};
+        }
+        if (auto checked = checkNode(item, depth + 1); !checked) {
+            return checked;
+        }
+    }
+}
+
+// Fails exactly where fromNode fails, with the same errors.
+Status checkNode(plist_t node, std::size_t depth) {
+    if (!node || depth > kLimits.maxDepth) {
+        return QRN_UNEXPECTED(QRN_GENERAL_ERROR(kGeneralErrorPropertyListReadCorrupt,
+                                                "Property list missing a node or too deep"));
+    }
+    switch (plist_get_node_type(node)) {
+    case PLIST_ARRAY:
+        return checkArray(node, depth);
+    case PLIST_DICT:
+        return checkDictionary(node, depth);
+    case PLIST_BOOLEAN:
+    case PLIST_UINT:
+    case PLIST_REAL:
+    case PLIST_STRING:
+    case PLIST_KEY:
+    case PLIST_DATA:
+        return {};
+    default: {
+        auto scalar = scalarValue(node); // dates and the refused types
+        return scalar ? Status() : QRN_UNEXPECTED(scalar.error());
+    }
+    }
+}
+
 } // namespace
 
 Result<PropertyListPtr> propertyListFromValue(const Value& value) {
@@ -270,7 +330,11 @@ Result<Value> valueFromPropertyList(plist_t node) {
     return fromNode(node, 1);
 }
 
-Result<Value> valueFromPropertyListBytes(std::span<const std::uint8_t> bytes) {
+Status checkPropertyList(plist_t node) {
+    return checkNode(node, 1);
+}
+
+Result<PropertyListPtr> propertyListFromBytes(std::span<const std::uint8_t> bytes) {
     std::optional<std::string> problem;
     if (bytes.empty()) {
         problem = "no data";
@@ -292,8 +356,15 @@ Result<Value> valueFromPropertyListBytes(std::span<const std::uint8_t> bytes) {
             kGeneralErrorPropertyListReadCorrupt,
             "The data couldn't be read because it isn't in the correct format: {}", *problem));
     }
-    PropertyListPtr owned(root);
-    return fromNode(root, 1);
+    return PropertyListPtr(root);
+}
+
+Result<Value> valueFromPropertyListBytes(std::span<const std::uint8_t> bytes) {
+    auto root = propertyListFromBytes(bytes);
+    if (!root) {
+        return QRN_UNEXPECTED(root.error());
+    }
+    return fromNode(root->get(), 1);
 }
 
 Result<std::vector<std::uint8_t>> binaryPropertyList(const Value& value) {

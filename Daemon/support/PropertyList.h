@@ -45,9 +45,15 @@ using PropertyListPtr = std::unique_ptr<void, PropertyListDeleter>;
 
 Result<PropertyListPtr> propertyListFromValue(const Value& value);
 Result<Value> valueFromPropertyList(plist_t node);
+// The checks `valueFromPropertyList` makes, without building the Value: for
+// readers that keep only a few members of a large tree.
+Status checkPropertyList(plist_t node);
 
 // XML or binary. A pure function of the bytes; hostile input gives an error.
 Result<Value> valueFromPropertyListBytes(std::span<const std::uint8_t> bytes);
+// The bytes parsed by libplist once they have passed the hostile-input
+// checks; the tree is not yet checked as `checkPropertyList` does.
+Result<PropertyListPtr> propertyListFromBytes(std::span<const std::uint8_t> bytes);
 Result<std::vector<std::uint8_t>> binaryPropertyList(const Value& value);
 
 struct WriteOptions {
@@ -70,6 +76,10 @@ Status QRN_writeToURL(const Value& dictionary, const std::filesystem::path& url,
 // final path component must not be a symbolic link (ELOOP). A top-level
 // object that is not a dictionary fails with kGeneralErrorFileReadCorrupt.
 Result<Value> QRN_dictionaryWithContentsOfURL(const std::filesystem::path& url);
+// The same file, checks and errors, kept as libplist's tree: a reader that
+// looks at a few keys need not build a Value of the whole file. The path is
+// taken as a string, so a reader of many files builds no path objects.
+Result<PropertyListPtr> QRN_dictionaryNodeWithContentsOfFile(const std::string& path);
 
 // True when a component of `path` is exactly "..".
 bool containsDotDotPathComponents(std::string_view path);

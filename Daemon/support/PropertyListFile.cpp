@@ -118,7 +118,7 @@ Status writeAtomically(std::span<const std::uint8_t> bytes, const std::filesyste
     return {};
 }
 
-Result<std::vector<std::uint8_t>> readFile(const std::filesystem::path& url) {
+Result<std::vector<std::uint8_t>> readFile(const std::string& url) {
     Descriptor fd(::open(url.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
     struct stat st;
     int err = !fd.valid() || fstat(fd.get(), &st) != 0 ? errno : 0;
@@ -143,8 +143,7 @@ Result<std::vector<std::uint8_t>> readFile(const std::filesystem::path& url) {
         err = EFBIG;
     }
     if (err) {
-        return QRN_UNEXPECTED(
-            QRN_POSIX_ERROR(err, "Failed to read {}: {}", url.string(), strerror(err)));
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "Failed to read {}: {}", url, strerror(err)));
     }
     bytes.resize(filled);
     return bytes;
@@ -186,6 +185,29 @@ Result<Value> QRN_dictionaryWithContentsOfURL(const std::filesystem::path& url) 
                                           __PRETTY_FUNCTION__, __LINE__));
     }
     return value;
+}
+
+Result<PropertyListPtr> QRN_dictionaryNodeWithContentsOfFile(const std::string& path) {
+    auto bytes = readFile(path);
+    if (!bytes) {
+        return QRN_UNEXPECTED(bytes.error());
+    }
+    auto root = propertyListFromBytes(*bytes);
+    if (!root) {
+        return root;
+    }
+    if (auto checked = checkPropertyList(root->get()); !checked) {
+        return QRN_UNEXPECTED(checked.error());
+    }
+    if (plist_get_node_type(root->get()) != PLIST_DICT) {
+        auto value = valueFromPropertyList(root->get()); // checked: only for its kind's name
+        return QRN_UNEXPECTED(Error::make(Error::Domain::General, kGeneralErrorFileReadCorrupt,
+                                          fmt::format("The property list at {} holds a {}, "
+                                                      "not a dictionary",
+                                                      path, value->kindName()),
+                                          __PRETTY_FUNCTION__, __LINE__));
+    }
+    return root;
 }
 
 bool containsDotDotPathComponents(std::string_view path) {

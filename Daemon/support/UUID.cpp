@@ -11,16 +11,47 @@ UUID UUID::random() {
     return UUID(b);
 }
 
+namespace {
+
+int hexDigit(char c) {
+    if (c >= '0' && c <= '9') {
+        return c - '0';
+    }
+    if (c >= 'a' && c <= 'f') {
+        return c - 'a' + 10;
+    }
+    if (c >= 'A' && c <= 'F') {
+        return c - 'A' + 10;
+    }
+    return -1;
+}
+
+} // namespace
+
+// The canonical 8-4-4-4-12 form in either case, as libuuid accepts it; read
+// by hand since every container name and metadata file is parsed on a
+// cache rebuild and libuuid converts each byte through strtoul.
 std::optional<UUID> UUID::parse(std::string_view text) {
     if (text.size() != 36) {
         return std::nullopt;
     }
-    char buf[37];
-    std::memcpy(buf, text.data(), 36);
-    buf[36] = '\0';
     Bytes b;
-    if (uuid_parse(buf, b.data()) != 0) {
-        return std::nullopt;
+    std::size_t out = 0;
+    for (std::size_t i = 0; i < text.size();) {
+        if (i == 8 || i == 13 || i == 18 || i == 23) {
+            if (text[i] != '-') {
+                return std::nullopt;
+            }
+            ++i;
+            continue;
+        }
+        const int high = hexDigit(text[i]);
+        const int low = hexDigit(text[i + 1]);
+        if (high < 0 || low < 0) {
+            return std::nullopt;
+        }
+        b[out++] = static_cast<std::uint8_t>(high << 4 | low);
+        i += 2;
     }
     return UUID(b);
 }

@@ -197,7 +197,57 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
     EXPECT_TRUE(beyond.error().isQRN(kQRNErrorInvalidCacheInput));
 }
 
+// Files of one directory share the work of reading their stored user
+// identity; a file that stores another user's is still refused wherever it
+// comes in the listing.
+TEST_F(QRNContainerCacheTest, EachFilesStoredUserIdentityIsChecked) {
+    auto other = guest();
+    ASSERT_TRUE(other);
+    Ids expected;
+    for (int i = 0; i < 4; ++i) {
+        expected.push_back(fmt::format("com.example.mine{}", i));
+        makeContainer(kQRNContainerClassAppData, expected.back());
+        const UUID uuid = UUID::random();
+        const auto url = classDirectory(kQRNContainerClassAppData) / uuid.string();
+        std::filesystem::create_directories(url);
+        auto theirs = QRNConcreteContainerIdentity::containerIdentityWithUUID(
+            uuid, other, fmt::format("com.example.theirs{}", i), kQRNContainerClassAppData);
+        ASSERT_TRUE(QRNMetadata(*theirs, Value(), url, std::nullopt)
+                        .writeMetadataToFileURL(url / QRNMetadata::kFileName));
+    }
+    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), expected);
+    EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
+}
+
 // --- The kernel sandbox mapping -------------------------------------------------------------
+
+// A replaced record takes its key with it: lookups and the removal of the
+// mapping pushed for the old record still work once only the cache holds it.
+TEST_F(QRNContainerCacheTest, AReplacedRecordKeepsItsSlotConsistent) {
+    const std::string id = "com.example.replaced";
+    auto first = makeContainer(kQRNContainerClassAppData, id);
+    ASSERT_TRUE(cache().addContainerMetadata(first, first->url(), false, true));
+    const auto firstURL = first->url();
+    first.reset();
+    auto second = makeContainer(kQRNContainerClassAppData, id);
+    ASSERT_TRUE(cache().addContainerMetadata(second, second->url(), false, false));
+    const auto secondURL = second->url();
+    second.reset();
+
+    auto found = cache().containerForContainerIdentity(identity(kQRNContainerClassAppData, id));
+    ASSERT_TRUE(found);
+    EXPECT_EQ((*found)->url(), secondURL);
+    found = {};
+    // The mapping is still the one pushed for the first record.
+    auto items = mapped(501);
+    ASSERT_EQ(items.size(), 1u);
+    EXPECT_EQ(items[0].path, firstURL.native());
+
+    ASSERT_TRUE(
+        cache().removeContainerForUserIdentity(mobile(), kQRNContainerClassAppData, id, false));
+    EXPECT_TRUE(mapped(501).empty());
+    EXPECT_FALSE(log_.contains("Failed to remove container mapping")) << log_.all();
+}
 
 TEST_F(QRNContainerCacheTest, AddingAndRemovingKeepsTheSandboxMappingInStep) {
     struct Case {

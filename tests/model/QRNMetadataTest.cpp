@@ -195,6 +195,42 @@ TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
     }
 }
 
+// The reader looks at a few keys of the file's tree but refuses what a full
+// conversion refuses, and of a key given twice takes the last value.
+TEST_F(QRNMetadataTest, ReadingFromTheTreeKeepsTheFullChecks) {
+    const UUID uuid = UUID::random();
+    auto dir = containerDir(mobile(), 2, uuid);
+    auto url = dir / QRNMetadata::kFileName;
+    auto node = propertyListFromValue(record(mobile(), 2, uuid, dir).dictionary());
+    ASSERT_TRUE(node);
+    char* raw = nullptr;
+    std::uint32_t length = 0;
+    plist_to_xml(node->get(), &raw, &length);
+    const std::string xml(raw, length);
+    plist_to_xml_free(raw);
+    const auto withExtra = [&](const std::string& entries) {
+        std::string text = xml;
+        text.insert(text.rfind("</dict>"), entries);
+        std::ofstream(url, std::ios::trunc) << text;
+    };
+
+    withExtra("<key>QRNMetadataIdentifier</key><string>com.example.later</string>");
+    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), true);
+    ASSERT_TRUE(read);
+    EXPECT_EQ((*read)->identifier(), "com.example.later");
+    EXPECT_EQ((*read)->url(), dir);
+    EXPECT_EQ((*read)->urlString(), dir.native());
+
+    // A keyed-archive UID under a key the reader never looks at.
+    plist_dict_set_item(node->get(), "Other", plist_new_uid(1));
+    raw = nullptr;
+    plist_to_bin(node->get(), &raw, &length);
+    ASSERT_NE(raw, nullptr);
+    std::ofstream(url, std::ios::binary | std::ios::trunc).write(raw, length);
+    plist_to_bin_free(raw);
+    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+}
+
 TEST_F(QRNMetadataTest, UnreadableFilesGiveCode12) {
     LogCapture log;
     auto dir = containerDir(mobile(), 2, UUID::random());

@@ -36,6 +36,8 @@ protected:
         std::ifstream in(p, std::ios::binary);
         return std::string(std::istreambuf_iterator<char>(in), {});
     }
+    // Reads the file both ways: the same refusal (true), or the same dictionary.
+    bool refusedBoth(const std::string& name) const;
     void write(const fs::path& p, std::string_view text) const {
         std::ofstream(p, std::ios::binary) << text;
     }
@@ -135,6 +137,58 @@ TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
     write(dir_ / "xml.plist", "<plist><dict><key>Class</key><integer>2</integer>"
                               "<key>QRNMetadataVersion</key><string>2</string></dict></plist>");
     EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / "xml.plist").value_or(Value()), dict_);
+}
+
+// The tree reader refuses exactly what the Value reader refuses, with the
+// same error, and hands back the dictionary's nodes otherwise.
+TEST_F(PropertyListFileTest, TreeReadingRefusesWhatValueReadingRefuses) {
+    struct File {
+        const char* name;
+        std::string text;
+        bool refused;
+    };
+    const std::vector<File> files = {
+        {"array", "<plist><array><integer>1</integer></array></plist>", true},
+        {"junk", "bplist00garbage", true},
+        {"good",
+         "<plist><dict><key>Class</key><integer>2</integer><key>QRNMetadataVersion</key>"
+         "<string>2</string><key>When</key><date>2020-01-01T00:00:00Z</date></dict></plist>",
+         false},
+    };
+    for (const auto& file : files) {
+        SCOPED_TRACE(file.name);
+        write(dir_ / file.name, file.text);
+        EXPECT_EQ(refusedBoth(file.name), file.refused);
+    }
+    // A keyed-archive UID nested in an array of the dictionary.
+    PropertyListPtr uid(plist_new_dict());
+    plist_t array = plist_new_array();
+    plist_array_append_item(array, plist_new_uid(1));
+    plist_dict_set_item(uid.get(), "A", array);
+    char* bin = nullptr;
+    std::uint32_t length = 0;
+    plist_to_bin(uid.get(), &bin, &length);
+    write(dir_ / "uid", std::string_view(bin, length));
+    plist_to_bin_free(bin);
+    EXPECT_TRUE(refusedBoth("uid"));
+    auto missing = QRN_dictionaryNodeWithContentsOfFile((dir_ / "missing").native());
+    ASSERT_FALSE(missing);
+    EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
+}
+
+bool PropertyListFileTest::refusedBoth(const std::string& name) const {
+    auto value = QRN_dictionaryWithContentsOfURL(dir_ / name);
+    auto tree = QRN_dictionaryNodeWithContentsOfFile((dir_ / name).native());
+    EXPECT_EQ(bool(value), bool(tree));
+    if (!value || !tree) {
+        EXPECT_TRUE(!value && !tree && tree.error().domain == value.error().domain &&
+                    tree.error().code == value.error().code &&
+                    tree.error().message == value.error().message);
+        return !value && !tree;
+    }
+    EXPECT_TRUE(checkPropertyList(tree->get()));
+    EXPECT_EQ(valueFromPropertyList(tree->get()).value_or(Value()), *value);
+    return false;
 }
 
 TEST(PropertyListPaths, DotDotOnlyAsAWholeComponent) {
