@@ -15,6 +15,9 @@ namespace quarn {
 
 class CborCodec {
 public:
+    static constexpr std::uint64_t kTagDate = 1;
+    static constexpr std::uint64_t kTagUUID = 37;
+
     struct Limits {
         std::size_t maxBytes = 1024 * 1024;
         std::size_t maxNesting = 32; // arrays and maps inside each other

@@ -9,8 +9,6 @@ namespace quarn {
 
 namespace {
 
-constexpr std::uint64_t kTagDate = 1;
-constexpr std::uint64_t kTagUUID = 37;
 // Seconds whose microseconds still fit a signed 64-bit count.
 constexpr double kMaxDateSeconds = 9.2e12;
 
@@ -161,9 +159,9 @@ void CborDecoder::beginTag(std::uint64_t tag) {
     if (nextIsKey()) {
         return fail("a map key is tagged, not plain text");
     }
-    if (tag == kTagDate) {
+    if (tag == CborCodec::kTagDate) {
         tag_ = Tag::Date;
-    } else if (tag == kTagUUID) {
+    } else if (tag == CborCodec::kTagUUID) {
         tag_ = Tag::UUID;
     } else {
         fail(fmt::format("tag {} is not supported", tag));

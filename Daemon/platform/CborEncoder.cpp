@@ -1,5 +1,7 @@
 #include "Daemon/platform/CborEncoder.h"
 
+#include "Daemon/platform/CborCodec.h"
+
 #include <cbor.h>
 
 namespace quarn {
@@ -8,8 +10,6 @@ namespace {
 
 // The longest head libcbor writes: one initial byte and eight argument bytes.
 constexpr std::size_t kMaxHead = 9;
-constexpr std::uint64_t kTagDate = 1;
-constexpr std::uint64_t kTagUUID = 37;
 
 // Runs one libcbor encoder on room for a head at the end of `out`.
 template <class Encode> void put(std::vector<std::uint8_t>& out, Encode encode) {
@@ -80,11 +80,11 @@ void CborEncoder::append(const Value& value, std::vector<std::uint8_t>& out) {
         putByteString(out, *value.asData());
         return;
     case Value::Kind::Date:
-        putTag(out, kTagDate);
+        putTag(out, CborCodec::kTagDate);
         putDouble(out, value.asDate()->seconds());
         return;
     case Value::Kind::UUID:
-        putTag(out, kTagUUID);
+        putTag(out, CborCodec::kTagUUID);
         putByteString(out, value.asUUID()->bytes());
         return;
     case Value::Kind::Array:

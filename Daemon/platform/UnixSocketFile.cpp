@@ -18,7 +18,7 @@ namespace quarn {
 
 namespace {
 
-constexpr mode_t kDirectoryMode = 0755;
+constexpr mode_t kSocketDirectoryMode = 0755;
 constexpr mode_t kSocketMode = 0666;
 
 Error posixError(int err, std::string_view what, const std::filesystem::path& path) {
@@ -42,14 +42,14 @@ Status UnixSocketFile::makeParent(const std::filesystem::path& directory) {
         missing.push_back(at);
     }
     for (auto it = missing.rbegin(); it != missing.rend(); ++it) {
-        if (::mkdir(it->c_str(), kDirectoryMode) != 0) {
+        if (::mkdir(it->c_str(), kSocketDirectoryMode) != 0) {
             if (errno == EEXIST) {
                 continue;
             }
             return QRN_UNEXPECTED(posixError(errno, "cannot make", *it));
         }
         // Whatever the umask, clients must reach the socket inside.
-        if (::chmod(it->c_str(), kDirectoryMode) != 0) {
+        if (::chmod(it->c_str(), kSocketDirectoryMode) != 0) {
             return QRN_UNEXPECTED(posixError(errno, "cannot open up", *it));
         }
     }
