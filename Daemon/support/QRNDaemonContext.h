@@ -11,6 +11,9 @@
 // default constructor). Abstract types (platform interfaces) must have been
 // installed before they are asked for.
 
+#include <array>
+#include <atomic>
+#include <cstddef>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -38,6 +41,7 @@ public:
 
     template <class T> void install(std::shared_ptr<T> instance) {
         std::lock_guard guard(mutex_);
+        publish<T>(instance.get());
         instances_[std::type_index(typeid(T))] = std::move(instance);
     }
 
@@ -46,7 +50,17 @@ public:
         return instances_.count(std::type_index(typeid(T))) != 0;
     }
 
-    template <class T> T& instance() { return *sharedInstance<T>(); }
+    // Without a lock once the instance exists: a request asks for the same
+    // few instances many times, from every worker thread at once.
+    template <class T> T& instance() {
+        const std::size_t slot = slotOf<T>();
+        if (slot < kFastSlots) {
+            if (void* known = fast_[slot].load(std::memory_order_acquire)) {
+                return *static_cast<T*>(known);
+            }
+        }
+        return *sharedInstance<T>();
+    }
 
     template <class T> std::shared_ptr<T> sharedInstance() {
         // Recursive: making one instance may ask for the instances it needs.
@@ -65,15 +79,35 @@ public:
         } else {
             made = std::make_shared<T>();
         }
+        publish<T>(made.get());
         instances_[key] = made;
         return made;
     }
 
 private:
+    static constexpr std::size_t kFastSlots = 64;
+
+    // A small number per type, the same in every context; types past the
+    // fast slots are only found through the map.
+    static std::size_t nextSlot();
+    template <class T> static std::size_t slotOf() {
+        static const std::size_t slot = nextSlot();
+        return slot;
+    }
+    // With mutex_ held; the map keeps the instance alive.
+    template <class T> void publish(T* instance) {
+        if (const std::size_t slot = slotOf<T>(); slot < kFastSlots) {
+            fast_[slot].store(instance, std::memory_order_release);
+        }
+    }
+
     std::filesystem::path rootPrefix_;
     // Guards instances_; recursive because constructors ask for their dependencies.
     mutable std::recursive_mutex mutex_;
     std::unordered_map<std::type_index, std::shared_ptr<void>> instances_;
+    // Raw pointers to the instances of instances_, by slot; written with
+    // mutex_ held, read without it.
+    std::array<std::atomic<void*>, kFastSlots> fast_{};
 };
 
 } // namespace quarn
