@@ -14,8 +14,6 @@
 #include "Daemon/platform/ContainerLibrary.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"
 #include "Daemon/support/Log.h"
-#include "Daemon/support/PropertyList.h"
-#include "Daemon/support/ProtectionClassAttribute.h"
 #include "Daemon/support/QRNDaemonContext.h"
 #include "Daemon/support/UUID.h"
 
@@ -51,30 +49,6 @@ uid_t subdirectoryOwnerForClass(std::uint64_t cls, const QRNMetadata& metadata) 
         return kSystemSubdirectoryOwner;
     }
     return metadata.userIdentity()->posixUIDForContainerClass(cls);
-}
-
-// A new container has no metadata file that a failed write could spoil:
-// the file is made in place, and the container appears (by the move of the
-// whole staging directory) only once the file is complete.
-Status writeNewMetadata(const EnvFd& container, const std::filesystem::path& containerURL,
-                        const QRNMetadata& metadata) {
-    const Value dict = metadata.dictionary();
-    auto bytes = binaryPropertyList(dict);
-    Status written = bytes ? QRNFileManager::defaultManager().createFileInDirectory(
-                                 container, containerURL, std::string(QRNMetadata::kFileName),
-                                 *bytes, ProtectionClassAttribute::kLowestClass)
-                           : Status(QRN_UNEXPECTED(bytes.error()));
-    const std::filesystem::path url = containerURL / QRNMetadata::kFileName;
-    if (!written) {
-        const Error& e = written.error();
-        return QRN_UNEXPECTED(
-            QRN_ERROR_UNDERLYING(e, kQRNErrorWriteStateFileFailed,
-                                 "Failed to write metadata dictionary to URL {} : {}:{}",
-                                 url.string(), e.domainName(), e.code));
-    }
-    QRN_LOG_DEBUG(LogCategory::Metadata, "[{}] Writing metadata to [{}]: {} => {}", __func__,
-                  url.string(), metadata.description(), dict.description());
-    return {};
 }
 
 // An open directory and its path relative to the container.
@@ -134,7 +108,8 @@ QRNClientConnection::_buildInStaging(const QRNContainerIdentity& identity, const
         return QRN_CODE(concrete.error());
     }
     auto metadata = std::make_shared<const QRNMetadata>(*concrete, Value(), *staging, std::nullopt);
-    if (auto written = writeNewMetadata(*made, *staging, *metadata); !written) {
+    if (auto written = metadata->writeMetadataToFileURL(*staging / QRNMetadata::kFileName);
+        !written) {
         return QRN_CODE(written.error().qrnCode(kQRNErrorWriteStateFileFailed));
     }
     if (QRNContainerClass::isSystem(cls)) {

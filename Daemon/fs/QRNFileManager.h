@@ -27,7 +27,6 @@
 #include <functional>
 #include <memory>
 #include <optional>
-#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -113,14 +112,6 @@ public:
                                                     const std::filesystem::path& parentURL,
                                                     const std::filesystem::path& relative,
                                                     mode_t mode, uid_t owner, int protectionClass);
-
-    // A new file `name` (a plain name; an existing item is an error) in the
-    // open `directory` (at `directoryURL`, for messages), holding `bytes`,
-    // with the protection class (or kProtectionClassUnchanged). A file that
-    // could not be written whole is removed again.
-    Status createFileInDirectory(const EnvFd& directory, const std::filesystem::path& directoryURL,
-                                 const std::string& name, std::span<const std::uint8_t> bytes,
-                                 int protectionClass);
 
     Status moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst);
     Status moveItemIfExistsAtURL(const std::filesystem::path& src,

@@ -70,16 +70,13 @@ TEST_F(CreateOrLookupFailureTest, EachLaterStepFailsWithItsCodeAndParksTheStagin
         std::uint64_t code;
         const char* message;
     };
-    // The metadata file is written in the new container, which is then
-    // moved into place with the one rename.
+    // Renames: the metadata file into the container, then the container into place.
     const Case cases[] = {
-        {"metadata", EnvCall::Write, 1, kQRNErrorWriteStateFileFailed,
-         "Failed to write metadata dictionary to URL"},
-        {"metadata class", EnvCall::SetXattr, 2, kQRNErrorWriteStateFileFailed,
-         "Failed to write metadata dictionary to URL"},
+        {"metadata", EnvCall::Rename, 1, kQRNErrorWriteStateFileFailed,
+         "Failed to move metadata from staging"},
         {"subdirectory", EnvCall::Mkdir, 2, kQRNErrorCreateDirFailed,
          "Failed to create sub-dir for"},
-        {"move into place", EnvCall::Rename, 1, kQRNErrorMoveStagingToLiveFailed,
+        {"move into place", EnvCall::Rename, 2, kQRNErrorMoveStagingToLiveFailed,
          "Failed to move staging dir:"},
     };
     for (const Case& c : cases) {
@@ -101,7 +98,7 @@ TEST_F(CreateOrLookupFailureTest, EachLaterStepFailsWithItsCodeAndParksTheStagin
 
 TEST_F(CreateOrLookupFailureTest, StagingThatCannotBeParkedIsReported) {
     // The move into place and the move to death row both fail.
-    env_->failCallsFrom(EnvCall::Rename, 1, EIO);
+    env_->failCallsFrom(EnvCall::Rename, 2, EIO);
     LogCapture log;
     EXPECT_EQ(createCode(), kQRNErrorRemoveStagingFailed);
     EXPECT_TRUE(log.contains("Failed to remove staging dir:")) << log.all();
@@ -126,7 +123,7 @@ TEST_F(CreateOrLookupFailureTest, OldTransientContainerThatCannotBeRemovedStopsT
 TEST_F(CreateOrLookupFailureTest, CacheThatRefusesTheNewContainerLeavesItInPlace) {
     // Just before the container moves into place its cache entry is dropped
     // and the class directory can no longer be listed, so inserting fails.
-    const std::uint64_t moveIntoPlace = env_->count(EnvCall::Rename) + 1;
+    const std::uint64_t moveIntoPlace = env_->count(EnvCall::Rename) + 2;
     env_->setHook([this, moveIntoPlace](EnvCall call, std::uint64_t number) {
         if (call == EnvCall::Rename && number == moveIntoPlace) {
             QRNContainerCache::sharedInstance().invalidateUserIdentity(user());
