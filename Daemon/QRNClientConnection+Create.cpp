@@ -4,7 +4,7 @@
 
 #include "Daemon/QRNClientConnection.h"
 
-#include "Daemon/QRNLocks.h"
+#include "Daemon/QRNGlobalIdentifierLock.h"
 #include "Daemon/QRNOperationGuard.h"
 #include "Daemon/codesigning/QRNCodeSigningMapping.h"
 #include "Daemon/fs/QRNFileManager.h"
@@ -25,21 +25,6 @@ namespace quarn {
 
 namespace {
 
-// The global identifier lock, read or write, for one scope.
-class GlobalLockHold {
-public:
-    explicit GlobalLockHold(bool writing) {
-        if (writing) {
-            write_lock_all_identifiers();
-        } else {
-            read_lock_all_identifiers();
-        }
-    }
-    ~GlobalLockHold() { unlock_all_identifiers(); }
-    GlobalLockHold(const GlobalLockHold&) = delete;
-    GlobalLockHold& operator=(const GlobalLockHold&) = delete;
-};
-
 bool isNotFound(const Error& error) {
     return error.isQRN(kQRNErrorContainerNotFound);
 }
@@ -52,7 +37,7 @@ struct QRNClientConnection::CreateAttempt {
     // into place: while set, a failure sends it to death row.
     std::optional<std::filesystem::path> stagingURL;
     // The global write lock, when this call took it; held to the end.
-    std::optional<GlobalLockHold> globalLock;
+    std::optional<QRNGlobalIdentifierLock> globalLock;
 };
 
 CodeResult<QRNMetadataPtr> QRNClientConnection::createOrLookupContainerWithContainerIdentity(
@@ -110,7 +95,7 @@ QRNClientConnection::_createOrLookup(const QRNContainerIdentityPtr& identity,
         return QRN_CODE(kQRNErrorContainerNotFound);
     }
     if (useLocking) {
-        attempt.globalLock.emplace(true);
+        attempt.globalLock.emplace(QRNGlobalIdentifierLock::Mode::Write);
     }
     // Another request may have made it between the two locks.
     auto found = _lookupUnderWriteLock(identity, transient);
@@ -161,9 +146,9 @@ QRNClientConnection::_checkSystemContainerAccess(const QRNContainerIdentity& ide
 CodeResult<QRNMetadataPtr>
 QRNClientConnection::_lookupUnderReadLock(const QRNContainerIdentityPtr& identity,
                                           bool useLocking) {
-    std::optional<GlobalLockHold> readLock;
+    std::optional<QRNGlobalIdentifierLock> readLock;
     if (useLocking) {
-        readLock.emplace(false);
+        readLock.emplace(QRNGlobalIdentifierLock::Mode::Read);
     }
     // The kernel asks on behalf of the sandbox: its own mapping cannot answer it.
     const bool isKernel = clientIdentity_ && clientIdentity_->isKernel();

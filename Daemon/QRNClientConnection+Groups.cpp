@@ -3,7 +3,7 @@
 
 #include "Daemon/QRNClientConnection.h"
 
-#include "Daemon/QRNLocks.h"
+#include "Daemon/QRNGlobalIdentifierLock.h"
 #include "Daemon/QRNOperationGuard.h"
 #include "Daemon/codesigning/QRNGroupManager.h"
 #include "Daemon/model/QRNMetadata.h"
@@ -26,15 +26,6 @@ public:
 
 private:
     Value owner_;
-};
-
-// The global write lock for one scope.
-class GlobalWriteHold {
-public:
-    GlobalWriteHold() { write_lock_all_identifiers(); }
-    ~GlobalWriteHold() { unlock_all_identifiers(); }
-    GlobalWriteHold(const GlobalWriteHold&) = delete;
-    GlobalWriteHold& operator=(const GlobalWriteHold&) = delete;
 };
 
 } // namespace
@@ -73,7 +64,7 @@ QRNClientConnection::groupContainersForOwnerIdentifier(const std::string& owner,
         setAllowGroupIdLookup(true);
         // The lookups below take no lock of their own: without this one, two
         // requests reaching the same new group would each create it.
-        GlobalWriteHold globalLock;
+        QRNGlobalIdentifierLock globalLock(QRNGlobalIdentifierLock::Mode::Write);
         auto groups =
             groupContainerIdentifiersForOwnerIdentifier(owner, groupContainerClass, false);
         if (!groups) {

@@ -1,6 +1,6 @@
 #include "Daemon/QRNCommandStageForDelete.h"
 
-#include "Daemon/QRNLocks.h"
+#include "Daemon/QRNGlobalIdentifierLock.h"
 #include "Daemon/codesigning/QRNCodeSigningMapping.h"
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNConcreteContainerIdentity.h"
@@ -17,15 +17,6 @@
 namespace quarn {
 
 namespace {
-
-// The global write lock for the whole command.
-class GlobalWriteLock {
-public:
-    GlobalWriteLock() { write_lock_all_identifiers(); }
-    ~GlobalWriteLock() { unlock_all_identifiers(); }
-    GlobalWriteLock(const GlobalWriteLock&) = delete;
-    GlobalWriteLock& operator=(const GlobalWriteLock&) = delete;
-};
 
 std::filesystem::path lastComponent(const std::filesystem::path& url) {
     return url.has_filename() ? url.filename() : url.parent_path().filename();
@@ -49,9 +40,10 @@ bool QRNCommandStageForDelete::fromQueue(const std::weak_ptr<QRNCommandQueue>& q
                                          std::uint64_t& error) {
     Status staged;
     try {
-        std::optional<GlobalWriteLock> lock;
+        // The global write lock for the whole command.
+        std::optional<QRNGlobalIdentifierLock> lock;
         if (useLocking_) {
-            lock.emplace();
+            lock.emplace(QRNGlobalIdentifierLock::Mode::Write);
         }
         staged = stageAll(queue.lock());
     } catch (const std::exception& exception) {

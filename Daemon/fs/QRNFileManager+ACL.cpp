@@ -5,6 +5,7 @@
 // device path, so not taken below the root prefix): libacl sets default ACLs
 // only by path, and this path cannot be swapped for a link under us.
 
+#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/fs/SystemUserACL.h"
@@ -25,7 +26,6 @@ namespace {
 namespace fs = std::filesystem;
 using Entry = QRNFileManager::TraversalEntry;
 
-constexpr std::string_view kMetadataFileName = ".com.orvex.quarn_store.metadata.plist";
 // Below the top of a system container everything belongs to "nobody", so
 // access is granted through the list only.
 constexpr uid_t kNobody = 65534;
@@ -137,7 +137,7 @@ Status QRNFileManager::standardizeACLsAtURL(const fs::path& url, bool isSystemCo
     // entry does not leave the rest of the tree unconverted.
     return _traverseDirectory(url, [&](const Entry& entry) -> Status {
         if (entry.kind == Entry::Kind::DirectoryPostOrder ||
-            entry.path.string().find(kMetadataFileName) != std::string::npos) {
+            entry.path.string().find(DirectoryEntryName::kMetadataFile) != std::string::npos) {
             return {};
         }
         const bool topLevel = isSystemContainer && entry.level == 0;

@@ -2,6 +2,7 @@
 
 #include "Daemon/fs/QRNFileManager.h"
 
+#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/Env.h"
 
 #include <cerrno>
@@ -13,8 +14,6 @@ namespace quarn {
 namespace {
 
 using Entry = QRNFileManager::TraversalEntry;
-
-constexpr std::string_view kMetadataFileName = ".com.orvex.quarn_store.metadata.plist";
 
 mode_t standardModeFor(const struct stat& st) {
     return S_ISDIR(st.st_mode) || (st.st_mode & 0111) != 0 ? 0755 : 0644;
@@ -54,7 +53,7 @@ Status QRNFileManager::standardizeOwnershipAtURL(const std::filesystem::path& ur
     // rest of the tree with the wrong owner.
     return _traverseDirectory(url, [&](const Entry& entry) -> Status {
         if (entry.kind != Entry::Kind::DirectoryPostOrder &&
-            entry.path.string().find(kMetadataFileName) == std::string::npos) {
+            entry.path.string().find(DirectoryEntryName::kMetadataFile) == std::string::npos) {
             standardizeEntry(*env_, entry, uid, gid);
         }
         return {};

@@ -1,5 +1,6 @@
 #include "Daemon/fs/TreeCopier.h"
 
+#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 
 #include <cerrno>
@@ -13,10 +14,6 @@ namespace quarn {
 namespace {
 
 constexpr int kReadFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK;
-
-bool isDot(const char* name) {
-    return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
-}
 
 // The destination cannot hold this (kind of) data: not a reason to fail.
 bool unsupported(int err) {
@@ -114,7 +111,7 @@ int TreeCopier::copyChildren(int srcFd, int dstFd) {
             break;
         }
         const char* name = (*entry)->d_name;
-        if (isDot(name)) {
+        if (DirectoryEntryName::isDot(name)) {
             continue;
         }
         if (int err = copyEntry(srcFd, name, dstFd, name)) {

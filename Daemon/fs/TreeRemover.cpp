@@ -1,5 +1,6 @@
 #include "Daemon/fs/TreeRemover.h"
 
+#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 #include "Daemon/support/Log.h"
 
@@ -19,10 +20,6 @@ std::string childPath(const std::string& parent, const char* name) {
     }
     path += name;
     return path;
-}
-
-bool isDot(const char* name) {
-    return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
 }
 
 } // namespace
@@ -87,7 +84,7 @@ void TreeRemover::removeChildren(int dirFd, const std::string& path) {
         if (*entry == nullptr) {
             break;
         }
-        if (!isDot((*entry)->d_name)) {
+        if (!DirectoryEntryName::isDot((*entry)->d_name)) {
             removeEntry(Place{dirfd(dir.dir()), path, true}, (*entry)->d_name, (*entry)->d_type);
         }
     }

@@ -1,5 +1,6 @@
 #include "Daemon/fs/TreeWalker.h"
 
+#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 
 #include <fcntl.h>
@@ -9,10 +10,6 @@ namespace quarn {
 using Entry = QRNFileManager::TraversalEntry;
 
 namespace {
-
-bool isDot(const char* name) {
-    return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
-}
 
 Entry::Kind kindOf(mode_t mode) {
     switch (mode & S_IFMT) {
@@ -106,7 +103,7 @@ void TreeWalker::visitChildren(DIR* dir, const Entry& parent) {
             return;
         }
         const char* name = (*read)->d_name;
-        if (isDot(name)) {
+        if (DirectoryEntryName::isDot(name)) {
             continue;
         }
         auto st = env_.fstatat(dirFd, name, AT_SYMLINK_NOFOLLOW);
