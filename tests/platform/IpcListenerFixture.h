@@ -16,6 +16,16 @@
 
 namespace quarn::test {
 
+// A message numbered `seq`, and the number a reply carries back (all ones
+// for none).
+inline Value message(std::uint64_t seq) {
+    return Value(Value::Dictionary{{"Seq", Value(seq)}});
+}
+inline std::uint64_t seqOf(const std::optional<Value>& reply) {
+    const Value* seq = reply ? reply->get("Seq") : nullptr;
+    return seq && seq->asUInt64() ? *seq->asUInt64() : ~std::uint64_t{0};
+}
+
 // Fails a hung test; no test measures time.
 inline constexpr auto kGuard = std::chrono::seconds(20);
 

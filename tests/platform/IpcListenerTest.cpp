@@ -13,15 +13,6 @@ using namespace quarn::test;
 
 namespace {
 
-Value message(std::uint64_t seq) {
-    return Value(Value::Dictionary{{"Seq", Value(seq)}});
-}
-
-std::uint64_t seqOf(const std::optional<Value>& reply) {
-    const Value* seq = reply ? reply->get("Seq") : nullptr;
-    return seq && seq->asUInt64() ? *seq->asUInt64() : ~std::uint64_t{0};
-}
-
 mode_t modeOf(const std::filesystem::path& path) {
     struct stat st {};
     ::lstat(path.c_str(), &st);

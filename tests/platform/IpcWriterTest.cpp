@@ -16,15 +16,6 @@ using namespace quarn::test;
 
 namespace {
 
-Value message(std::uint64_t seq) {
-    return Value(Value::Dictionary{{"Seq", Value(seq)}});
-}
-
-std::uint64_t seqOf(const std::optional<Value>& reply) {
-    const Value* seq = reply ? reply->get("Seq") : nullptr;
-    return seq && seq->asUInt64() ? *seq->asUInt64() : ~std::uint64_t{0};
-}
-
 // Runs `write` in a forked child that shares this process's descriptors;
 // answers the child's pid once it has exited.
 template <class Write> pid_t inChild(Write write) {
