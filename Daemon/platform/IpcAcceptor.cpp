@@ -37,9 +37,9 @@ bool isResourceShortage(const asio::error_code& error) {
 } // namespace
 
 IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
-                         IpcListener::ConnectionHandler handler)
-    : core_(std::move(core)), limits_(limits), handler_(std::move(handler)),
-      acceptor_(core_->io(0)), backOffTimer_(core_->io(0)) {}
+                         std::size_t maxConnections, IpcListener::ConnectionHandler handler)
+    : core_(std::move(core)), limits_(limits), maxConnections_(maxConnections),
+      handler_(std::move(handler)), acceptor_(core_->io(0)), backOffTimer_(core_->io(0)) {}
 
 Status IpcAcceptor::adopt(int listeningFd) {
     std::lock_guard lock(mutex_);
@@ -96,6 +96,13 @@ void IpcAcceptor::onAccepted(const asio::error_code& error, AsioIpcConnection::S
 }
 
 void IpcAcceptor::handOver(AsioIpcConnection::Socket socket) {
+    // Checked before the peer is read from /proc: a flood of connections
+    // costs the daemon an accept and a close each, nothing more.
+    if (core_->openCount() >= maxConnections_) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: {} connections are open",
+                      maxConnections_);
+        return;
+    }
     ::fcntl(socket.native_handle(), F_SETFD, FD_CLOEXEC);
     if (!passCredentials(socket.native_handle())) {
         QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: no credentials: {}",
@@ -111,7 +118,11 @@ void IpcAcceptor::handOver(AsioIpcConnection::Socket socket) {
     const pid_t pid = peer->pid();
     auto connection =
         std::make_shared<AsioIpcConnection>(core_, std::move(socket), std::move(*peer), limits_);
-    const std::size_t open = core_->add(connection);
+    // Only this acceptor adds, so the count checked above still holds.
+    const std::size_t open = core_->add(connection, maxConnections_);
+    if (open == 0) {
+        return;
+    }
     QRN_LOG_DEBUG(LogCategory::Vell, "Accepted a connection of pid {}; {} open", pid, open);
     try {
         handler_(std::move(connection));

@@ -15,8 +15,9 @@ namespace quarn {
 
 class IpcAcceptor : public std::enable_shared_from_this<IpcAcceptor> {
 public:
+    // Connections past `maxConnections` open ones are closed as accepted.
     IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
-                IpcListener::ConnectionHandler handler);
+                std::size_t maxConnections, IpcListener::ConnectionHandler handler);
 
     // Takes ownership of `listeningFd`, closing it on failure.
     Status adopt(int listeningFd);
@@ -33,6 +34,7 @@ private:
     // Declared first so that it outlives the acceptor and timer it runs.
     std::shared_ptr<IpcServiceCore> core_;
     const AsioIpcConnection::Limits limits_;
+    const std::size_t maxConnections_;
     const IpcListener::ConnectionHandler handler_;
     // Guards acceptor_, backOffTimer_ and closed_: asio objects are not safe
     // to use from two threads at once, and close() comes from any thread.

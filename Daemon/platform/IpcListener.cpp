@@ -75,7 +75,8 @@ Status IpcListener::start(ConnectionHandler onConnection) {
         return QRN_UNEXPECTED(fd.error());
     }
     const AsioIpcConnection::Limits limits{impl_->options.maxFrameBytes, impl_->options.maxNesting};
-    auto acceptor = std::make_shared<IpcAcceptor>(impl_->core, limits, std::move(onConnection));
+    auto acceptor = std::make_shared<IpcAcceptor>(
+        impl_->core, limits, impl_->options.maxConnections, std::move(onConnection));
     if (auto adopted = acceptor->adopt(*fd); !adopted) {
         return adopted;
     }

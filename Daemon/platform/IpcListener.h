@@ -31,6 +31,10 @@ public:
         std::size_t workerThreads = 4;
         std::size_t maxFrameBytes = 1024 * 1024;
         std::size_t maxNesting = 32;
+        // Each open connection holds a socket, a pidfd and up to a frame of
+        // buffer; past this many, new ones are closed at once with a log
+        // line instead of exhausting the daemon's descriptors or memory.
+        std::size_t maxConnections = 512;
     };
     // Called on a pool thread for each accepted connection, which reads
     // nothing until it is resumed.

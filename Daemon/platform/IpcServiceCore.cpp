@@ -27,8 +27,12 @@ void IpcServiceCore::closeGate() {
     gateClosed_ = true;
 }
 
-std::size_t IpcServiceCore::add(const std::shared_ptr<AsioIpcConnection>& connection) {
+std::size_t IpcServiceCore::add(const std::shared_ptr<AsioIpcConnection>& connection,
+                                std::size_t maxOpen) {
     std::lock_guard lock(connectionsMutex_);
+    if (connections_.size() >= maxOpen) {
+        return 0;
+    }
     connections_.emplace(connection.get(), connection);
     return connections_.size();
 }
@@ -36,6 +40,11 @@ std::size_t IpcServiceCore::add(const std::shared_ptr<AsioIpcConnection>& connec
 std::size_t IpcServiceCore::remove(const AsioIpcConnection* connection) {
     std::lock_guard lock(connectionsMutex_);
     connections_.erase(connection);
+    return connections_.size();
+}
+
+std::size_t IpcServiceCore::openCount() const {
+    std::lock_guard lock(connectionsMutex_);
     return connections_.size();
 }
 

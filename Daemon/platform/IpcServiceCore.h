@@ -51,10 +51,12 @@ public:
     }
     void closeGate();
 
-    // Both answer the number of connections open afterwards.
-    std::size_t add(const std::shared_ptr<AsioIpcConnection>& connection);
+    // Both answer the number of connections open afterwards; `add` adds
+    // nothing and answers 0 when `maxOpen` are open already.
+    std::size_t add(const std::shared_ptr<AsioIpcConnection>& connection, std::size_t maxOpen);
     std::size_t remove(const AsioIpcConnection* connection);
     std::vector<std::shared_ptr<AsioIpcConnection>> connections() const;
+    std::size_t openCount() const;
 
 private:
     std::vector<std::unique_ptr<asio::io_context>> contexts_;

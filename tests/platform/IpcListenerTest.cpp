@@ -205,3 +205,25 @@ TEST_F(IpcListenerTest, ConnectionNotResumedReadsNothing) {
     EXPECT_EQ(seqOf(waiting.receive()), 1u);
     EXPECT_EQ(waiting.unreadByService(), 0);
 }
+
+TEST_F(IpcListenerTest, ConnectionsPastTheLimitAreClosedUntilOthersEnd) {
+    LogCapture log;
+    IpcListener::Options limited = options();
+    limited.maxConnections = 2;
+    ASSERT_TRUE(start(echo, limited));
+    {
+        IpcTestClient first(socketPath());
+        IpcTestClient second(socketPath());
+        first.send(message(1));
+        second.send(message(2));
+        EXPECT_EQ(seqOf(first.receive()), 1u);
+        EXPECT_EQ(seqOf(second.receive()), 2u);
+        IpcTestClient third(socketPath());
+        EXPECT_TRUE(third.closedByService());
+        EXPECT_TRUE(log.contains("Refusing a connection: 2 connections are open")) << log.all();
+    }
+    ASSERT_TRUE(waitUntil([&] { return invalidations_.size() == 2; }));
+    IpcTestClient fourth(socketPath());
+    fourth.send(message(4));
+    EXPECT_EQ(seqOf(fourth.receive()), 4u);
+}
