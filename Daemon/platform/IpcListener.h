@@ -31,10 +31,11 @@ public:
         std::size_t workerThreads = 4;
         std::size_t maxFrameBytes = 1024 * 1024;
         std::size_t maxNesting = 32;
-        // Each open connection holds a socket, a pidfd and up to a frame of
-        // buffer; past this many, new ones are closed at once with a log
-        // line instead of exhausting the daemon's descriptors or memory.
-        std::size_t maxConnections = 512;
+        // Each open connection holds a socket, a pidfd per writer and up to
+        // a frame of buffer; past this many, new ones are closed at once with
+        // a log line instead of exhausting the daemon's descriptors (the soft
+        // limit is 1024, and tree walks need theirs) or memory.
+        std::size_t maxConnections = 256;
     };
     // Called on a pool thread for each accepted connection, which reads
     // nothing until it is resumed.
