@@ -50,12 +50,12 @@ void untrack(ServerProcess* server) {
 ServerProcess::ServerProcess(const std::filesystem::path& program,
                              const std::vector<std::string>& arguments,
                              const std::filesystem::path& output) {
-    test::ChildProcess::Spec spec;
-    spec.program = program;
-    spec.arguments = arguments;
-    spec.stdoutFile = output;
-    spec.stderrFile = output;
-    auto spawned = test::ChildProcess::spawn(spec);
+    test::ChildProcess::Launch launch;
+    launch.program = program;
+    launch.arguments = arguments;
+    launch.stdoutFile = output;
+    launch.stderrFile = output;
+    auto spawned = test::ChildProcess::spawn(launch);
     if (!spawned) {
         fail("cannot start {}: {}", program.string(), spawned.error().message);
     }

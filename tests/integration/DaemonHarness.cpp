@@ -60,12 +60,12 @@ std::filesystem::path DaemonHarness::socketPath() const {
 bool DaemonHarness::spawn(std::vector<std::string> environment) {
     runLogStart_ =
         std::filesystem::exists(stderrFile_) ? std::filesystem::file_size(stderrFile_) : 0;
-    ChildProcess::Spec spec;
-    spec.program = QUARN_DAEMON_PATH;
-    spec.arguments = {"--root", root().string(), "--foreground", "--log-level", "debug"};
-    spec.environment = std::move(environment);
-    spec.stderrFile = stderrFile_;
-    auto spawned = ChildProcess::spawn(spec);
+    ChildProcess::Launch launch;
+    launch.program = QUARN_DAEMON_PATH;
+    launch.arguments = {"--root", root().string(), "--foreground", "--log-level", "debug"};
+    launch.environment = std::move(environment);
+    launch.stderrFile = stderrFile_;
+    auto spawned = ChildProcess::spawn(launch);
     daemon_.reset();
     if (!spawned) {
         ADD_FAILURE() << spawned.error().description();
@@ -134,21 +134,21 @@ std::size_t DaemonHarness::waitForLog(std::string_view text, std::size_t from) c
 
 DaemonHarness::ClientRun DaemonHarness::runClient(std::string_view program,
                                                   const std::vector<Value>& requests) const {
-    ChildProcess::Spec spec;
-    spec.program = clients_->pathOf(program);
-    spec.arguments = {"--socket", socketPath().string()};
+    ChildProcess::Launch launch;
+    launch.program = clients_->pathOf(program);
+    launch.arguments = {"--socket", socketPath().string()};
     for (const Value& request : requests) {
-        spec.arguments.push_back(HexCbor::encode(request));
+        launch.arguments.push_back(HexCbor::encode(request));
     }
-    spec.stdoutFile = root() / "clients" / ("run-" + std::to_string(++clientRuns_) + ".out");
+    launch.stdoutFile = root() / "clients" / ("run-" + std::to_string(++clientRuns_) + ".out");
     ClientRun run;
-    auto child = ChildProcess::spawn(spec);
+    auto child = ChildProcess::spawn(launch);
     if (!child) {
         run.failure = child.error().description();
         return run;
     }
     run.exit = child->waitFor(kWaitLimit);
-    std::ifstream out(spec.stdoutFile);
+    std::ifstream out(launch.stdoutFile);
     for (std::string line; std::getline(out, line);) {
         if (line.starts_with('!')) {
             run.failure = line.substr(1);

@@ -30,14 +30,14 @@ bool inheritedFromTest(const char* entry) {
     return true;
 }
 
-std::vector<std::string> environmentFor(const ChildProcess::Spec& spec) {
+std::vector<std::string> environmentFor(const ChildProcess::Launch& launch) {
     std::vector<std::string> environment;
     for (char** entry = environ; *entry; ++entry) {
         if (inheritedFromTest(*entry)) {
             environment.emplace_back(*entry);
         }
     }
-    environment.insert(environment.end(), spec.environment.begin(), spec.environment.end());
+    environment.insert(environment.end(), launch.environment.begin(), launch.environment.end());
     return environment;
 }
 
@@ -82,25 +82,25 @@ std::string ChildProcess::Exit::description() const {
     return fmt::format("wait status {:#x}", status);
 }
 
-Result<ChildProcess> ChildProcess::spawn(const Spec& spec) {
+Result<ChildProcess> ChildProcess::spawn(const Launch& launch) {
     FileActions files;
     posix_spawn_file_actions_addopen(&files.actions, 0, "/dev/null", O_RDONLY, 0);
     posix_spawn_file_actions_addopen(
-        &files.actions, 1, spec.stdoutFile.empty() ? "/dev/null" : spec.stdoutFile.c_str(),
+        &files.actions, 1, launch.stdoutFile.empty() ? "/dev/null" : launch.stdoutFile.c_str(),
         O_WRONLY | O_CREAT | O_APPEND, 0644);
-    if (!spec.stderrFile.empty()) {
-        posix_spawn_file_actions_addopen(&files.actions, 2, spec.stderrFile.c_str(),
+    if (!launch.stderrFile.empty()) {
+        posix_spawn_file_actions_addopen(&files.actions, 2, launch.stderrFile.c_str(),
                                          O_WRONLY | O_CREAT | O_APPEND, 0644);
     }
-    std::vector<std::string> arguments{spec.program.string()};
-    arguments.insert(arguments.end(), spec.arguments.begin(), spec.arguments.end());
-    std::vector<std::string> environment = environmentFor(spec);
+    std::vector<std::string> arguments{launch.program.string()};
+    arguments.insert(arguments.end(), launch.arguments.begin(), launch.arguments.end());
+    std::vector<std::string> environment = environmentFor(launch);
     pid_t pid = -1;
-    const int err = ::posix_spawn(&pid, spec.program.c_str(), &files.actions, nullptr,
+    const int err = ::posix_spawn(&pid, launch.program.c_str(), &files.actions, nullptr,
                                   pointersTo(arguments).data(), pointersTo(environment).data());
     if (err != 0) {
-        return QRN_UNEXPECTED(
-            QRN_POSIX_ERROR(err, "cannot spawn {}: {}", spec.program.string(), std::strerror(err)));
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "cannot spawn {}: {}", launch.program.string(),
+                                              std::strerror(err)));
     }
     auto pidfd = std::make_unique<Descriptor>(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
     if (!pidfd->valid()) {

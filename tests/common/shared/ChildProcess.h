@@ -20,7 +20,7 @@ namespace quarn::test {
 
 class ChildProcess {
 public:
-    struct Spec {
+    struct Launch {
         std::filesystem::path program;
         std::vector<std::string> arguments; // after argv[0]
         // Added to the test's environment, which loses the systemd
@@ -37,7 +37,7 @@ public:
         std::string description() const;
     };
 
-    static Result<ChildProcess> spawn(const Spec& spec);
+    static Result<ChildProcess> spawn(const Launch& launch);
 
     ChildProcess(ChildProcess&& other) noexcept;
     ChildProcess& operator=(ChildProcess&&) = delete;
