@@ -245,10 +245,15 @@ Result<Value> scalarValue(plist_t node) {
     }
 }
 
+// The converter and the checker refuse a node with the same error.
+Error missingOrTooDeep() {
+    return QRN_GENERAL_ERROR(kGeneralErrorPropertyListReadCorrupt,
+                             "Property list missing a node or too deep");
+}
+
 Result<Value> fromNode(plist_t node, std::size_t depth) {
     if (!node || depth > kLimits.maxDepth) {
-        return QRN_UNEXPECTED(QRN_GENERAL_ERROR(kGeneralErrorPropertyListReadCorrupt,
-                                                "Property list missing a node or too deep"));
+        return QRN_UNEXPECTED(missingOrTooDeep());
     }
     switch (plist_get_node_type(node)) {
     case PLIST_ARRAY:
@@ -298,8 +303,7 @@ Status checkDictionary(plist_t node, std::size_t depth) {
 // Fails exactly where fromNode fails, with the same errors.
 Status checkNode(plist_t node, std::size_t depth) {
     if (!node || depth > kLimits.maxDepth) {
-        return QRN_UNEXPECTED(QRN_GENERAL_ERROR(kGeneralErrorPropertyListReadCorrupt,
-                                                "Property list missing a node or too deep"));
+        return QRN_UNEXPECTED(missingOrTooDeep());
     }
     switch (plist_get_node_type(node)) {
     case PLIST_ARRAY:
