@@ -1,8 +1,8 @@
 #include "Daemon/QRNDaemon.h"
 
-#include "Daemon/QRNClientConnection.h"
 #include "Daemon/QRNLockStateFollower.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
+#include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/platform/FirstBootMarker.h"
 #include "Daemon/platform/LockState.h"
 #include "Daemon/platform/Notifications.h"

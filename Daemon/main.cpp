@@ -4,9 +4,9 @@
 
 #include "Daemon/QRNDaemon.h"
 #include "Daemon/QRNDaemonOptions.h"
-#include "Daemon/QRNVellService.h"
 #include "Daemon/platform/LinuxPlatform.h"
 #include "Daemon/platform/Paths.h"
+#include "Daemon/service/QRNVellService.h"
 #include "Daemon/support/Log.h"
 #include "Daemon/support/QRNDaemonContext.h"
 

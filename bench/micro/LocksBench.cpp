@@ -1,7 +1,7 @@
 // Identifier locks, uncontended and with four threads, against the bare
 // std::shared_mutex that each identifier's record wraps (the floor).
 
-#include "Daemon/QRNLocks.h"
+#include "Daemon/operations/QRNLocks.h"
 
 #include <benchmark/benchmark.h>
 

@@ -1,10 +1,10 @@
 // Initialisation against a temporary root, with and without the first-boot
 // marker: which passes run, in which order, and what they leave behind.
 
-#include "Daemon/QRNClientConnection.h"
 #include "Daemon/QRNDaemon.h"
 #include "Daemon/QRNLockStateFollower.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
+#include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/platform/FirstBootMarker.h"
 #include "Daemon/platform/LockState.h"
 #include "Daemon/platform/Notifications.h"
