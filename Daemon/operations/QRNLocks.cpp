@@ -15,6 +15,8 @@ namespace quarn {
 
 namespace {
 
+// The module name that assertion reports carry; readers of those reports
+// know it by this name, wherever the file sits.
 constexpr const char* kSourceName = "Daemon/QRNLocks";
 
 [[noreturn]] void assertionFailed(const char* function, int line, const char* condition) {
