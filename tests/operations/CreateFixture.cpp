@@ -1,49 +1,52 @@
 #include "CreateFixture.h"
 
 #include "Daemon/fs/LinuxEnv.h"
+#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/support/Queue.h"
 
 #include <algorithm>
+#include <fstream>
 
 namespace quarn::test {
 
-CreateFixture::CreateFixture()
-    : env_(std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>())) {
+CreateFixture::CreateFixture(bool holdDeathRow)
+    : holdDeathRow_(holdDeathRow),
+      env_(std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>())) {
     // Before anything makes the file manager, which takes the Env once.
     root_.context().install<Env>(env_);
-    // Death row keeps what it receives until the fixture ends, so tests can
-    // look at it.
-    QRNClientConnection::_sharedDeathrowBackgroundQueue()->suspend();
+    if (holdDeathRow_) {
+        QRNClientConnection::_sharedDeathrowBackgroundQueue()->suspend();
+    }
 }
 
 CreateFixture::~CreateFixture() {
     env_->clearFailures();
     env_->setHook(nullptr);
     // Let the deletion passes run to their end while the root still exists.
-    auto background = QRNClientConnection::_sharedDeathrowBackgroundQueue();
-    background->resume();
-    background->sync([] {});
+    if (holdDeathRow_) {
+        QRNClientConnection::_sharedDeathrowBackgroundQueue()->resume();
+    }
+    drainBackground();
 }
 
-std::shared_ptr<QRNClientConnection>
-CreateFixture::connectionFor(const std::string& bundleIdentifier, Rights rights) {
+std::shared_ptr<QRNClientConnection> CreateFixture::connectionFor(const std::string& bundle,
+                                                                  Rights rights) {
     auto client = QRNClientIdentity::initWithBundleIdentifier(
-        bundleIdentifier, kMobileUID, kMobileUID, 4242, user(), Value::dictionary(), false,
-        QRNClientIdentity::AuditToken{}, rights.kernel);
-    return std::make_shared<QRNClientConnection>(client, rights.unrestricted,
-                                                 rights.allowOtherIdLookup, rights.unrestricted,
-                                                 rights.lookup, std::nullopt, nullptr);
+        bundle, kMobileUID, kMobileUID, 4242, user(), Value::dictionary(), false,
+        QRNClientIdentity::AuditToken{}, false);
+    return std::make_shared<QRNClientConnection>(client, rights.unrestricted, rights.otherIds,
+                                                 rights.unrestricted, rights.lookup, std::nullopt,
+                                                 nullptr);
 }
 
-QRNUserIdentityPtr CreateFixture::user() const {
+QRNUserIdentityPtr CreateFixture::user() {
     return QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity();
 }
 
-QRNContainerIdentityPtr CreateFixture::identity(const std::string& identifier,
-                                                std::uint64_t cls) const {
+QRNContainerIdentityPtr CreateFixture::identity(const std::string& identifier, std::uint64_t cls) {
     auto made = QRNContainerIdentity::containerIdentityWithUserIdentity(user(), identifier, cls);
     EXPECT_TRUE(made.has_value());
     return made ? *made : nullptr;
@@ -53,21 +56,27 @@ QRNMetadataPtr CreateFixture::create(const std::string& identifier, std::uint64_
                                      bool transient) {
     auto made = privileged()->createOrLookupContainerWithContainerIdentity(
         identity(identifier, cls), true, transient, true);
-    EXPECT_TRUE(made.has_value()) << "code " << (made ? 1 : made.error());
+    EXPECT_TRUE(made.has_value()) << identifier << ": code " << (made ? 1 : made.error());
     return made ? *made : nullptr;
 }
 
-std::filesystem::path CreateFixture::classDirectory(std::uint64_t cls, bool transient) const {
+bool CreateFixture::cached(const QRNContainerIdentityPtr& identity, bool transient) {
+    return QRNContainerCache::sharedInstance()
+        .containerForContainerIdentity(identity, transient)
+        .has_value();
+}
+
+std::filesystem::path CreateFixture::classDirectory(std::uint64_t cls, bool transient) {
     return *QRNGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
         user(), cls, transient);
 }
 
-std::filesystem::path CreateFixture::stagingDirectory(std::uint64_t cls) const {
+std::filesystem::path CreateFixture::stagingDirectory(std::uint64_t cls) {
     return *QRNGlobalConfiguration::sharedInstance().stagingDirectoryURLForUserIdentity(user(),
                                                                                         cls);
 }
 
-std::filesystem::path CreateFixture::deathRow() const {
+std::filesystem::path CreateFixture::deathRow() {
     return QRNGlobalConfiguration::sharedInstance().deathrowDirectory();
 }
 
@@ -81,7 +90,7 @@ std::vector<std::string> CreateFixture::namesIn(const std::filesystem::path& dir
     return names;
 }
 
-std::vector<std::string> CreateFixture::namesOnDeathRow() const {
+std::vector<std::string> CreateFixture::namesOnDeathRow() {
     std::vector<std::string> names;
     for (const std::string& unique : namesIn(deathRow())) {
         for (const std::string& name : namesIn(deathRow() / unique)) {
@@ -90,6 +99,17 @@ std::vector<std::string> CreateFixture::namesOnDeathRow() const {
     }
     std::sort(names.begin(), names.end());
     return names;
+}
+
+std::filesystem::path CreateFixture::makeTree(const std::filesystem::path& directory) {
+    std::filesystem::create_directories(directory / "inner");
+    std::ofstream(directory / "inner" / "file") << "x";
+    return directory;
+}
+
+void CreateFixture::drainBackground() {
+    QRNClientConnection::_sharedBackgroundQueue()->sync([] {});
+    QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
 }
 
 std::uint64_t CreateFixture::totalCalls() const {

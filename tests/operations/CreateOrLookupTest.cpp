@@ -1,17 +1,22 @@
 // Create or look up: what a creation leaves on disk, finding instead of
-// creating, transient containers and concurrent creations.
+// creating, transient containers, concurrent creations, who may ask for
+// which container, and how a creation that fails cleans up.
 
 #include "CreateFixture.h"
 
 #include "Daemon/fs/QRNFileManager.h"
+#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNContainerClass.h"
+#include "Daemon/operations/QRNLocks.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"
 
-#include "common/LogCapture.h"
+#include "common/shared/RequestValues.h"
 
 #include <sys/xattr.h>
 
+#include <cerrno>
 #include <latch>
+#include <stdexcept>
 #include <thread>
 
 using namespace quarn;
@@ -19,37 +24,49 @@ using namespace quarn::test;
 
 namespace {
 
+constexpr std::uint64_t kClass = kQRNContainerClassAppData;
 constexpr std::uint32_t kNobody32 = 4294967294u;
 
 class CreateOrLookupTest : public CreateFixture {
 protected:
-    mode_t modeOf(const std::filesystem::path& path) { return lstatOf(path).st_mode & 07777; }
     int protectionClassOf(const std::filesystem::path& path) {
         auto cls = QRNFileManager::defaultManager().dataProtectionClassOfItemAtURL(path);
         EXPECT_TRUE(cls.has_value()) << path;
         return cls ? *cls : -1;
     }
-    // Entitlements of every identifier ask for the given protection level.
-    void entitlementsAskFor(std::string_view level) {
-        Value entitlements = Value::dictionary();
-        entitlements.set("com.orvex.developer.default-data-protection", Value(level));
+    // Entitlements of every identifier ask for complete protection.
+    void entitlementsAskForComplete() {
+        Value entitlements = dictionaryOf({{"com.orvex.developer.default-data-protection",
+                                            Value(QRNDataProtectionManager::kProtectionComplete)}});
         QRNDataProtectionManager::defaultManager().setEntitlementsSource(
             [entitlements](std::string_view) { return std::optional<Value>(entitlements); });
     }
+    // The code of a lookup (create = false) or creation; 1 when it succeeds.
+    std::uint64_t codeOf(QRNClientConnection& connection, const std::string& identifier,
+                         std::uint64_t cls, bool create = false, bool transient = false) {
+        auto found = connection.createOrLookupContainerWithContainerIdentity(
+            identity(identifier, cls), create, transient, true);
+        return found ? kQRNErrorNone : found.error();
+    }
 };
 
-TEST_F(CreateOrLookupTest, CreatesOnceAndThenFindsWithoutTouchingTheDisk) {
+TEST_F(CreateOrLookupTest, LooksUpNothingThenCreatesOnceAndThenFindsWithoutTouchingTheDisk) {
     auto connection = connectionFor(kClientBundle);
+    LogCapture log;
+    EXPECT_EQ(codeOf(*connection, kClientBundle, kClass), kQRNErrorContainerNotFound);
+    EXPECT_TRUE(log.contains("Container with identifier: \"com.example.client\" Not Found"))
+        << log.all();
+    EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
+
     bool existed = true;
     auto made = connection->createOrLookupContainerWithContainerIdentity(
-        identity(kClientBundle, kQRNContainerClassAppData), true, false, true, &existed);
+        identity(kClientBundle, kClass), true, false, true, &existed);
     ASSERT_TRUE(made.has_value()) << made.error();
     EXPECT_FALSE(existed);
     const std::filesystem::path url = (*made)->url();
-    EXPECT_EQ(url.parent_path(), classDirectory(kQRNContainerClassAppData));
+    EXPECT_EQ(url.parent_path(), classDirectory(kClass));
     EXPECT_EQ(url.filename().string(), (*made)->uuid().string());
-    EXPECT_TRUE(namesIn(stagingDirectory(kQRNContainerClassAppData)).empty());
-
+    EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
     // The file on disk describes the container that was handed out.
     auto read =
         QRNMetadata::readAndValidateMetadataAtFileUrl(url / QRNMetadata::kFileName, user(), true);
@@ -61,36 +78,23 @@ TEST_F(CreateOrLookupTest, CreatesOnceAndThenFindsWithoutTouchingTheDisk) {
     for (bool createIfNecessary : {false, true}) {
         existed = false;
         auto found = connection->createOrLookupContainerWithContainerIdentity(
-            identity(kClientBundle, kQRNContainerClassAppData), createIfNecessary, false, true,
-            &existed);
+            identity(kClientBundle, kClass), createIfNecessary, false, true, &existed);
         ASSERT_TRUE(found.has_value());
         EXPECT_TRUE(existed);
         EXPECT_EQ((*found)->uuid(), (*made)->uuid());
         EXPECT_EQ((*found)->url(), url);
     }
     EXPECT_EQ(env_->count(EnvCall::Mkdir) + env_->count(EnvCall::Rename), callsBefore);
-    EXPECT_EQ(namesIn(classDirectory(kQRNContainerClassAppData)).size(), 1u);
-}
-
-TEST_F(CreateOrLookupTest, LookupOfAnAbsentContainerFailsWithNotFoundAndMakesNothing) {
-    LogCapture log;
-    auto found = connectionFor(kClientBundle)
-                     ->createOrLookupContainerWithContainerIdentity(
-                         identity(kClientBundle, kQRNContainerClassAppData), false, false, true);
-    ASSERT_FALSE(found.has_value());
-    EXPECT_EQ(found.error(), kQRNErrorContainerNotFound);
-    EXPECT_TRUE(log.contains("Container with identifier: \"com.example.client\" Not Found"))
-        << log.all();
-    EXPECT_TRUE(namesIn(classDirectory(kQRNContainerClassAppData)).empty());
+    EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
 }
 
 TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtectionClass) {
-    entitlementsAskFor(QRNDataProtectionManager::kProtectionComplete);
-    auto made = create(kClientBundle, kQRNContainerClassAppData);
+    entitlementsAskForComplete();
+    auto made = create(kClientBundle, kClass);
     ASSERT_TRUE(made);
     const std::filesystem::path url = made->url();
     EXPECT_EQ(lstatOf(url).st_uid, kMobileUID);
-    EXPECT_EQ(modeOf(url), 0755u);
+    EXPECT_EQ(lstatOf(url).st_mode & 07777, 0755u);
     EXPECT_EQ(protectionClassOf(url), 0);
     for (const char* name :
          {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}) {
@@ -106,16 +110,15 @@ TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtection
 }
 
 TEST_F(CreateOrLookupTest, RecreatedStructureIsNeverMadeThroughALinkInTheContainer) {
-    auto made = create(kClientBundle, kQRNContainerClassAppData);
+    auto made = create(kClientBundle, kClass);
     ASSERT_TRUE(made);
-    const std::filesystem::path url = made->url();
     const std::filesystem::path outside = root_.path() / "outside";
     std::filesystem::create_directories(outside);
-    std::filesystem::remove_all(url / "Library");
-    std::filesystem::create_directory_symlink(outside, url / "Library");
+    std::filesystem::remove_all(made->url() / "Library");
+    std::filesystem::create_directory_symlink(outside, made->url() / "Library");
 
     auto recreated = privileged()->recreateDefaultStructureWithContainerIdentity(
-        identity(kClientBundle, kQRNContainerClassAppData));
+        identity(kClientBundle, kClass));
     ASSERT_FALSE(recreated);
     EXPECT_EQ(recreated.error(), kQRNErrorCreateDirFailed);
     EXPECT_TRUE(namesIn(outside).empty());
@@ -124,7 +127,7 @@ TEST_F(CreateOrLookupTest, RecreatedStructureIsNeverMadeThroughALinkInTheContain
 
 TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
     // Entitlements choose protection classes for data containers only.
-    entitlementsAskFor(QRNDataProtectionManager::kProtectionComplete);
+    entitlementsAskForComplete();
     auto made = create("com.example.system", kQRNContainerClassSystemData);
     ASSERT_TRUE(made);
     // Not well known: named by its UUID.
@@ -140,6 +143,13 @@ TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
         EXPECT_EQ(protectionClassOf(made->url() / name), 0);
     }
     EXPECT_EQ(namesIn(made->url()).size(), 2u); // metadata and Library
+
+    // Bundle containers belong to the installer and hold only the metadata file.
+    auto bundle = create("com.example.app", kQRNContainerClassAppBundle);
+    ASSERT_TRUE(bundle);
+    EXPECT_EQ(lstatOf(bundle->url()).st_uid, 33u);
+    EXPECT_EQ(namesIn(bundle->url()),
+              std::vector<std::string>{std::string(QRNMetadata::kFileName)});
 }
 
 TEST_F(CreateOrLookupTest, WellKnownSystemContainersLiveUnderTheirNames) {
@@ -150,44 +160,29 @@ TEST_F(CreateOrLookupTest, WellKnownSystemContainersLiveUnderTheirNames) {
     auto group = create("systemgroup.com.orvex.pairing", kQRNContainerClassSystemGroup);
     ASSERT_TRUE(group);
     EXPECT_EQ(group->url().filename(), "systemgroup.com.orvex.pairing");
-
     // Found again under the name (the cache accepts well-known names).
-    bool existed = false;
     auto found = privileged()->createOrLookupContainerWithContainerIdentity(
-        identity("com.orvex.devicesettings", kQRNContainerClassSystemData), false, false, true,
-        &existed);
+        identity("com.orvex.devicesettings", kQRNContainerClassSystemData), false, false, true);
     ASSERT_TRUE(found.has_value());
-    EXPECT_TRUE(existed);
     EXPECT_EQ((*found)->uuid(), settings->uuid());
 }
 
-TEST_F(CreateOrLookupTest, BundleContainersBelongToTheInstaller) {
-    auto made = create("com.example.app", kQRNContainerClassAppBundle);
-    ASSERT_TRUE(made);
-    EXPECT_EQ(lstatOf(made->url()).st_uid, 33u);
-    // No subdirectories: only the metadata file.
-    EXPECT_EQ(namesIn(made->url()), std::vector<std::string>{std::string(QRNMetadata::kFileName)});
-}
-
 TEST_F(CreateOrLookupTest, TransientContainersAreNeverReused) {
-    auto first = create(kClientBundle, kQRNContainerClassAppData, true);
+    auto first = create(kClientBundle, kClass, true);
     ASSERT_TRUE(first);
-    EXPECT_EQ(first->url().parent_path(), classDirectory(kQRNContainerClassAppData, true));
-    auto second = create(kClientBundle, kQRNContainerClassAppData, true);
+    EXPECT_EQ(first->url().parent_path(), classDirectory(kClass, true));
+    auto second = create(kClientBundle, kClass, true);
     ASSERT_TRUE(second);
     EXPECT_NE(first->uuid(), second->uuid());
     EXPECT_FALSE(std::filesystem::exists(first->url()));
-    EXPECT_TRUE(std::filesystem::exists(second->url()));
     EXPECT_EQ(namesOnDeathRow(), std::vector<std::string>{first->uuid().string()});
 
     // A transient request never looks without creating, even though one exists.
-    auto lookup = privileged()->createOrLookupContainerWithContainerIdentity(
-        identity(kClientBundle, kQRNContainerClassAppData), false, true, true);
-    ASSERT_FALSE(lookup.has_value());
-    EXPECT_EQ(lookup.error(), kQRNErrorContainerNotFound);
+    EXPECT_EQ(codeOf(*privileged(), kClientBundle, kClass, false, true),
+              kQRNErrorContainerNotFound);
     EXPECT_TRUE(std::filesystem::exists(second->url()));
     // A permanent container of the identifier is another container.
-    auto permanent = create(kClientBundle, kQRNContainerClassAppData);
+    auto permanent = create(kClientBundle, kClass);
     ASSERT_TRUE(permanent);
     EXPECT_NE(permanent->uuid(), second->uuid());
 }
@@ -201,7 +196,7 @@ TEST_F(CreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer) {
     for (int i = 0; i < kThreads; ++i) {
         threads.emplace_back([&, i] {
             auto connection = connectionFor(kClientBundle);
-            auto id = identity(kClientBundle, kQRNContainerClassAppData);
+            auto id = identity(kClientBundle, kClass);
             bool flag = false;
             start.arrive_and_wait();
             results[i] = connection->createOrLookupContainerWithContainerIdentity(id, true, false,
@@ -219,24 +214,227 @@ TEST_F(CreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer) {
         created += existed[i] == 0 ? 1 : 0;
     }
     EXPECT_EQ(created, 1);
-    EXPECT_EQ(namesIn(classDirectory(kQRNContainerClassAppData)).size(), 1u);
+    EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
 }
 
 TEST_F(CreateOrLookupTest, FastSizingSwitchSizesTheNewContainer) {
     LogCapture log;
-    create("com.example.unsized", kQRNContainerClassAppData);
+    create("com.example.unsized", kClass);
     EXPECT_FALSE(log.contains("CalculatingDiskUsage")) << log.all();
-
     root_.writeFile("/etc/quarnd/features/quarnd.plist",
                     R"(<?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0"><dict>
 <key>fast_container_sizing</key><dict><key>Enabled</key><true/></dict>
 </dict></plist>)");
     log.clear();
-    auto sized = create("com.example.sized", kQRNContainerClassAppData);
+    auto sized = create("com.example.sized", kClass);
     ASSERT_TRUE(sized);
     EXPECT_TRUE(log.contains("CalculatingDiskUsage")) << log.all();
     EXPECT_TRUE(log.contains(sized->url().string())) << log.all();
+}
+
+// Access: who may look up which container. A lookup that passes the checks
+// answers "not found" (21); a refused one "not entitled" (55).
+
+TEST_F(CreateOrLookupTest, AnotherIdentifierWithoutRightsIsRefusedBeforeAnyDiskAccess) {
+    auto connection = connectionFor(kClientBundle);
+    const std::uint64_t before = totalCalls();
+    LogCapture log;
+    EXPECT_EQ(codeOf(*connection, "com.other.app", kClass, true), kQRNErrorNotEntitled);
+    EXPECT_EQ(totalCalls(), before);
+    EXPECT_TRUE(log.contains(
+        "com.example.client not entitled to retrieve container class 2 with identifier "
+        "com.other.app"))
+        << log.all();
+}
+
+TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
+    auto lookingUp = [&](const char* client, const char* shortName, Value granted) {
+        return connectionFor(client, {.lookup = dictionaryOf({{shortName, std::move(granted)}})});
+    };
+    auto groups = connectionFor(kClientBundle);
+    groups->setAllowGroupIdLookup(true);
+    auto widened = connectionFor(kClientBundle);
+    widened->setAllowOtherIdLookup(true);
+    auto listed = lookingUp(kClientBundle, "appData", arrayOf({Value("com.other.app")}));
+    auto search = connectionFor("com.orvex.searchd");
+    auto daemon = connectionFor("com.example.daemon");
+    const std::uint64_t found = kQRNErrorContainerNotFound, refused = kQRNErrorNotEntitled;
+    const struct {
+        const char* what;
+        std::shared_ptr<QRNClientConnection> connection;
+        const char* identifier;
+        std::uint64_t cls;
+        std::uint64_t code;
+    } cases[] = {
+        {"no right", connectionFor(kClientBundle), "com.other.app", kClass, refused},
+        {"other ids", connectionFor(kClientBundle, {.otherIds = true}), "com.other.app", kClass,
+         found},
+        {"unrestricted", privileged(), "com.other.app", kClass, found},
+        {"other ids set later", widened, "com.other.app", kClass, found},
+        {"group right, app group", groups, "group.other", kQRNContainerClassAppGroup, found},
+        {"group right, system group", groups, "systemgroup.other", kQRNContainerClassSystemGroup,
+         found},
+        {"group right is for groups only", groups, "com.other.app", kClass, refused},
+        {"listed identifier", listed, "com.other.app", kClass, found},
+        {"unlisted identifier", listed, "com.third.app", kClass, refused},
+        {"listed under another class", listed, "com.other.app", kQRNContainerClassPluginData,
+         refused},
+        {"a string where an array belongs",
+         lookingUp(kClientBundle, "appData", Value("com.other.app")), "com.other.app", kClass,
+         refused},
+        {"well-known exception", search, "com.orvex.notes", kClass, found},
+        {"exception of another class", search, "com.orvex.notes", kQRNContainerClassPluginData,
+         refused},
+        {"exception of another identifier", search, "com.orvex.photos", kClass, refused},
+        {"open to everyone", connectionFor(kClientBundle), "systemgroup.com.orvex.diagnostics",
+         kQRNContainerClassSystemGroup, found},
+        {"own identifier, other class", daemon, "com.example.daemon", kClass, found},
+        {"own system container, declared",
+         lookingUp("com.example.daemon", "systemData", arrayOf({Value("com.example.daemon")})),
+         "com.example.daemon", kQRNContainerClassSystemData, found},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(codeOf(*c.connection, c.identifier, c.cls), c.code) << c.what;
+    }
+
+    LogCapture log;
+    EXPECT_EQ(codeOf(*daemon, "com.example.daemon", kQRNContainerClassSystemData), refused);
+    EXPECT_TRUE(log.contains(
+        "com.example.daemon not entitled for system container with identifier com.example.daemon"))
+        << log.all();
+}
+
+TEST_F(CreateOrLookupTest, WellKnownSystemClientGetsItsSystemContainerOnly) {
+    auto accounts = connectionFor("com.orvex.accountsd");
+    auto made = accounts->createOrLookupContainerWithContainerIdentity(
+        identity("com.orvex.accountsd", kQRNContainerClassSystemData), true, false, true);
+    ASSERT_TRUE(made.has_value()) << made.error();
+    EXPECT_EQ((*made)->url().filename(), "com.orvex.accountsd");
+    EXPECT_EQ(codeOf(*accounts, "com.orvex.devicesettings", kQRNContainerClassSystemData),
+              kQRNErrorNotEntitled);
+}
+
+// Failures: a creation that fails at any step reports that step's code,
+// leaves nothing at the live path, sends its staging directory to death row
+// and gives the global lock back.
+class CreateFailureTest : public CreateOrLookupTest {
+protected:
+    void SetUp() override { primeDirectories(kClass); }
+    std::uint64_t createCode(bool transient = false) {
+        return codeOf(*privileged(), kClientBundle, kClass, true, transient);
+    }
+    void expectGlobalLockFree() {
+        EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
+    }
+};
+
+TEST_F(CreateFailureTest, MissingIdentityIsABadRequest) {
+    LogCapture log;
+    auto made =
+        privileged()->createOrLookupContainerWithContainerIdentity(nullptr, true, false, true);
+    ASSERT_FALSE(made.has_value());
+    EXPECT_EQ(made.error(), kQRNErrorBadRequestArgument);
+    EXPECT_TRUE(log.contains("Cannot lookup a nil container identity.")) << log.all();
+}
+
+TEST_F(CreateFailureTest, EachStepFailsWithItsCodeAndParksTheStagingDirectory) {
+    const struct {
+        const char* what;
+        EnvCall call;
+        std::uint64_t nth; // renames: the metadata file, then the container into place
+        bool throws;
+        std::uint64_t code;
+        const char* message;
+    } cases[] = {
+        {"staging", EnvCall::Mkdir, 1, false, kQRNErrorCreateStagingFailed,
+         "Failed to create staging dir at"},
+        {"metadata", EnvCall::Rename, 1, false, kQRNErrorWriteStateFileFailed,
+         "Failed to move metadata from staging"},
+        {"subdirectory", EnvCall::Mkdir, 2, false, kQRNErrorCreateDirFailed,
+         "Failed to create sub-dir for"},
+        {"move into place", EnvCall::Rename, 2, false, kQRNErrorMoveStagingToLiveFailed,
+         "Failed to move staging dir:"},
+        {"exception", EnvCall::Mkdir, 2, true, kQRNErrorException, "Got exception: "},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.what);
+        if (c.throws) {
+            env_->setHook([call = c.call, n = env_->count(c.call) + c.nth](EnvCall made,
+                                                                           std::uint64_t number) {
+                if (made == call && number == n) {
+                    throw std::runtime_error("injected");
+                }
+            });
+        } else {
+            env_->failCall(c.call, c.nth, EIO);
+        }
+        LogCapture log;
+        EXPECT_EQ(createCode(), c.code);
+        EXPECT_TRUE(log.contains(c.message)) << log.all();
+        EXPECT_TRUE(!c.throws || log.contains("injected")) << log.all();
+        EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
+        EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
+        // The staging directory is parked on death row once it was made.
+        const auto parked = namesOnDeathRow();
+        ASSERT_EQ(parked.size(), c.code == kQRNErrorCreateStagingFailed ? 0u : 1u);
+        EXPECT_TRUE(parked.empty() || UUID::parse(parked[0]).has_value()) << parked[0];
+        expectGlobalLockFree();
+        env_->setHook(nullptr);
+        env_->clearFailures();
+        for (const std::string& unique : namesIn(deathRow())) {
+            std::filesystem::remove_all(deathRow() / unique);
+        }
+    }
+    // Nothing of the failures stands in the way of the next creation.
+    EXPECT_EQ(createCode(), kQRNErrorNone);
+}
+
+TEST_F(CreateFailureTest, StagingThatCannotBeParkedIsReported) {
+    // The move into place and the move to death row both fail.
+    env_->failCallsFrom(EnvCall::Rename, 2, EIO);
+    LogCapture log;
+    EXPECT_EQ(createCode(), kQRNErrorRemoveStagingFailed);
+    EXPECT_TRUE(log.contains("Failed to remove staging dir:")) << log.all();
+    EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
+    EXPECT_EQ(namesIn(stagingDirectory(kClass)).size(), 1u);
+    expectGlobalLockFree();
+}
+
+TEST_F(CreateFailureTest, OldTransientContainerThatCannotBeRemovedStopsTheCreation) {
+    ASSERT_EQ(createCode(true), kQRNErrorNone);
+    const auto before = namesIn(classDirectory(kClass, true));
+    ASSERT_EQ(before.size(), 1u);
+    env_->failCallsFrom(EnvCall::Rename, 1, EIO);
+    LogCapture log;
+    EXPECT_EQ(createCode(true), kQRNErrorRemoveTransientFailed);
+    EXPECT_TRUE(log.contains("Failed to remove transient container at")) << log.all();
+    EXPECT_EQ(namesIn(classDirectory(kClass, true)), before);
+    EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
+    expectGlobalLockFree();
+}
+
+TEST_F(CreateFailureTest, CacheThatRefusesTheNewContainerLeavesItInPlace) {
+    // Just before the container moves into place its cache entry is dropped
+    // and the class directory can no longer be listed, so inserting fails.
+    const std::uint64_t moveIntoPlace = env_->count(EnvCall::Rename) + 2;
+    env_->setHook([this, moveIntoPlace](EnvCall call, std::uint64_t number) {
+        if (call == EnvCall::Rename && number == moveIntoPlace) {
+            QRNContainerCache::sharedInstance().invalidateUserIdentity(user());
+            env_->failCallsFrom(EnvCall::OpenDir, 1, EIO);
+        }
+    });
+    LogCapture log;
+    EXPECT_EQ(createCode(), kQRNErrorCacheAddFailed);
+    EXPECT_TRUE(log.contains("Failed to add to cache : ")) << log.all();
+    EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
+    EXPECT_TRUE(namesOnDeathRow().empty());
+    expectGlobalLockFree();
+
+    // Once the directory can be read again the container is found there.
+    env_->setHook(nullptr);
+    env_->clearFailures();
+    EXPECT_EQ(codeOf(*privileged(), kClientBundle, kClass), kQRNErrorNone);
 }
 
 } // namespace
