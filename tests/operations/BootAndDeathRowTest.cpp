@@ -1,0 +1,381 @@
+// Death row and the boot passes on a temporary root: how items are parked
+// and destroyed, what the boot cleanups sentence and keep, and how restored
+// system containers are merged at first boot.
+
+#include "CreateFixture.h"
+
+#include "Daemon/model/QRNContainerCache.h"
+#include "Daemon/model/QRNContainerClass.h"
+#include "Daemon/model/QRNGlobalConfiguration.h"
+#include "Daemon/platform/SandboxKernel.h"
+#include "Daemon/support/ProcessTransaction.h"
+#include "Daemon/support/Queue.h"
+#include "Daemon/support/UUID.h"
+
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+#include <fstream>
+#include <future>
+#include <map>
+#include <set>
+#include <sstream>
+
+using namespace quarn;
+using namespace quarn::test;
+namespace fs = std::filesystem;
+
+namespace {
+
+std::size_t entriesIn(const fs::path& directory) {
+    return fs::exists(directory) ? std::distance(fs::directory_iterator(directory), {}) : 0;
+}
+
+std::string read(const fs::path& file) {
+    std::stringstream contents;
+    contents << std::ifstream(file).rdbuf();
+    return contents.str();
+}
+
+void write(const fs::path& file, const std::string& contents) {
+    fs::create_directories(file.parent_path());
+    std::ofstream(file) << contents;
+}
+
+class DeathRowTest : public CreateFixture {
+protected:
+    DeathRowTest() : CreateFixture(false) {}
+
+    static std::shared_ptr<Queue> background() {
+        return QRNClientConnection::_sharedDeathrowBackgroundQueue();
+    }
+    static QRNGlobalConfiguration& configuration() {
+        return QRNGlobalConfiguration::sharedInstance();
+    }
+    fs::path makeFile(const std::string& absolute) {
+        root_.writeFile(absolute, absolute);
+        return root_ / absolute;
+    }
+    // Runs one pass to its end (transaction closed) and answers its error.
+    static std::optional<Error> runPass() {
+        std::promise<std::optional<Error>> done;
+        shared().deleteContainersOnDeathRowWithCompletion(
+            [&done](std::optional<Error> error) { done.set_value(std::move(error)); });
+        std::optional<Error> error = done.get_future().get();
+        drainBackground();
+        return error;
+    }
+    // Runs a boot cleanup to its end: the completion, then every queued
+    // block; `check` runs inside the completion. Answers the completion count.
+    static int runCleanup(bool firstBoot, std::function<void()> check = {}) {
+        std::atomic<int> calls{0};
+        std::promise<void> done;
+        auto completion = [&] {
+            if (check && calls == 0) {
+                check();
+            }
+            if (++calls == 1) {
+                done.set_value();
+            }
+        };
+        if (firstBoot) {
+            shared().rebootQuarnManagerCleanupWithCompletion(completion);
+        } else {
+            shared().quarnManagerCleanupWithCompletion(completion);
+        }
+        done.get_future().wait();
+        drainBackground();
+        return calls;
+    }
+};
+
+TEST_F(DeathRowTest, MovesParkEachItemInItsOwnDirectoryAndMissingItemsStartNothing) {
+    const std::size_t open = ProcessTransaction::count();
+    background()->suspend(); // passes wait, so death row can be looked at
+    EXPECT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / "/private/var/gone", true, true));
+    EXPECT_EQ(entriesIn(deathRow()), 0u) << "no unique directory is left for a missing item";
+    EXPECT_EQ(ProcessTransaction::count(), open) << "a missing item started a pass";
+
+    // Same last component from two places, at once.
+    fs::path a = makeFile("/private/var/a/Data");
+    fs::path b = makeFile("/private/var/b/Data");
+    auto moveA = std::async(std::launch::async,
+                            [&] { return shared()._moveItemAtURLToDeathRow(a, false, false); });
+    EXPECT_TRUE(shared()._moveItemAtURLToDeathRow(b, false, true));
+    EXPECT_TRUE(moveA.get());
+    EXPECT_EQ(ProcessTransaction::count(), open + 1) << "one pass wanted";
+    const std::vector<std::string> uniques = namesIn(deathRow());
+    EXPECT_EQ(uniques.size(), 2u);
+    for (const std::string& unique : uniques) {
+        EXPECT_EQ(unique.rfind("temp.", 0), 0u) << unique;
+        EXPECT_TRUE(fs::exists(deathRow() / unique / "Data"));
+    }
+    EXPECT_FALSE(fs::exists(a) || fs::exists(b));
+
+    background()->resume();
+    drainBackground();
+    EXPECT_EQ(ProcessTransaction::count(), open);
+    EXPECT_EQ(entriesIn(deathRow()), 0u) << "the pass destroyed everything parked";
+}
+
+TEST_F(DeathRowTest, PassDestroysImmutableFilesAndClosesItsTransactionAfterTheCompletion) {
+    fs::path file = makeFile("/private/var/locked/Library/pinned");
+    int fd = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    int flags = 0;
+    bool immutable = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
+    flags |= FS_IMMUTABLE_FL;
+    immutable = immutable && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+    const int setError = errno;
+    ::close(fd);
+    if (!immutable) {
+        GTEST_SKIP() << "this file system refuses the immutable flag: " << std::strerror(setError);
+    }
+    ASSERT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / "/private/var/locked", true, false));
+
+    const std::size_t open = ProcessTransaction::count();
+    std::promise<std::size_t> openDuringCompletion;
+    shared().deleteContainersOnDeathRowWithCompletion([&](std::optional<Error> error) {
+        EXPECT_FALSE(error.has_value()) << error->description();
+        openDuringCompletion.set_value(ProcessTransaction::count());
+    });
+    EXPECT_EQ(openDuringCompletion.get_future().get(), open + 1);
+    drainBackground();
+    EXPECT_EQ(ProcessTransaction::count(), open);
+    EXPECT_EQ(entriesIn(deathRow()), 0u);
+    EXPECT_EQ(entriesIn(root_ / "/tmp"), 0u) << "destroyed, not moved aside";
+}
+
+TEST_F(DeathRowTest, PassMovesUndeletableItemsToTmpAndGoesOnAfterAFailure) {
+    fs::remove(deathRow());
+    EXPECT_FALSE(runPass().has_value()) << "a missing death row is nothing to do";
+    fs::create_directories(deathRow());
+    fs::create_directories(root_ / "/tmp");
+    for (std::string dir : {"/private/var/one", "/private/var/two"}) {
+        makeFile(dir + "/file");
+        ASSERT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / dir, true, false));
+    }
+    // Nothing can be unlinked, and the first move aside fails too.
+    env_->failCallsFrom(EnvCall::Unlink, 1, EBUSY);
+    env_->failCall(EnvCall::Rename, 1, EIO);
+    LogCapture log;
+    std::optional<Error> error = runPass();
+    env_->clearFailures();
+
+    ASSERT_TRUE(error.has_value());
+    EXPECT_TRUE(error->isQRN(kQRNErrorDestroyFailed));
+    EXPECT_EQ(log.count("Failed to destroy item at:"), 1u) << log.all();
+    EXPECT_EQ(entriesIn(deathRow()), 1u) << "the failed item stays on death row";
+    EXPECT_EQ(entriesIn(root_ / "/tmp"), 1u) << "the other went to /tmp below the root";
+    EXPECT_FALSE(runPass().has_value());
+    EXPECT_EQ(entriesIn(deathRow()), 0u);
+}
+
+TEST_F(DeathRowTest, SystemContainersGetNewDirectoriesExceptWellKnownAndAnalytics) {
+    auto cachedNow = [](const QRNMetadataPtr& metadata) {
+        auto found = QRNContainerCache::sharedInstance().containerForContainerIdentity(
+            metadata->containerIdentity());
+        return found ? *found : nullptr;
+    };
+    // Identifier -> whether its directory must stay.
+    const std::map<std::string, bool> kept = {
+        {"com.example.systemd", false},
+        {"com.orvex.devicesettings", true},
+        {"systemgroup.com.example.shared", false},
+        {"systemgroup.com.orvex.deviceprofiles", true},
+        {"systemgroup.com.orvex.osanalytics", true},
+    };
+    std::map<std::string, QRNMetadataPtr> before;
+    for (const auto& [identifier, keep] : kept) {
+        before[identifier] = create(identifier, identifier.starts_with("systemgroup.")
+                                                    ? kQRNContainerClassSystemGroup
+                                                    : kQRNContainerClassSystemData);
+        ASSERT_TRUE(before[identifier]);
+    }
+    shared()._regenerateAllSystemContainerPaths();
+
+    for (const auto& [identifier, old] : before) {
+        QRNMetadataPtr now = cachedNow(old);
+        ASSERT_TRUE(now) << identifier;
+        EXPECT_EQ(now->url() == old->url(), kept.at(identifier)) << identifier;
+        EXPECT_EQ(fs::exists(old->url()), kept.at(identifier)) << identifier;
+        EXPECT_TRUE(fs::exists(now->url() / QRNMetadata::kFileName)) << identifier;
+        EXPECT_EQ(now->url().parent_path(), old->url().parent_path());
+    }
+    // The sandbox follows the system data container to its new directory.
+    std::string mapped;
+    root_.context().instance<SandboxKernel>().forEachItem(0, [&](const SandboxItem& item) {
+        mapped = item.identifier == "com.example.systemd" ? item.path : mapped;
+        return true;
+    });
+    EXPECT_EQ(mapped, cachedNow(before["com.example.systemd"])->url().string());
+    // A cache rebuilt from disk finds every container where it now is.
+    QRNContainerCache::sharedInstance().invalidateUserIdentity(user());
+    for (const auto& [identifier, old] : before) {
+        EXPECT_TRUE(cachedNow(old)) << identifier;
+    }
+}
+
+using BootCleanupTest = DeathRowTest;
+
+TEST_F(BootCleanupTest, StagingLeftoversAreDestroyedAndTheCompletionRunsOnceAfterThem) {
+    const fs::path global = makeTree(configuration().stagingDirectory() / "global-leftover");
+    const fs::path perUser = makeTree(stagingDirectory(kQRNContainerClassAppData) / "leftover");
+    LogCapture log;
+    const int calls = runCleanup(false, [&] {
+        EXPECT_FALSE(fs::exists(global)) << "completion ran before the moves";
+        EXPECT_TRUE(namesOnDeathRow().empty()) << "completion ran before the deletion pass";
+    });
+    EXPECT_EQ(calls, 1);
+    EXPECT_FALSE(fs::exists(global) || fs::exists(perUser));
+    EXPECT_TRUE(namesOnDeathRow().empty());
+    EXPECT_FALSE(log.contains("Failed to get items")) << log.all();
+}
+
+TEST_F(BootCleanupTest, MissingStagingIsSilentAndAnUnreadableOneDoesNotStopTheOthers) {
+    const fs::path global = configuration().stagingDirectory();
+    const fs::path perUser = stagingDirectory(kQRNContainerClassAppData) / "leftover";
+    fs::remove_all(global);
+    for (bool unreadable : {false, true}) {
+        SCOPED_TRACE(unreadable ? "a file where the directory should be" : "missing");
+        if (unreadable) {
+            std::ofstream(global) << "not a directory";
+        }
+        makeTree(perUser);
+        LogCapture log;
+        EXPECT_EQ(runCleanup(false), 1);
+        EXPECT_EQ(log.contains(unreadable
+                                   ? "Failed to get items at global staging URL: " + global.string()
+                                   : std::string("staging URL")),
+                  unreadable)
+            << log.all();
+        EXPECT_FALSE(fs::exists(perUser)) << "the per-user staging was not cleaned";
+    }
+    EXPECT_TRUE(fs::exists(global)) << "the unreadable item itself is left alone";
+}
+
+TEST_F(BootCleanupTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsContainers) {
+    QRNMetadataPtr kept = create("com.example.kept", kQRNContainerClassAppData);
+    ASSERT_TRUE(kept);
+    const std::string orphanName = UUID::random().string();
+    const fs::path orphan = makeTree(classDirectory(kQRNContainerClassAppData) / orphanName);
+    const fs::path junk = makeTree(classDirectory(kQRNContainerClassAppData) / "not-a-uuid");
+    makeTree(configuration().transientDirectory() / "old-system-transient");
+    makeTree(configuration().transientBundleDirectory() / "old-bundle-transient");
+    auto perUser = configuration().getPerUserConfigurationForUserIdentity(user());
+    makeTree(perUser->transientDirectory() / "old-user-transient");
+
+    LogCapture log;
+    const int calls = runCleanup(
+        true, [&] { EXPECT_FALSE(fs::exists(orphan)) << "completion ran before the orphan pass"; });
+    EXPECT_EQ(calls, 1);
+    EXPECT_TRUE(fs::exists(kept->url() / QRNMetadata::kFileName));
+    EXPECT_FALSE(fs::exists(junk));
+    EXPECT_FALSE(fs::exists(configuration().transientDirectory()));
+    EXPECT_FALSE(fs::exists(configuration().transientBundleDirectory()));
+    EXPECT_FALSE(fs::exists(perUser->transientDirectory()));
+    const std::vector<std::string> parked = namesOnDeathRow();
+    const std::set<std::string> parkedSet(parked.begin(), parked.end());
+    for (const std::string& name : {orphanName, std::string("not-a-uuid"), std::string("Temp")}) {
+        EXPECT_TRUE(parkedSet.count(name)) << name << " not on death row";
+    }
+    EXPECT_EQ(parkedSet.count(kept->url().filename().string()), 0u);
+    EXPECT_EQ(log.count("Deleting orphaned data missing a metadata file at: "), 1u)
+        << "only the UUID-named orphan is reported so; " << log.all();
+    EXPECT_FALSE(log.contains("Failed to")) << log.all();
+
+    // The next boot cleanup destroys what the first-boot one parked.
+    EXPECT_EQ(runCleanup(false), 1);
+    EXPECT_TRUE(namesOnDeathRow().empty());
+}
+
+TEST_F(BootCleanupTest, OrphanPassSkipsVanishedEntriesAndExplainsOnInternalBuilds) {
+    configuration().setIsInternalImage(true);
+    const fs::path classDir = classDirectory(kQRNContainerClassAppGroup);
+    const fs::path orphan = makeTree(classDir / UUID::random().string());
+    const fs::path gone = classDir / UUID::random().string();
+    LogCapture log;
+    shared()._cleanupOrphanedDataForDirectories({gone, orphan}, kQRNContainerClassAppGroup);
+    EXPECT_TRUE(
+        log.contains("Ignoring deleted container path during cleanup: [" + gone.string() + "]"));
+    EXPECT_TRUE(log.contains("Here are the invalid files:"));
+    EXPECT_TRUE(log.contains("***END INTERNAL BUILD REQUEST"));
+    EXPECT_FALSE(fs::exists(orphan));
+}
+
+// First-boot setup: system containers restored from a backup are merged
+// into the live containers of their identifiers.
+class BootSetupTest : public DeathRowTest {
+protected:
+    fs::path live(const std::string& identifier, std::uint64_t cls) {
+        QRNMetadataPtr made = create(identifier, cls);
+        return made ? made->url() : fs::path();
+    }
+    std::shared_ptr<QRNPerUserConfiguration> perUser_ =
+        configuration().getPerUserConfigurationForUserIdentity(user());
+    const fs::path backupBase_ = perUser_->systemContainerBackupBaseDirectory();
+    const fs::path dataBackup_ = perUser_->systemContainerBackupDirectory();
+};
+
+TEST_F(BootSetupTest, RestoredContainersAreMergedIntoTheLiveOnesAndTheBackupRemoved) {
+    const fs::path existing = live("com.example.sysd", kQRNContainerClassSystemData);
+    write(existing / "settings.plist", "old");
+    write(existing / "local-only", "stays");
+    write(dataBackup_ / "com.example.sysd" / "settings.plist", "restored");
+    write(dataBackup_ / "com.example.sysd" / "Library" / "Preferences" / "p.plist", "prefs");
+    write(dataBackup_ / "com.example.sysd" / QRNMetadata::kFileName, "not metadata");
+    write(perUser_->systemGroupContainerBackupDirectory() / "systemgroup.com.example.shared" /
+              "shared.db",
+          "group");
+
+    LogCapture log;
+    shared().rebootQuarnManagerSetup();
+
+    EXPECT_EQ(read(existing / "settings.plist"), "restored");
+    EXPECT_EQ(read(existing / "local-only"), "stays");
+    EXPECT_EQ(read(existing / "Library" / "Preferences" / "p.plist"), "prefs");
+    EXPECT_TRUE(fs::is_directory(existing / "Library" / "Caches")) << "structure not recreated";
+    EXPECT_NE(read(existing / QRNMetadata::kFileName), "not metadata");
+    EXPECT_EQ(live("com.example.sysd", kQRNContainerClassSystemData), existing);
+    EXPECT_EQ(
+        read(live("systemgroup.com.example.shared", kQRNContainerClassSystemGroup) / "shared.db"),
+        "group");
+    EXPECT_TRUE(log.contains("Installing system containers"));
+    EXPECT_TRUE(log.contains("Installing system group containers"));
+    EXPECT_TRUE(log.contains("Restoring container for com.example.sysd at "));
+    EXPECT_FALSE(log.contains("Error processing")) << log.all();
+    EXPECT_FALSE(fs::exists(backupBase_)) << "not an internal build: the backup goes";
+}
+
+TEST_F(BootSetupTest, AnItemThatCannotBeMergedIsSetAsideAndTheOthersStillInstalled) {
+    configuration().setIsInternalImage(true);
+    write(dataBackup_ / "com.example.broken", "a file, not a container");
+    write(dataBackup_ / "com.example.fine" / "data", "fine");
+    // A stale "inprogress" from a start cut short is replaced.
+    write(fs::path(dataBackup_.string() + ".inprogress") / "com.example.stale" / "x", "stale");
+
+    LogCapture log;
+    shared().rebootQuarnManagerSetup();
+
+    EXPECT_TRUE(log.contains("Error processing restored system container")) << log.all();
+    EXPECT_EQ(read(backupBase_ / "Data.failed" / "com.example.broken"), "a file, not a container");
+    EXPECT_EQ(read(live("com.example.fine", kQRNContainerClassSystemData) / "data"), "fine");
+    EXPECT_FALSE(fs::exists(backupBase_ / "Data.inprogress" / "com.example.stale"));
+    EXPECT_FALSE(fs::exists(dataBackup_));
+    EXPECT_TRUE(fs::exists(backupBase_)) << "internal builds keep the backup for inspection";
+}
+
+TEST_F(BootSetupTest, WithoutBackupsNothingIsMadeOrInstalled) {
+    configuration().setIsInternalImage(true);
+    LogCapture log;
+    shared().rebootQuarnManagerSetup();
+    shared().quarnManagerSetup();
+    EXPECT_FALSE(fs::exists(backupBase_));
+    EXPECT_FALSE(log.contains("Installing")) << log.all();
+}
+
+} // namespace
