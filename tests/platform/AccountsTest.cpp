@@ -7,7 +7,6 @@
 #include <string>
 
 using namespace quarn;
-using quarn::test::TempRoot;
 
 namespace {
 
@@ -16,65 +15,33 @@ protected:
     LinuxAccounts accounts() const { return LinuxAccounts(Paths(root_.path())); }
 };
 
-std::vector<std::string> membersNamed(const std::string& prefix, int count) {
-    std::vector<std::string> names;
-    for (int i = 0; i < count; ++i) {
-        names.push_back(prefix + std::to_string(i));
-    }
-    return names;
-}
-
-std::string joined(const std::vector<std::string>& names) {
-    std::string out;
-    for (const auto& n : names) {
-        out += (out.empty() ? "" : ",") + n;
-    }
-    return out;
-}
-
 } // namespace
 
-TEST_F(AccountsOnTempRoot, FindsTheRootsOwnUsersWithHomesBelowTheRoot) {
+TEST_F(AccountsOnTempRoot, FindsTheRootsOwnUsersAndGroupsWithHomesBelowTheRoot) {
     auto& installed = root_.context().instance<Accounts>();
-    auto byName = installed.userByName("mobile");
-    ASSERT_TRUE(byName);
-    EXPECT_EQ(byName->uid, 501u);
-    EXPECT_EQ(byName->gid, 501u);
-    EXPECT_EQ(byName->homeDirectory, root_.path() / "private/var/mobile");
-
-    auto byUID = installed.userByUID(501);
-    ASSERT_TRUE(byUID);
-    EXPECT_EQ(byUID->name, "mobile");
+    auto mobile = installed.userByName("mobile");
+    ASSERT_TRUE(mobile);
+    EXPECT_EQ(std::tie(mobile->uid, mobile->gid), std::make_tuple(501u, 501u));
+    EXPECT_EQ(mobile->homeDirectory, root_.path() / "private/var/mobile");
+    EXPECT_EQ(installed.userByUID(501)->name, "mobile");
     // uid 0 of the temp root, not of the host.
-    auto root = installed.userByUID(0);
-    ASSERT_TRUE(root);
-    EXPECT_EQ(root->homeDirectory, root_.path() / "private/var/root");
-    auto installer = installed.userByName("_installd");
-    ASSERT_TRUE(installer);
-    EXPECT_EQ(installer->uid, 33u);
-
-    EXPECT_FALSE(installed.userByName("nobody-here"));
+    EXPECT_EQ(installed.userByUID(0)->homeDirectory, root_.path() / "private/var/root");
+    EXPECT_EQ(installed.userByName("_installd")->uid, 33u);
     EXPECT_FALSE(installed.userByUID(4242));
-    EXPECT_FALSE(installed.userByName(""));
-    EXPECT_FALSE(installed.userByName(std::string_view("mobile\0x", 8)));
-    EXPECT_FALSE(installed.userByName("mobil"));
-}
+    for (std::string_view name : std::initializer_list<std::string_view>{
+             "nobody-here", "", "mobil", std::string_view("mobile\0x", 8)}) {
+        EXPECT_FALSE(installed.userByName(name)) << name;
+    }
 
-TEST_F(AccountsOnTempRoot, FindsGroupsWithTheirMembers) {
-    auto a = accounts();
-    auto byName = a.groupByName("systemusers");
-    ASSERT_TRUE(byName);
-    EXPECT_EQ(byName->gid, quarn::test::kSystemUsersGID);
-    EXPECT_EQ(byName->members, std::vector<std::string>{"mobile"});
-
-    auto byGID = a.groupByGID(quarn::test::kSystemUsersGID);
-    ASSERT_TRUE(byGID);
-    EXPECT_EQ(byGID->name, "systemusers");
-    EXPECT_TRUE(a.groupByGID(0)->members.empty());
-
-    EXPECT_FALSE(a.groupByName("staff"));
-    EXPECT_FALSE(a.groupByGID(7777));
-    EXPECT_FALSE(a.groupByName(""));
+    auto group = installed.groupByName("systemusers");
+    ASSERT_TRUE(group);
+    EXPECT_EQ(group->gid, quarn::test::kSystemUsersGID);
+    EXPECT_EQ(group->members, std::vector<std::string>{"mobile"});
+    EXPECT_EQ(installed.groupByGID(quarn::test::kSystemUsersGID)->name, "systemusers");
+    EXPECT_TRUE(installed.groupByGID(0)->members.empty());
+    EXPECT_FALSE(installed.groupByName("staff"));
+    EXPECT_FALSE(installed.groupByGID(7777));
+    EXPECT_FALSE(installed.groupByName(""));
 }
 
 TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndKeepsReading) {
@@ -99,14 +66,11 @@ TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndKeepsReading) {
     for (const char* name : {"nouid", "alpha", "huge", "short", "+compat", "compat", "garbage"}) {
         EXPECT_FALSE(a.userByName(name)) << name;
     }
-    EXPECT_FALSE(a.userByUID(9));  // nameless entry
-    EXPECT_FALSE(a.userByUID(10)); // compat marker
-    EXPECT_FALSE(a.userByUID(12));
-
-    auto group = a.groupByGID(1501);
-    ASSERT_TRUE(group);
-    EXPECT_EQ(group->name, "systemusers");
-    EXPECT_EQ(group->members, (std::vector<std::string>{"mobile", "other"}));
+    for (uid_t uid : {9, 10, 12}) { // nameless, compat marker, bad uid
+        EXPECT_FALSE(a.userByUID(uid)) << uid;
+    }
+    EXPECT_EQ(a.groupByGID(1501)->name, "systemusers");
+    EXPECT_EQ(a.groupByGID(1501)->members, (std::vector<std::string>{"mobile", "other"}));
     EXPECT_FALSE(a.groupByName("nogid"));
 }
 
@@ -116,43 +80,40 @@ TEST_F(AccountsOnTempRoot, HomesThatLeaveTheRootOrAreMissingAreEmpty) {
                                    "emptyhome:x:602:602:::\n"
                                    "relative:x:603:603::var/rel:/bin/sh\n");
     auto a = accounts();
-    ASSERT_TRUE(a.userByUID(600));
-    EXPECT_TRUE(a.userByUID(600)->homeDirectory.empty());
-    EXPECT_TRUE(a.userByName("nohome")->homeDirectory.empty());
-    EXPECT_TRUE(a.userByName("emptyhome")->homeDirectory.empty());
+    for (const char* name : {"escape", "nohome", "emptyhome"}) {
+        ASSERT_TRUE(a.userByName(name)) << name;
+        EXPECT_TRUE(a.userByName(name)->homeDirectory.empty()) << name;
+    }
     EXPECT_EQ(a.userByName("relative")->homeDirectory, root_.path() / "var/rel");
 }
 
 TEST_F(AccountsOnTempRoot, EntriesLongerThanTheFirstBufferAreReadWhole) {
-    auto many = membersNamed("member-with-a-long-name-", 3000); // ~80 KiB on one line
-    root_.writeFile("/etc/group", "before:x:10:a\n"
-                                  "crowd:x:11:" +
-                                      joined(many) +
-                                      "\n"
-                                      "after:x:12:b\n");
+    std::vector<std::string> many; // ~80 KiB on one line
+    std::string line = "crowd:x:11:";
+    for (int i = 0; i < 3000; ++i) {
+        many.push_back("member-with-a-long-name-" + std::to_string(i));
+        line += (i ? "," : "") + many.back();
+    }
+    root_.writeFile("/etc/group", "before:x:10:a\n" + line + "\nafter:x:12:b\n");
     const std::string longHome = "/private/var/" + std::string(5000, 'h');
     root_.writeFile("/etc/passwd",
                     "long:x:700:700::" + longHome + ":/bin/sh\nnext:x:701:701::/n:\n");
     auto a = accounts();
-    auto crowd = a.groupByName("crowd");
-    ASSERT_TRUE(crowd);
-    EXPECT_EQ(crowd->members, many);
+    EXPECT_EQ(a.groupByName("crowd")->members, many);
     EXPECT_EQ(a.groupByGID(12)->name, "after"); // the reader did not lose its place
     EXPECT_EQ(a.userByUID(700)->homeDirectory, root_ / longHome);
     EXPECT_EQ(a.userByName("next")->uid, 701u);
 }
 
-TEST(AccountsMissingFiles, AnswerNothing) {
-    TempRoot root;
-    std::filesystem::remove(root / "/etc/passwd");
-    std::filesystem::remove(root / "/etc/group");
-    LinuxAccounts a{Paths(root.path())};
+TEST_F(AccountsOnTempRoot, MissingOrUnreadableFilesAnswerNothing) {
+    std::filesystem::remove(root_ / "/etc/passwd");
+    std::filesystem::remove(root_ / "/etc/group");
+    auto a = accounts();
     EXPECT_FALSE(a.userByName("mobile"));
     EXPECT_FALSE(a.userByUID(0));
     EXPECT_FALSE(a.groupByName("systemusers"));
     EXPECT_FALSE(a.groupByGID(0));
-
-    std::filesystem::create_directory(root / "/etc/passwd"); // unreadable as a file
+    std::filesystem::create_directory(root_ / "/etc/passwd");
     EXPECT_FALSE(a.userByName("mobile"));
 }
 
@@ -160,10 +121,8 @@ TEST(AccountsOnSystemRoot, AsksTheNameServiceAndLeavesHomesAlone) {
     LinuxAccounts a{Paths("/")};
     auto root = a.userByUID(0);
     ASSERT_TRUE(root);
-    EXPECT_EQ(root->name, "root");
-    EXPECT_EQ(root->gid, 0u);
-    EXPECT_FALSE(root->homeDirectory.empty());
-    EXPECT_EQ(root->homeDirectory.string().front(), '/');
+    EXPECT_EQ(std::tie(root->name, root->gid), std::make_tuple("root", 0u));
+    EXPECT_EQ(root->homeDirectory.string().substr(0, 1), "/");
     EXPECT_EQ(a.userByName("root")->uid, 0u);
     auto wheel = a.groupByGID(0);
     ASSERT_TRUE(wheel);

@@ -14,14 +14,6 @@ namespace {
 
 using Bytes = std::vector<std::uint8_t>;
 
-Bytes bytes(std::initializer_list<int> list) {
-    Bytes out;
-    for (int b : list) {
-        out.push_back(static_cast<std::uint8_t>(b));
-    }
-    return out;
-}
-
 Bytes concat(Bytes a, const Bytes& b) {
     a.insert(a.end(), b.begin(), b.end());
     return a;
@@ -29,9 +21,7 @@ Bytes concat(Bytes a, const Bytes& b) {
 
 // `depth` arrays inside each other around a 0.
 Bytes nestedArrays(std::size_t depth) {
-    Bytes out(depth, 0x81);
-    out.push_back(0x00);
-    return out;
+    return concat(Bytes(depth, 0x81), Bytes{0x00});
 }
 
 Value everyKind() {
@@ -77,20 +67,20 @@ TEST(CborCodecTest, WireFormIsPlainCborOtherClientsCanRead) {
         raw[i] = static_cast<std::uint8_t>(i);
     }
     EXPECT_EQ(CborCodec::encode(Value(UUID(raw))),
-              concat(bytes({0xd8, 0x25, 0x50}), Bytes(raw.begin(), raw.end())));
+              concat(Bytes({0xd8, 0x25, 0x50}), Bytes(raw.begin(), raw.end())));
     EXPECT_EQ(CborCodec::encode(Value(Date{1500000})),
-              bytes({0xc1, 0xfb, 0x3f, 0xf8, 0, 0, 0, 0, 0, 0}));
+              Bytes({0xc1, 0xfb, 0x3f, 0xf8, 0, 0, 0, 0, 0, 0}));
     EXPECT_EQ(CborCodec::encode(Value(Value::Dictionary{{"a", Value(1u)}, {"b", Value(-1)}})),
-              bytes({0xa2, 0x61, 'a', 0x01, 0x61, 'b', 0x20}));
-    EXPECT_EQ(CborCodec::encode(Value()), bytes({0xf6}));
-    EXPECT_EQ(CborCodec::encode(Value(Value::Data{7})), bytes({0x41, 0x07}));
+              Bytes({0xa2, 0x61, 'a', 0x01, 0x61, 'b', 0x20}));
+    EXPECT_EQ(CborCodec::encode(Value()), Bytes({0xf6}));
+    EXPECT_EQ(CborCodec::encode(Value(Value::Data{7})), Bytes({0x41, 0x07}));
 
     // What other encoders may send: short floats, a date in whole seconds.
-    EXPECT_EQ(*CborCodec::decode(bytes({0xf9, 0x3e, 0x00})), Value(1.5));
-    EXPECT_EQ(*CborCodec::decode(bytes({0xfa, 0x3f, 0xc0, 0, 0})), Value(1.5));
-    EXPECT_EQ(*CborCodec::decode(bytes({0xc1, 0x1a, 0x65, 0x53, 0xf1, 0x00})),
+    EXPECT_EQ(*CborCodec::decode(Bytes({0xf9, 0x3e, 0x00})), Value(1.5));
+    EXPECT_EQ(*CborCodec::decode(Bytes({0xfa, 0x3f, 0xc0, 0, 0})), Value(1.5));
+    EXPECT_EQ(*CborCodec::decode(Bytes({0xc1, 0x1a, 0x65, 0x53, 0xf1, 0x00})),
               Value(Date{1700000000LL * 1000000}));
-    EXPECT_TRUE(CborCodec::decode(bytes({0xf6}))->isNone());
+    EXPECT_TRUE(CborCodec::decode(Bytes({0xf6}))->isNone());
 }
 
 TEST(CborCodecTest, EveryTruncationAndAnyTrailingByteIsRefused) {
@@ -99,7 +89,7 @@ TEST(CborCodecTest, EveryTruncationAndAnyTrailingByteIsRefused) {
         const std::span<const std::uint8_t> prefix(valid.data(), length);
         EXPECT_FALSE(CborCodec::decode(prefix)) << "prefix of " << length << " bytes";
     }
-    const auto trailing = CborCodec::decode(concat(valid, bytes({0x00})));
+    const auto trailing = CborCodec::decode(concat(valid, Bytes({0x00})));
     ASSERT_FALSE(trailing);
     EXPECT_NE(trailing.error().message.find("follow the value"), std::string::npos);
 }
@@ -110,7 +100,7 @@ TEST(CborCodecTest, NestingAndSizeLimits) {
     EXPECT_TRUE(CborCodec::decode(nestedArrays(3), {.maxBytes = 64, .maxNesting = 3}));
     EXPECT_FALSE(CborCodec::decode(nestedArrays(4), {.maxBytes = 64, .maxNesting = 3}));
     // Maps count as nesting too.
-    EXPECT_FALSE(CborCodec::decode(bytes({0xa1, 0x61, 'k', 0x81, 0x81, 0x00}),
+    EXPECT_FALSE(CborCodec::decode(Bytes({0xa1, 0x61, 'k', 0x81, 0x81, 0x00}),
                                    {.maxBytes = 64, .maxNesting = 2}));
 
     const Bytes text = CborCodec::encode(Value(std::string(20, 'x')));
@@ -126,40 +116,40 @@ TEST(CborCodecTest, MalformedInputIsRefusedForItsReason) {
     };
     const Case cases[] = {
         {"empty", {}, "ends after 0 bytes"},
-        {"array of 2^64-6 items", bytes({0x9b, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xfa}),
+        {"array of 2^64-6 items", Bytes({0x9b, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xfa}),
          "declares"},
-        {"map of 2^32 pairs", bytes({0xbb, 0, 0, 0, 1, 0, 0, 0, 0, 0x00}), "declares"},
-        {"array of 9 in 8 bytes", bytes({0x89, 1, 2, 3, 4, 5, 6, 7}), "declares"},
+        {"map of 2^32 pairs", Bytes({0xbb, 0, 0, 0, 1, 0, 0, 0, 0, 0x00}), "declares"},
+        {"array of 9 in 8 bytes", Bytes({0x89, 1, 2, 3, 4, 5, 6, 7}), "declares"},
         {"inner array longer than the rest",
-         bytes({0x82, 0x83, 0x01, 0x02, 0x03, 0x84, 0x01, 0x02, 0x03}), "declares"},
-        {"array and its siblings longer than the rest", bytes({0x85, 0x84, 0, 0, 0, 0}),
+         Bytes({0x82, 0x83, 0x01, 0x02, 0x03, 0x84, 0x01, 0x02, 0x03}), "declares"},
+        {"array and its siblings longer than the rest", Bytes({0x85, 0x84, 0, 0, 0, 0}),
          "declares"},
-        {"byte string of 2^40", bytes({0x5b, 0, 0, 1, 0, 0, 0, 0, 0, 0x00}), "ends inside"},
-        {"text of 2^32-1", bytes({0x7a, 0xff, 0xff, 0xff, 0xff, 'a'}), "ends inside"},
-        {"integer key", bytes({0xa1, 0x01, 0x02}), "not text"},
-        {"byte string key", bytes({0xa1, 0x41, 0x00, 0x02}), "not text"},
-        {"array key", bytes({0xa1, 0x80, 0x02}), "not text"},
-        {"tagged key", bytes({0xa1, 0xc1, 0x00, 0x02}), "tagged"},
-        {"duplicate key", bytes({0xa2, 0x61, 'a', 0x01, 0x61, 'a', 0x02}), "twice"},
-        {"unknown tag", bytes({0xc2, 0x41, 0x00}), "tag 2"},
-        {"UUID of 15 bytes", concat(bytes({0xd8, 0x25, 0x4f}), Bytes(15, 0)), "16 bytes"},
-        {"UUID as text", concat(bytes({0xd8, 0x25, 0x70}), Bytes(16, 'a')), "16 bytes"},
-        {"date over text", bytes({0xc1, 0x61, '1'}), "no time"},
-        {"date over NaN", bytes({0xc1, 0xf9, 0x7e, 0x00}), "no time"},
-        {"date beyond range", bytes({0xc1, 0x1b, 0x7f, 0, 0, 0, 0, 0, 0, 0}), "no time"},
-        {"tag over tag", bytes({0xc1, 0xc1, 0x00}), "another tag"},
-        {"tag over array", bytes({0xd8, 0x25, 0x80}), "over an array"},
-        {"indefinite array", bytes({0x9f, 0xff}), "indefinite"},
-        {"indefinite map", bytes({0xbf, 0xff}), "indefinite"},
-        {"indefinite text", bytes({0x7f, 0xff}), "indefinite"},
-        {"lone break", bytes({0xff}), "indefinite"},
-        {"undefined", bytes({0xf7}), "undefined"},
-        {"simple value", bytes({0xf8, 0x20}), "malformed"},
-        {"reserved head", bytes({0x1c}), "malformed"},
-        {"integer below int64", bytes({0x3b, 0x80, 0, 0, 0, 0, 0, 0, 0}), "below"},
-        {"bad UTF-8", bytes({0x62, 0xc3, 0x28}), "UTF-8"},
-        {"overlong UTF-8", bytes({0x62, 0xc0, 0x80}), "UTF-8"},
-        {"UTF-8 surrogate", bytes({0x63, 0xed, 0xa0, 0x80}), "UTF-8"},
+        {"byte string of 2^40", Bytes({0x5b, 0, 0, 1, 0, 0, 0, 0, 0, 0x00}), "ends inside"},
+        {"text of 2^32-1", Bytes({0x7a, 0xff, 0xff, 0xff, 0xff, 'a'}), "ends inside"},
+        {"integer key", Bytes({0xa1, 0x01, 0x02}), "not text"},
+        {"byte string key", Bytes({0xa1, 0x41, 0x00, 0x02}), "not text"},
+        {"array key", Bytes({0xa1, 0x80, 0x02}), "not text"},
+        {"tagged key", Bytes({0xa1, 0xc1, 0x00, 0x02}), "tagged"},
+        {"duplicate key", Bytes({0xa2, 0x61, 'a', 0x01, 0x61, 'a', 0x02}), "twice"},
+        {"unknown tag", Bytes({0xc2, 0x41, 0x00}), "tag 2"},
+        {"UUID of 15 bytes", concat(Bytes({0xd8, 0x25, 0x4f}), Bytes(15, 0)), "16 bytes"},
+        {"UUID as text", concat(Bytes({0xd8, 0x25, 0x70}), Bytes(16, 'a')), "16 bytes"},
+        {"date over text", Bytes({0xc1, 0x61, '1'}), "no time"},
+        {"date over NaN", Bytes({0xc1, 0xf9, 0x7e, 0x00}), "no time"},
+        {"date beyond range", Bytes({0xc1, 0x1b, 0x7f, 0, 0, 0, 0, 0, 0, 0}), "no time"},
+        {"tag over tag", Bytes({0xc1, 0xc1, 0x00}), "another tag"},
+        {"tag over array", Bytes({0xd8, 0x25, 0x80}), "over an array"},
+        {"indefinite array", Bytes({0x9f, 0xff}), "indefinite"},
+        {"indefinite map", Bytes({0xbf, 0xff}), "indefinite"},
+        {"indefinite text", Bytes({0x7f, 0xff}), "indefinite"},
+        {"lone break", Bytes({0xff}), "indefinite"},
+        {"undefined", Bytes({0xf7}), "undefined"},
+        {"simple value", Bytes({0xf8, 0x20}), "malformed"},
+        {"reserved head", Bytes({0x1c}), "malformed"},
+        {"integer below int64", Bytes({0x3b, 0x80, 0, 0, 0, 0, 0, 0, 0}), "below"},
+        {"bad UTF-8", Bytes({0x62, 0xc3, 0x28}), "UTF-8"},
+        {"overlong UTF-8", Bytes({0x62, 0xc0, 0x80}), "UTF-8"},
+        {"UTF-8 surrogate", Bytes({0x63, 0xed, 0xa0, 0x80}), "UTF-8"},
     };
     for (const auto& c : cases) {
         const auto decoded = CborCodec::decode(c.input);

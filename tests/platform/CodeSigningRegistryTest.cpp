@@ -19,7 +19,6 @@
 
 #include <atomic>
 #include <fstream>
-#include <sstream>
 #include <thread>
 #include <vector>
 
@@ -33,17 +32,26 @@ std::string hexOf(const ExecutableDigestCache::Digest& digest) {
     return hex;
 }
 
-std::string sha256Hex(std::istream&& in) {
-    crypto_hash_sha256_state state;
-    crypto_hash_sha256_init(&state);
-    std::vector<char> chunk(1 << 20);
-    while (in.read(chunk.data(), static_cast<std::streamsize>(chunk.size())) || in.gcount() > 0) {
-        crypto_hash_sha256_update(&state, reinterpret_cast<const unsigned char*>(chunk.data()),
-                                  static_cast<unsigned long long>(in.gcount()));
-    }
+std::string sha256Hex(const std::string& bytes) {
     ExecutableDigestCache::Digest digest;
-    crypto_hash_sha256_final(&state, digest.data());
+    crypto_hash_sha256(digest.data(), reinterpret_cast<const unsigned char*>(bytes.data()),
+                       bytes.size());
     return hexOf(digest);
+}
+
+Value entry(std::string program, std::string identifier) {
+    return Value(
+        Value::Dictionary{{"Program", std::move(program)}, {"Identifier", std::move(identifier)}});
+}
+Value with(Value plist, const char* key, Value value) {
+    plist.set(key, std::move(value));
+    return plist;
+}
+
+IpcPeer::AuditToken tokenOf(pid_t pid) {
+    auto peer = IpcPeer::fromPID(pid);
+    EXPECT_TRUE(peer);
+    return peer ? peer->auditToken() : IpcPeer::AuditToken{};
 }
 
 class CodeSigningRegistryTest : public quarn::test::TempRootTest {
@@ -51,67 +59,23 @@ protected:
     const std::string self_ = std::filesystem::read_symlink("/proc/self/exe").string();
     Paths paths_{root_.path()};
     std::filesystem::path directory_ = paths_.configDirectory() / "codesign.d";
-
-    static IpcPeer::AuditToken ownToken() {
-        auto peer = IpcPeer::fromPID(::getpid());
-        EXPECT_TRUE(peer);
-        return peer ? peer->auditToken() : IpcPeer::AuditToken{};
-    }
-
-    static Value entry(std::string program, std::string identifier) {
-        Value plist = Value::dictionary();
-        plist.set("Program", std::move(program));
-        plist.set("Identifier", std::move(identifier));
-        return plist;
-    }
+    LinuxCodeSigningRegistry registry_{paths_};
 
     void write(const std::string& name, const Value& plist) const {
         std::filesystem::create_directories(directory_);
         ASSERT_TRUE(QRN_writeToURL(plist, directory_ / name, {.atomic = true}));
     }
+    // The identifier the registry gives the token, empty for none.
+    std::string identifierOf(const IpcPeer::AuditToken& token = tokenOf(::getpid())) {
+        const auto info = registry_.infoForAuditToken(token);
+        return info ? info->identifier : std::string();
+    }
 };
 
-} // namespace
-
-TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
-    LinuxCodeSigningRegistry registry(paths_);
-    Value plist = entry(self_, "com.orvex.tests");
-    plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
-    plist.set("Sandboxed", true);
-    write("self.plist", plist);
-    auto info = registry.infoForAuditToken(ownToken());
-    ASSERT_TRUE(info);
-    EXPECT_EQ(info->identifier, "com.orvex.tests");
-    EXPECT_TRUE(info->sandboxed);
-    ASSERT_TRUE(info->entitlements);
-    EXPECT_EQ(*info->entitlements->get("com.orvex.private.Quarn.allowed"), Value(true));
-
-    plist.set("SHA256", sha256Hex(std::ifstream("/proc/self/exe", std::ios::binary)));
-    write("self.plist", plist);
-    EXPECT_TRUE(registry.infoForAuditToken(ownToken()));
-
-    quarn::test::LogCapture log;
-    plist.set("SHA256", std::string(64, 'a'));
-    write("self.plist", plist);
-    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
-    EXPECT_TRUE(log.contains("does not match the digest of code-signing entry self.plist"))
-        << log.all();
-
-    // Another process that got the pid, or none at all.
-    plist.erase("SHA256");
-    write("self.plist", plist);
-    IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(ownToken());
-    ASSERT_TRUE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
-    fields.startTime += 1;
-    EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
-    fields.pid = 0;
-    EXPECT_FALSE(registry.infoForAuditToken(IpcPeer::makeAuditToken(fields)));
-}
-
 // Runs `program` in a child, after binding `cover` over it in a mount
-// namespace of the child's own when `cover` is given; answers the child's pid
-// once it runs `program`, or -1 when that cannot be set up.
-static pid_t runCovered(const std::string& program, const std::string& cover) {
+// namespace of the child's own when `cover` is given; answers the child's
+// pid once it runs `program`, or -1 when that cannot be set up.
+pid_t runCovered(const std::string& program, const std::string& cover) {
     int ready[2];
     if (::pipe2(ready, O_CLOEXEC) != 0) {
         return -1;
@@ -134,15 +98,47 @@ static pid_t runCovered(const std::string& program, const std::string& cover) {
     }
     ::close(ready[0]);
     int status = 0;
-    if (child < 0 || ::waitpid(child, &status, WNOHANG) != 0) {
-        return -1;
-    }
-    return child;
+    return child < 0 || ::waitpid(child, &status, WNOHANG) != 0 ? -1 : child;
 }
 
-static void stop(pid_t child) {
+void stop(pid_t child) {
     ::kill(child, SIGKILL);
     ::waitpid(child, nullptr, 0);
+}
+
+} // namespace
+
+TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
+    Value plist = entry(self_, "com.orvex.tests");
+    plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
+    plist.set("Sandboxed", true);
+    write("self.plist", plist);
+    auto info = registry_.infoForAuditToken(tokenOf(::getpid()));
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->identifier, "com.orvex.tests");
+    EXPECT_TRUE(info->sandboxed);
+    ASSERT_TRUE(info->entitlements);
+    EXPECT_EQ(*info->entitlements->get("com.orvex.private.Quarn.allowed"), Value(true));
+
+    std::ifstream exe("/proc/self/exe", std::ios::binary);
+    write("self.plist",
+          with(plist, "SHA256", sha256Hex({std::istreambuf_iterator<char>(exe), {}})));
+    EXPECT_EQ(identifierOf(), "com.orvex.tests");
+
+    quarn::test::LogCapture log;
+    write("self.plist", with(plist, "SHA256", std::string(64, 'a')));
+    EXPECT_EQ(identifierOf(), "");
+    EXPECT_TRUE(log.contains("does not match the digest of code-signing entry self.plist"))
+        << log.all();
+
+    // Another process that got the pid, or none at all.
+    write("self.plist", plist);
+    IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(tokenOf(::getpid()));
+    EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "com.orvex.tests");
+    fields.startTime += 1;
+    EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "");
+    fields.pid = 0;
+    EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "");
 }
 
 TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotTheProgram) {
@@ -152,13 +148,10 @@ TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotT
     std::filesystem::copy_file("/bin/sleep", program);
     std::filesystem::copy_file("/bin/sleep", impostor);
     write("registered.plist", entry(program.string(), "com.orvex.registered"));
-    LinuxCodeSigningRegistry registry(paths_);
 
     const pid_t genuine = runCovered(program.string(), "");
     ASSERT_GT(genuine, 0);
-    auto peer = IpcPeer::fromPID(genuine);
-    ASSERT_TRUE(peer);
-    EXPECT_TRUE(registry.infoForAuditToken(peer->auditToken()));
+    EXPECT_EQ(identifierOf(tokenOf(genuine)), "com.orvex.registered");
     stop(genuine);
 
     const pid_t covered = runCovered(program.string(), impostor.string());
@@ -168,45 +161,28 @@ TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotT
     // The kernel names the registered path for it, as an unprivileged user
     // in a user and mount namespace of its own could arrange.
     EXPECT_EQ(std::filesystem::read_symlink("/proc/" + std::to_string(covered) + "/exe"), program);
-    peer = IpcPeer::fromPID(covered);
-    ASSERT_TRUE(peer);
     quarn::test::LogCapture log;
-    EXPECT_FALSE(registry.infoForAuditToken(peer->auditToken()));
+    EXPECT_EQ(identifierOf(tokenOf(covered)), "");
     EXPECT_TRUE(log.contains("is not the file")) << log.all();
     stop(covered);
 }
 
 TEST_F(CodeSigningRegistryTest, FollowsTheDirectoryAppearingAndEntriesComingAndGoing) {
-    LinuxCodeSigningRegistry registry(paths_);
-    EXPECT_FALSE(registry.infoForAuditToken(ownToken())) << "no directory yet";
-
+    EXPECT_EQ(identifierOf(), "") << "no directory yet";
     write("self.plist", entry(self_, "com.orvex.first"));
-    auto info = registry.infoForAuditToken(ownToken());
-    ASSERT_TRUE(info);
-    EXPECT_EQ(info->identifier, "com.orvex.first");
-
+    EXPECT_EQ(identifierOf(), "com.orvex.first");
     std::filesystem::remove(directory_ / "self.plist");
-    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
-
+    EXPECT_EQ(identifierOf(), "");
     write("again.plist", entry(self_, "com.orvex.second"));
-    info = registry.infoForAuditToken(ownToken());
-    ASSERT_TRUE(info);
-    EXPECT_EQ(info->identifier, "com.orvex.second");
-
+    EXPECT_EQ(identifierOf(), "com.orvex.second");
     // The whole directory removed and made again.
     std::filesystem::remove_all(directory_);
-    EXPECT_FALSE(registry.infoForAuditToken(ownToken()));
+    EXPECT_EQ(identifierOf(), "");
     write("third.plist", entry(self_, "com.orvex.third"));
-    info = registry.infoForAuditToken(ownToken());
-    ASSERT_TRUE(info);
-    EXPECT_EQ(info->identifier, "com.orvex.third");
+    EXPECT_EQ(identifierOf(), "com.orvex.third");
 }
 
 TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
-    auto with = [](Value plist, const char* key, Value value) {
-        plist.set(key, std::move(value));
-        return plist;
-    };
     const Value good = entry("/bin/good", "com.orvex.good");
     write("a-relative.plist", entry("bin/x", "com.orvex.x"));
     write("b-no-identifier.plist", entry("/bin/b", ""));
@@ -235,25 +211,20 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
         EXPECT_TRUE(log.contains((directory_ / name).string() + ".plist")) << name;
     }
     EXPECT_TRUE(log.contains("good-2.plist replaces good-1.plist")) << log.all();
-
     // Not as root, ownership and mode do not matter.
     EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
 }
 
 TEST_F(CodeSigningRegistryTest, ConcurrentLookupsSeeOneOfTheVersions) {
-    LinuxCodeSigningRegistry registry(paths_);
     write("self.plist", entry(self_, "com.orvex.v0"));
-    const IpcPeer::AuditToken token = ownToken();
+    const IpcPeer::AuditToken token = tokenOf(::getpid());
     std::atomic<bool> done{false};
     std::atomic<int> wrong{0};
     std::vector<std::thread> readers;
     for (int i = 0; i < 4; ++i) {
         readers.emplace_back([&] {
             while (!done.load()) {
-                auto info = registry.infoForAuditToken(token);
-                if (!info || info->identifier.rfind("com.orvex.v", 0) != 0) {
-                    wrong.fetch_add(1);
-                }
+                wrong += identifierOf(token).rfind("com.orvex.v", 0) != 0;
             }
         });
     }
@@ -265,7 +236,7 @@ TEST_F(CodeSigningRegistryTest, ConcurrentLookupsSeeOneOfTheVersions) {
         reader.join();
     }
     EXPECT_EQ(wrong.load(), 0);
-    EXPECT_EQ(registry.infoForAuditToken(token)->identifier, "com.orvex.v50");
+    EXPECT_EQ(identifierOf(token), "com.orvex.v50");
 }
 
 TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
@@ -276,11 +247,10 @@ TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
     auto digestNow = [&] {
         Descriptor fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
         auto digest = cache.digestOf(fd.get());
-        EXPECT_TRUE(digest);
         return digest ? hexOf(*digest) : std::string();
     };
-    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("first version")));
-    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("first version")));
+    EXPECT_EQ(digestNow(), sha256Hex("first version"));
+    EXPECT_EQ(digestNow(), sha256Hex("first version"));
 
     // Same size, mtime put back: still seen as changed.
     struct stat before {};
@@ -288,8 +258,7 @@ TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
     std::ofstream(file, std::ios::binary | std::ios::trunc) << "other version";
     const timespec times[2] = {before.st_atim, before.st_mtim};
     ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
-    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("other version")));
-
+    EXPECT_EQ(digestNow(), sha256Hex("other version"));
     std::ofstream(file, std::ios::binary | std::ios::app) << " grown";
-    EXPECT_EQ(digestNow(), sha256Hex(std::istringstream("other version grown")));
+    EXPECT_EQ(digestNow(), sha256Hex("other version grown"));
 }

@@ -15,10 +15,16 @@ std::string plist(const std::string& body) {
            "<plist version=\"1.0\">" +
            body + "</plist>\n";
 }
+// Feature `f` whose dictionary holds `body`.
+std::string feature(const std::string& body) {
+    return plist("<dict><key>f</key>" + body + "</dict>");
+}
 
 class FeaturesTest : public quarn::test::TempRootTest {
 protected:
-    Features& features() { return root_.context().instance<Features>(); }
+    bool isEnabled(std::string_view domain) {
+        return root_.context().instance<Features>().isEnabled(domain, "f");
+    }
     void writeDomain(const std::string& domain, const std::string& contents) {
         root_.writeFile("/etc/quarnd/features/" + domain + ".plist", contents);
     }
@@ -26,50 +32,44 @@ protected:
 
 } // namespace
 
-TEST_F(FeaturesTest, OnlyAnExplicitTrueSwitchesAFeatureOn) {
-    EXPECT_FALSE(features().isEnabled("quarnd", "fast_container_sizing")); // no file
-    writeDomain("quarnd",
-                plist("<dict>"
-                      "<key>fast_container_sizing</key><dict><key>Enabled</key><true/></dict>"
-                      "<key>off</key><dict><key>Enabled</key><false/></dict>"
-                      "<key>as_string</key><dict><key>Enabled</key><string>YES</string></dict>"
-                      "<key>as_number</key><dict><key>Enabled</key><integer>1</integer></dict>"
-                      "<key>no_dict</key><true/>"
-                      "<key>no_key</key><dict/>"
-                      "</dict>"));
-    EXPECT_TRUE(features().isEnabled("quarnd", "fast_container_sizing"));
-    for (const char* feature : {"off", "as_string", "as_number", "no_dict", "no_key", "unknown"}) {
-        EXPECT_FALSE(features().isEnabled("quarnd", feature)) << feature;
-    }
-    EXPECT_FALSE(features().isEnabled("other", "fast_container_sizing")); // per domain
-
-    // The file is read on each question: switching off takes effect at once.
-    writeDomain("quarnd", plist("<dict><key>fast_container_sizing</key>"
-                                "<dict><key>Enabled</key><false/></dict></dict>"));
-    EXPECT_FALSE(features().isEnabled("quarnd", "fast_container_sizing"));
-}
-
-TEST_F(FeaturesTest, BrokenFilesMeanOff) {
-    for (const std::string& contents :
-         {std::string("not a property list"), std::string(),
-          plist("<array><string>fast_container_sizing</string></array>"),
-          plist("<dict><key>fast_container_sizing</key><dict><key>Enabled</key><true/>")}) {
-        writeDomain("quarnd", contents);
-        EXPECT_FALSE(features().isEnabled("quarnd", "fast_container_sizing")) << contents;
+TEST_F(FeaturesTest, OnlyAnExplicitTrueInAReadableFileSwitchesAFeatureOn) {
+    EXPECT_FALSE(isEnabled("quarnd")); // no file
+    const std::string on = "<dict><key>Enabled</key><true/></dict>";
+    // In this order: the file is read on each question, so switching off takes effect at once.
+    const struct {
+        std::string contents;
+        bool enabled;
+    } cases[] = {
+        {feature(on), true},
+        {feature("<dict><key>Enabled</key><false/></dict>"), false},
+        {feature(on), true},
+        {feature("<dict><key>Enabled</key><string>YES</string></dict>"), false},
+        {feature("<dict><key>Enabled</key><integer>1</integer></dict>"), false},
+        {feature("<true/>"), false},
+        {feature("<dict/>"), false},
+        {plist("<dict><key>g</key>" + on + "</dict>"), false},
+        {"not a property list", false},
+        {"", false},
+        {plist("<array><string>f</string></array>"), false},
+        {plist("<dict><key>f</key>" + on), false},
+    };
+    for (const auto& c : cases) {
+        writeDomain("quarnd", c.contents);
+        EXPECT_EQ(isEnabled("quarnd"), c.enabled) << c.contents;
     }
     std::filesystem::remove(root_ / "/etc/quarnd/features/quarnd.plist");
     std::filesystem::create_directory(root_ / "/etc/quarnd/features/quarnd.plist");
-    EXPECT_FALSE(features().isEnabled("quarnd", "fast_container_sizing"));
+    EXPECT_FALSE(isEnabled("quarnd"));
 }
 
 TEST_F(FeaturesTest, DomainsCannotReachOutsideTheFeaturesDirectory) {
-    const std::string on = plist("<dict><key>f</key><dict><key>Enabled</key><true/></dict></dict>");
+    const std::string on = feature("<dict><key>Enabled</key><true/></dict>");
     root_.writeFile("/etc/quarnd/escaped.plist", on);
     writeDomain(".hidden", on);
     writeDomain("ok", on);
-    EXPECT_TRUE(features().isEnabled("ok", "f"));
-    EXPECT_FALSE(features().isEnabled("../escaped", "f"));
-    EXPECT_FALSE(features().isEnabled(".hidden", "f"));
-    EXPECT_FALSE(features().isEnabled("", "f"));
-    EXPECT_FALSE(features().isEnabled(std::string_view("ok\0x", 4), "f"));
+    EXPECT_TRUE(isEnabled("ok"));
+    for (std::string_view domain : {"other", "../escaped", ".hidden", ""}) {
+        EXPECT_FALSE(isEnabled(domain)) << domain;
+    }
+    EXPECT_FALSE(isEnabled(std::string_view("ok\0x", 4)));
 }

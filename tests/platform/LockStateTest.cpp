@@ -14,6 +14,8 @@ using namespace quarn;
 
 namespace {
 
+using V = std::vector<std::int32_t>;
+
 // Collects the states a watch reports, for tests to wait on.
 class Reports {
 public:
@@ -24,23 +26,17 @@ public:
             changed_.notify_all();
         };
     }
-
-    // Waits (generously) until `count` states arrived; returns them all.
-    std::vector<std::int32_t> waitFor(std::size_t count) {
+    // Waits (generously) until `count` states arrived; 0 answers at once.
+    V waitFor(std::size_t count = 0) {
         std::unique_lock lock(mutex_);
         changed_.wait_for(lock, std::chrono::seconds(20), [&] { return states_.size() >= count; });
-        return states_;
-    }
-
-    std::vector<std::int32_t> seen() {
-        std::lock_guard guard(mutex_);
         return states_;
     }
 
 private:
     std::mutex mutex_; // guards states_
     std::condition_variable changed_;
-    std::vector<std::int32_t> states_;
+    V states_;
 };
 
 class LockStateTest : public quarn::test::TempRootTest {
@@ -53,43 +49,33 @@ protected:
         std::ofstream(file(), std::ios::trunc) << text;
     }
     void writeByRename(const std::string& text) const {
-        const auto temp = runDirectory() / "lockstate.new";
-        std::ofstream(temp, std::ios::trunc) << text;
-        std::filesystem::rename(temp, file());
+        std::ofstream(runDirectory() / "lockstate.new", std::ios::trunc) << text;
+        std::filesystem::rename(runDirectory() / "lockstate.new", file());
     }
+    LinuxLockState lock_{Paths(root_.path())};
 };
-
-using V = std::vector<std::int32_t>;
 
 } // namespace
 
 TEST(LockStateParsing, DecimalStatesOnly) {
-    EXPECT_EQ(LinuxLockState::parseState("0"), 0);
-    EXPECT_EQ(LinuxLockState::parseState("1\n"), 1);
-    EXPECT_EQ(LinuxLockState::parseState("  3 \r\n"), 3);
-    EXPECT_EQ(LinuxLockState::parseState("-2"), -2);
-    for (const char* bad : {"", "\n", "locked", "1x", "+1", "0x1", "1 0", "2147483648"}) {
-        EXPECT_FALSE(LinuxLockState::parseState(bad)) << '"' << bad << '"';
+    const std::pair<const char*, std::optional<std::int32_t>> cases[] = {
+        {"0", 0},   {"1\n", 1}, {"  3 \r\n", 3}, {"-2", -2},  {"", {}},    {"\n", {}},
+        {"1x", {}}, {"+1", {}}, {"locked", {}},  {"0x1", {}}, {"1 0", {}}, {"2147483648", {}},
+    };
+    for (const auto& [text, expected] : cases) {
+        EXPECT_EQ(LinuxLockState::parseState(text), expected) << '"' << text << '"';
     }
 }
 
 TEST_F(LockStateTest, StateFollowsTheFile) {
     auto& lock = root_.context().instance<LockState>();
     EXPECT_EQ(lock.state(), LockState::kUnlocked); // no file, no run directory
-    EXPECT_FALSE(lock.isLocked());
-
-    writeInPlace("1\n");
-    EXPECT_EQ(lock.state(), LockState::kLocked);
-    EXPECT_TRUE(lock.isLocked());
-
-    writeInPlace("2");
-    EXPECT_EQ(lock.state(), 2);
-    EXPECT_FALSE(lock.isLocked());
-
-    writeInPlace("garbage");
-    EXPECT_EQ(lock.state(), LinuxLockState::kUnreadable);
-    EXPECT_FALSE(lock.isLocked());
-
+    for (const auto& [text, state] : {std::pair<const char*, std::int32_t>{"1\n", 1},
+                                      {"2", 2},
+                                      {"garbage", LinuxLockState::kUnreadable}}) {
+        writeInPlace(text);
+        EXPECT_EQ(lock.state(), state) << text;
+    }
     // A link planted in place of the file is not believed.
     std::filesystem::remove(file());
     root_.writeFile("/elsewhere", "1");
@@ -98,10 +84,8 @@ TEST_F(LockStateTest, StateFollowsTheFile) {
 }
 
 TEST_F(LockStateTest, WatchSeesWritesRenamesAndRemoval) {
-    LinuxLockState lock{Paths(root_.path())};
     Reports reports;
-    ASSERT_TRUE(lock.startWatching(reports.callback())); // makes the run directory
-
+    ASSERT_TRUE(lock_.startWatching(reports.callback())); // makes the run directory
     writeInPlace("1");
     EXPECT_EQ(reports.waitFor(1), V{1});
     writeInPlace("1"); // no change: not reported
@@ -121,34 +105,28 @@ TEST_F(LockStateTest, WatchSeesWritesRenamesAndRemoval) {
 }
 
 TEST_F(LockStateTest, StoppedWatchesAreSilentAndRestartsWork) {
-    LinuxLockState lock{Paths(root_.path())};
     writeInPlace("1");
-    Reports first;
-    ASSERT_TRUE(lock.startWatching(first.callback()));
+    Reports first, second, third;
+    ASSERT_TRUE(lock_.startWatching(first.callback()));
     writeInPlace("0"); // the state at the start (1) is not reported, the change is
     EXPECT_EQ(first.waitFor(1), V{0});
-
-    Reports second;
-    ASSERT_TRUE(lock.startWatching(second.callback())); // replaces the first watch
+    ASSERT_TRUE(lock_.startWatching(second.callback())); // replaces the first watch
     writeInPlace("1");
     EXPECT_EQ(second.waitFor(1), V{1});
-    lock.stopWatching();
-    lock.stopWatching(); // twice is harmless
-
-    Reports third;
-    ASSERT_TRUE(lock.startWatching(third.callback()));
+    lock_.stopWatching();
+    lock_.stopWatching(); // twice is harmless
+    ASSERT_TRUE(lock_.startWatching(third.callback()));
     writeInPlace("0");
     EXPECT_EQ(third.waitFor(1), V{0});
     // The earlier watches were joined before their replacement started.
-    EXPECT_EQ(first.seen(), V{0});
-    EXPECT_EQ(second.seen(), V{1});
+    EXPECT_EQ(first.waitFor(), V{0});
+    EXPECT_EQ(second.waitFor(), V{1});
 }
 
 TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
     auto lock = std::make_unique<LinuxLockState>(Paths(root_.path()));
     Reports reports;
-    auto record = reports.callback();
-    ASSERT_TRUE(lock->startWatching([&](std::int32_t state) {
+    ASSERT_TRUE(lock->startWatching([&, record = reports.callback()](std::int32_t state) {
         lock->stopWatching(); // must neither deadlock nor crash
         record(state);
     }));
@@ -158,15 +136,14 @@ TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
     ASSERT_TRUE(lock->startWatching(reports.callback()));
     lock.reset(); // with a live watch: the thread must be gone before the object
     writeInPlace("0");
-    EXPECT_EQ(reports.seen(), V{1});
+    EXPECT_EQ(reports.waitFor(), V{1});
 }
 
 TEST_F(LockStateTest, LosingTheRunDirectoryReportsUnlocked) {
-    LinuxLockState lock{Paths(root_.path())};
     writeInPlace("1");
     Reports reports;
-    ASSERT_TRUE(lock.startWatching(reports.callback()));
+    ASSERT_TRUE(lock_.startWatching(reports.callback()));
     std::filesystem::remove_all(runDirectory());
     EXPECT_EQ(reports.waitFor(1), V{0});
-    EXPECT_FALSE(lock.isLocked());
+    EXPECT_EQ(lock_.state(), LockState::kUnlocked);
 }

@@ -1,10 +1,12 @@
 #include "Daemon/platform/LinuxNotifications.h"
+#include "Daemon/support/Descriptor.h"
 
 #include "common/TempRoot.h"
 
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <regex>
 #include <string>
@@ -34,13 +36,15 @@ protected:
     }
 };
 
+} // namespace
+
 TEST_F(NotificationsTest, PostsAppendOneTimestampedLinePerPostInAFileNamedAfterTheNotification) {
     const auto name = Notifications::kUserInvalidated;
     ASSERT_FALSE(std::filesystem::exists(Paths(root_.path()).runDirectory()));
-
     ASSERT_TRUE(notifications_.post(name));
     ASSERT_TRUE(notifications_.post(name));
-    ASSERT_TRUE(notifications_.post(Notifications::kCleanupComplete));
+    // The platform installs this poster.
+    ASSERT_TRUE(root_.context().instance<Notifications>().post(Notifications::kCleanupComplete));
 
     EXPECT_EQ(notifications_.directory(), root_ / "/private/var/run/quarnd/notifications");
     const auto lines = linesOf(fileFor(name));
@@ -51,10 +55,6 @@ TEST_F(NotificationsTest, PostsAppendOneTimestampedLinePerPostInAFileNamedAfterT
         EXPECT_TRUE(std::regex_match(line, format)) << line;
     }
     EXPECT_EQ(linesOf(fileFor(Notifications::kCleanupComplete)).size(), 1u);
-
-    // The platform installs this poster.
-    ASSERT_TRUE(root_.context().instance<Notifications>().post(Notifications::kCleanupComplete));
-    EXPECT_EQ(linesOf(fileFor(Notifications::kCleanupComplete)).size(), 2u);
 }
 
 TEST_F(NotificationsTest, NamesThatAreNoFileNamesAndPlantedLinksAreRefused) {
@@ -83,48 +83,29 @@ TEST_F(NotificationsTest, NamesThatAreNoFileNamesAndPlantedLinksAreRefused) {
     EXPECT_EQ(linesOf(elsewhere / "victim"), std::vector<std::string>{"untouched"});
 }
 
-// Stands in for the service manager: a datagram socket named by
-// NOTIFY_SOCKET for the duration of the test.
-class FakeServiceManager {
-public:
-    FakeServiceManager() {
-        path_ =
-            std::filesystem::temp_directory_path() / ("quarn-notify." + std::to_string(getpid()));
-        fd_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
-        std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path_.c_str());
-        std::filesystem::remove(path_);
-        bound_ = ::bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-        ::setenv("NOTIFY_SOCKET", path_.c_str(), 1);
-    }
-    ~FakeServiceManager() {
-        ::unsetenv("NOTIFY_SOCKET");
-        ::close(fd_);
-        std::filesystem::remove(path_);
-    }
-    bool bound() const { return bound_; }
-    std::string receive() {
-        char buffer[512];
-        const ssize_t n = ::recv(fd_, buffer, sizeof buffer, MSG_DONTWAIT);
-        return n > 0 ? std::string(buffer, static_cast<std::size_t>(n)) : std::string();
-    }
-
-private:
-    std::filesystem::path path_;
-    int fd_ = -1;
-    bool bound_ = false;
-};
-
 TEST_F(NotificationsTest, UnderAServiceManagerAPostBecomesTheStatusLine) {
-    FakeServiceManager manager;
-    ASSERT_TRUE(manager.bound());
-    ASSERT_TRUE(notifications_.post(Notifications::kUserInvalidated));
-    EXPECT_EQ(manager.receive(), "STATUS=Posted com.orvex.quarnd.user-invalidated");
+    // Stands in for the service manager: a datagram socket named by NOTIFY_SOCKET.
+    const auto path = root_.path() / "notify";
+    const Descriptor fd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    sockaddr_un addr{.sun_family = AF_UNIX, .sun_path = {}};
+    ASSERT_LT(path.native().size(), sizeof addr.sun_path);
+    std::strcpy(addr.sun_path, path.c_str());
+    ASSERT_EQ(::bind(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    ::setenv("NOTIFY_SOCKET", path.c_str(), 1);
+    auto received = [&] {
+        char buffer[512];
+        const ssize_t n = ::recv(fd.get(), buffer, sizeof buffer, MSG_DONTWAIT);
+        return n > 0 ? std::string(buffer, static_cast<std::size_t>(n)) : std::string();
+    };
 
+    const bool posted = bool(notifications_.post(Notifications::kUserInvalidated));
+    const std::string status = received();
     // A refused post tells the manager nothing.
-    EXPECT_FALSE(notifications_.post("a/b"));
-    EXPECT_EQ(manager.receive(), "");
+    const bool refused = !notifications_.post("a/b");
+    const std::string afterRefused = received();
+    ::unsetenv("NOTIFY_SOCKET");
+    EXPECT_TRUE(posted);
+    EXPECT_EQ(status, "STATUS=Posted com.orvex.quarnd.user-invalidated");
+    EXPECT_TRUE(refused);
+    EXPECT_EQ(afterRefused, "");
 }
-
-} // namespace
