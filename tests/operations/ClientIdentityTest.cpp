@@ -1,12 +1,19 @@
-// Client identities made from a connection: what the code-signing registry
-// says about the peer process, and the installer's remembered identity.
+// Client identities and the rights they bring: what the code-signing
+// registry says about the peer process, the installer's remembered
+// identity, entitlements as booleans, the lookup entitlement per class, the
+// daemon's own privileged connection and the protection class asked for.
 
+#include "Daemon/model/QRNContainerClass.h"
+#include "Daemon/model/QRNUserIdentitySharedCache.h"
+#include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/platform/IpcConnection.h"
+#include "Daemon/protection/QRNDataProtectionManager.h"
 #include "Daemon/support/PropertyList.h"
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -61,10 +68,10 @@ class ClientIdentityTest : public TempRootTest {
 protected:
     void registerSelf(const std::string& identifier, std::optional<Value> entitlements,
                       bool sandboxed = false) {
-        Value plist = Value::dictionary();
-        plist.set("Program", std::filesystem::read_symlink("/proc/self/exe").string());
-        plist.set("Identifier", identifier);
-        plist.set("Sandboxed", sandboxed);
+        Value plist = dictionaryOf(
+            {{"Program", Value(std::filesystem::read_symlink("/proc/self/exe").string())},
+             {"Identifier", Value(identifier)},
+             {"Sandboxed", Value(sandboxed)}});
         if (entitlements) {
             plist.set("Entitlements", *entitlements);
         }
@@ -72,22 +79,29 @@ protected:
         std::filesystem::create_directories(directory);
         ASSERT_TRUE(QRN_writeToURL(plist, directory / "self.plist", {.atomic = true}));
     }
-
     static QRNClientIdentityPtr identityOf(pid_t pid) {
         auto peer = IpcPeer::fromPID(pid);
         EXPECT_TRUE(peer);
-        if (!peer) {
-            return nullptr;
-        }
-        return QRNClientIdentity::clientIdentityWithVellConnection(FakeConnection(*peer));
+        return peer ? QRNClientIdentity::clientIdentityWithVellConnection(FakeConnection(*peer))
+                    : nullptr;
+    }
+    static QRNClientIdentityPtr client(Value entitlements) {
+        return QRNClientIdentity::initWithBundleIdentifier(
+            "com.example.client", kMobileUID, kMobileUID, 77,
+            QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity(),
+            std::move(entitlements), true, QRNClientIdentity::AuditToken{}, false);
+    }
+    static std::shared_ptr<QRNClientConnection> withLookup(std::optional<Value> lookup) {
+        return std::make_shared<QRNClientConnection>(client(Value::dictionary()), false, false,
+                                                     false, std::move(lookup), std::nullopt,
+                                                     nullptr);
     }
 };
 
 } // namespace
 
 TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntry) {
-    const Value entitlements = Value::Dictionary{{"com.orvex.private.Quarn.allowed", true},
-                                                 {"com.orvex.private.Quarn.lookup", "true"}};
+    const Value entitlements = Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}};
     registerSelf("com.orvex.tests", entitlements, true);
     auto peer = IpcPeer::fromPID(::getpid());
     ASSERT_TRUE(peer);
@@ -102,17 +116,13 @@ TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntry) {
     EXPECT_EQ(identity->auditToken(), peer->auditToken());
     ASSERT_TRUE(identity->userIdentity());
     EXPECT_EQ(identity->userIdentity()->posixUID(), kMobileUID) << "root acts for mobile";
-    EXPECT_TRUE(identity->boolValueOfEntitlement("com.orvex.private.Quarn.allowed"));
-    EXPECT_FALSE(identity->boolValueOfEntitlement("com.orvex.private.Quarn.lookup"))
-        << "the string \"true\" is no boolean";
-
     auto bundle = QRNClientIdentity::_bundleIdentifierFromAuditToken(peer->auditToken());
     ASSERT_TRUE(bundle);
     EXPECT_EQ(*bundle, "com.orvex.tests");
     EXPECT_NE(identityOf(::getpid()), identity) << "only the installer's identity is kept";
 }
 
-TEST_F(ClientIdentityTest, MissingEntitlementsGiveAnEmptyDictionary) {
+TEST_F(ClientIdentityTest, MissingOrMalformedEntitlementsGiveAnEmptyDictionary) {
     registerSelf("com.orvex.tests", std::nullopt);
     LogCapture log;
     auto identity = identityOf(::getpid());
@@ -121,6 +131,7 @@ TEST_F(ClientIdentityTest, MissingEntitlementsGiveAnEmptyDictionary) {
     EXPECT_TRUE(
         log.contains(fmt::format("Missing or malformed entitlements for pid {}", ::getpid())))
         << log.all();
+    EXPECT_EQ(client(Value("not a dictionary"))->entitlements(), Value::dictionary());
 }
 
 TEST_F(ClientIdentityTest, ProcessWithoutEntryHasNoIdentity) {
@@ -145,4 +156,92 @@ TEST_F(ClientIdentityTest, InstallerIdentityIsReusedForTheSameProcessOnly) {
     EXPECT_EQ(identityOf(child.pid()), childIdentity);
     // Only the last installer identity is remembered.
     EXPECT_NE(identityOf(::getpid()), first);
+}
+
+TEST_F(ClientIdentityTest, OnlyBooleansAndNumbersGrantAnEntitlement) {
+    auto identity = client(dictionaryOf({
+        {"flag", Value(true)},
+        {"off", Value(false)},
+        {"one", Value(1)},
+        {"zero", Value(0)},
+        {"text", Value("true")},
+        {"dict", dictionaryOf({{"x", Value(true)}})},
+        {"list", arrayOf({Value(true)})},
+    }));
+    ASSERT_TRUE(identity);
+    for (const char* name : {"flag", "off", "one", "zero", "text", "dict", "list", "absent"}) {
+        const std::string_view granted(name);
+        EXPECT_EQ(identity->boolValueOfEntitlement(name), granted == "flag" || granted == "one")
+            << name;
+    }
+}
+
+TEST_F(ClientIdentityTest, SharedConnectionIsPrivilegedAndOneInstance) {
+    auto& shared = QRNClientConnection::sharedClientConnection();
+    EXPECT_EQ(&shared, &QRNClientConnection::sharedClientConnection());
+    EXPECT_TRUE(shared.unrestricted() && shared.allowOtherIdLookup());
+    ASSERT_TRUE(shared.clientIdentity());
+    EXPECT_FALSE(shared.clientIdentity()->isKernel());
+    EXPECT_EQ(shared.clientBundleIdentifier(), "com.orvex.quarnd.internal");
+    EXPECT_TRUE(shared.commandQueue());
+}
+
+TEST_F(ClientIdentityTest, LookupEntitlementIsReadPerClassByShortName) {
+    auto connection = withLookup(dictionaryOf({
+        {"appData", arrayOf({Value("com.a"), Value(7), Value("com.b"), dictionaryOf({})})},
+        {"appGroup", Value("group.a")},
+        {"systemGroup", arrayOf({})},
+    }));
+    auto appData = connection->_lookupForContainerClass(kQRNContainerClassAppData);
+    ASSERT_TRUE(appData);
+    EXPECT_EQ(*appData, (QRNClientConnection::IdentifierSet{"com.a", "com.b"}));
+    // Made once per class and kept.
+    EXPECT_EQ(connection->_lookupForContainerClass(kQRNContainerClassAppData), appData);
+
+    EXPECT_TRUE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppData, "com.b"));
+    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppData, "com.c"));
+    // The same identifier under another class's name grants nothing here.
+    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassPluginData, "com.a"));
+    // Not an array, or absent: an empty set rather than none.
+    for (std::uint64_t cls :
+         {kQRNContainerClassAppGroup, kQRNContainerClassSystemGroup, kQRNContainerClassVPNData}) {
+        auto set = connection->_lookupForContainerClass(cls);
+        ASSERT_TRUE(set) << cls;
+        EXPECT_TRUE(set->empty()) << cls;
+    }
+    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppGroup, "group.a"));
+    // Outside the class table, or without the entitlement, there is nothing to ask.
+    EXPECT_EQ(connection->_lookupForContainerClass(0), nullptr);
+    EXPECT_EQ(connection->_lookupForContainerClass(14), nullptr);
+    EXPECT_EQ(withLookup(std::nullopt)->_lookupForContainerClass(kQRNContainerClassAppData),
+              nullptr);
+}
+
+TEST_F(ClientIdentityTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
+    using M = QRNDataProtectionManager;
+    const struct {
+        Value entitlements;
+        int expected;
+    } cases[] = {
+        {dictionaryOf({{"DataProtectionClass", Value(M::kProtectionWriteOnly)}}), 2},
+        {dictionaryOf({{"data-protection-class", Value(M::kProtectionNone)},
+                       {"DataProtectionClass", Value(M::kProtectionComplete)}}),
+         4},
+        // The first key present decides, even when it holds no string.
+        {dictionaryOf({{"com.orvex.developer.default-data-protection", Value(1)},
+                       {"DataProtectionClass", Value(M::kProtectionComplete)}}),
+         0},
+        {Value::dictionary(), 0},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(c.entitlements), c.expected)
+            << c.entitlements.description();
+    }
+    LogCapture log;
+    EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(
+                  dictionaryOf({{"DataProtectionClass", Value("Sometimes")}})),
+              0);
+    EXPECT_TRUE(log.contains(
+        "Unknown value for DataProtectionClass entitlement: Sometimes; defaulting to class 0"))
+        << log.all();
 }
