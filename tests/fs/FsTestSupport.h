@@ -2,49 +2,121 @@
 // Helpers shared by the file manager tests: building small trees and reading
 // back what the file manager left on disk.
 
-#include <sys/stat.h>
+#include "Daemon/fs/FaultInjectingEnv.h"
+#include "Daemon/fs/LinuxEnv.h"
+#include "Daemon/fs/QRNFileManager.h"
 
+#include "common/LogCapture.h"
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <string_view>
 
 namespace quarn::test {
 
-void writeFile(const std::filesystem::path& path, std::string_view contents);
-std::string readFile(const std::filesystem::path& path);
-struct stat lstatOf(const std::filesystem::path& path);
-bool existsNoFollow(const std::filesystem::path& path);
-std::optional<std::string> xattrOf(const std::filesystem::path& path, const char* name);
+namespace fs = std::filesystem;
+
 // The attribute holding the data protection class, as root writes it.
 inline constexpr const char* kProtectionClassAttribute = "trusted.quarn.protection_class";
 
-} // namespace quarn::test
+inline void writeFile(const fs::path& path, std::string_view contents) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    if (!(out << contents))
+        ADD_FAILURE() << "cannot write " << path;
+}
 
-namespace quarn::test {
+inline std::string readFile(const fs::path& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+inline struct stat lstatOf(const fs::path& path) {
+    struct stat st {};
+    if (::lstat(path.c_str(), &st) != 0)
+        ADD_FAILURE() << "lstat " << path << ": " << std::strerror(errno);
+    return st;
+}
+
+inline bool existsNoFollow(const fs::path& path) {
+    struct stat st {};
+    return ::lstat(path.c_str(), &st) == 0;
+}
+
+inline std::optional<std::string> xattrOf(const fs::path& path,
+                                          const char* name = kProtectionClassAttribute) {
+    char buffer[256];
+    auto n = ::lgetxattr(path.c_str(), name, buffer, sizeof buffer);
+    return n < 0 ? std::nullopt : std::optional(std::string(buffer, static_cast<std::size_t>(n)));
+}
 
 // Sets or clears FS_IMMUTABLE_FL; answers the errno (0 on success).
-int setImmutable(const std::filesystem::path& path, bool immutable);
+inline int setImmutable(const fs::path& path, bool immutable) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    if (fd < 0)
+        return errno;
+    int flags = 0;
+    int err = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0 ? 0 : errno;
+    flags = immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+    if (err == 0 && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) != 0)
+        err = errno;
+    ::close(fd);
+    return err;
+}
+
 // Entries below `dir` (not counting it); -1 when it is missing.
-long countEntries(const std::filesystem::path& dir);
-// A directory on another file system than the temporary roots (tmpfs in
-// /dev/shm), removed at the end of the scope; empty when there is none.
-class OtherFileSystemDirectory {
-public:
-    OtherFileSystemDirectory();
-    ~OtherFileSystemDirectory();
-    const std::filesystem::path& path() const { return path_; }
-
-private:
-    std::filesystem::path path_;
-};
-
-} // namespace quarn::test
-
-namespace quarn::test {
+inline long countEntries(const fs::path& dir) {
+    if (!existsNoFollow(dir))
+        return -1;
+    std::error_code ec;
+    long n = 0;
+    for (auto it = fs::recursive_directory_iterator(dir, ec);
+         it != fs::recursive_directory_iterator(); it.increment(ec))
+        ++n;
+    return n;
+}
 
 // A chain of `depth` nested directories with long names and a file at the
 // bottom, made by descriptor: its full path is longer than PATH_MAX.
-void makeDeepTree(const std::filesystem::path& top, int depth);
+inline void makeDeepTree(const fs::path& top, int depth) {
+    fs::create_directories(top);
+    int fd = ::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    const std::string name(40, 'n');
+    for (int i = 0; i < depth; ++i) {
+        ASSERT_EQ(::mkdirat(fd, name.c_str(), 0755), 0) << "level " << i;
+        int next = ::openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+        ::close(fd);
+        ASSERT_GE(next, 0);
+        fd = next;
+    }
+    int file = ::openat(fd, "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    ASSERT_GE(file, 0);
+    ASSERT_EQ(::write(file, "deep", 4), 4);
+    ::close(file);
+    ::close(fd);
+}
+
+// A file manager over a fault-injecting Env (no faults until asked) in a
+// throw-away root.
+class FsTest : public TempRootTest {
+protected:
+    std::shared_ptr<FaultInjectingEnv> env_ =
+        std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>());
+    QRNFileManager manager_{root_.context(), env_};
+};
 
 } // namespace quarn::test

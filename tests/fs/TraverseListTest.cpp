@@ -1,36 +1,23 @@
-#include "Daemon/fs/FaultInjectingEnv.h"
-#include "Daemon/fs/LinuxEnv.h"
-#include "Daemon/fs/QRNFileManager.h"
-
+// Walking, listing and sizing trees.
 #include "FsTestSupport.h"
-#include "common/LogCapture.h"
-#include "common/TempRoot.h"
 
-#include <gtest/gtest.h>
+#include <sys/mount.h>
 
 #include <algorithm>
 #include <map>
-#include <sys/mount.h>
-#include <unistd.h>
 
 namespace quarn::test {
 namespace {
 
-namespace fs = std::filesystem;
 using Kind = QRNFileManager::TraversalEntry::Kind;
 
-class TraverseListTest : public TempRootTest {
+class TraverseListTest : public FsTest {
 protected:
     void SetUp() override {
-        env_ = std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>());
-        manager_ = std::make_unique<QRNFileManager>(root_.context(), env_);
-        top_ = root_ / "/private/var/containers/tree";
         fs::create_directories(top_ / "d1" / "d2");
         fs::create_directories(top_ / "e");
-        writeFile(top_ / "f", "f");
-        writeFile(top_ / "d1" / "g", "g");
-        writeFile(top_ / "d1" / "d2" / "h", "h");
-        writeFile(top_ / ".hidden", "h");
+        for (auto f : {"f", "d1/g", "d1/d2/h", ".hidden"})
+            writeFile(top_ / f, "x");
         fs::create_directories(root_ / "/outside/inner");
         fs::create_directory_symlink(root_ / "/outside", top_ / "d1" / "out");
     }
@@ -43,11 +30,10 @@ protected:
 
     std::vector<Visit> walk(const fs::path& at) {
         std::vector<Visit> visits;
-        auto walked = manager_->_traverseDirectory(
-            at, [&](const QRNFileManager::TraversalEntry& entry) -> Status {
-                visits.push_back({entry.kind, entry.path, entry.level});
-                return {};
-            });
+        auto walked = manager_._traverseDirectory(at, [&](const auto& entry) -> Status {
+            visits.push_back({entry.kind, entry.path, entry.level});
+            return {};
+        });
         EXPECT_TRUE(walked) << walked.error().description();
         return visits;
     }
@@ -58,31 +44,27 @@ protected:
         return it == visits.end() ? -1 : it - visits.begin();
     }
 
-    std::shared_ptr<FaultInjectingEnv> env_;
-    std::unique_ptr<QRNFileManager> manager_;
-    fs::path top_;
+    const fs::path top_ = root_ / "/private/var/containers/tree";
 };
 
 TEST_F(TraverseListTest, DirectoriesComeBeforeAndAfterTheirContentsAndLinksAreNotEntered) {
     auto visits = walk(top_);
     // 4 directories twice, 5 files/links once.
     ASSERT_EQ(visits.size(), 13u);
-    EXPECT_EQ(visits.front().path, top_);
     EXPECT_EQ(visits.front().kind, Kind::DirectoryPreOrder);
-    EXPECT_EQ(visits.back().path, top_);
     EXPECT_EQ(visits.back().kind, Kind::DirectoryPostOrder);
-    for (const auto& d : {top_ / "d1", top_ / "d1" / "d2", top_ / "e"}) {
+    for (const auto& d : {top_, top_ / "d1", top_ / "d1" / "d2", top_ / "e"}) {
         auto pre = indexOf(visits, d, Kind::DirectoryPreOrder);
         auto post = indexOf(visits, d, Kind::DirectoryPostOrder);
         ASSERT_GE(pre, 0) << d;
         ASSERT_GT(post, pre) << d;
         for (std::ptrdiff_t i = 0; i < static_cast<std::ptrdiff_t>(visits.size()); ++i) {
-            bool inside = visits[i].path.string().rfind(d.string() + "/", 0) == 0;
-            if (inside) {
+            if (visits[i].path.string().rfind(d.string() + "/", 0) == 0) {
                 EXPECT_TRUE(i > pre && i < post) << visits[i].path << " outside of " << d;
             }
         }
     }
+    EXPECT_EQ(indexOf(visits, top_, Kind::DirectoryPreOrder), 0);
     auto link = indexOf(visits, top_ / "d1" / "out", Kind::Symlink);
     ASSERT_GE(link, 0);
     EXPECT_EQ(visits[link].level, 2);
@@ -96,16 +78,15 @@ TEST_F(TraverseListTest, DirectoriesComeBeforeAndAfterTheirContentsAndLinksAreNo
 }
 
 TEST_F(TraverseListTest, EntriesCanBeChangedThroughTheirParentDescriptor) {
-    auto walked = manager_->_traverseDirectory(
-        top_, [&](const QRNFileManager::TraversalEntry& entry) -> Status {
-            if (entry.kind != Kind::DirectoryPostOrder && entry.level > 0) {
-                EXPECT_EQ(::fchownat(entry.parentFd, entry.name.c_str(), kMobileUID, kMobileUID,
-                                     AT_SYMLINK_NOFOLLOW),
-                          0)
-                    << entry.path;
-            }
-            return {};
-        });
+    auto walked = manager_._traverseDirectory(top_, [&](const auto& entry) -> Status {
+        if (entry.kind != Kind::DirectoryPostOrder && entry.level > 0) {
+            EXPECT_EQ(::fchownat(entry.parentFd, entry.name.c_str(), kMobileUID, kMobileUID,
+                                 AT_SYMLINK_NOFOLLOW),
+                      0)
+                << entry.path;
+        }
+        return {};
+    });
     ASSERT_TRUE(walked);
     EXPECT_EQ(lstatOf(top_ / "d1" / "d2" / "h").st_uid, kMobileUID);
     EXPECT_EQ(lstatOf(top_ / "d1" / "out").st_uid, kMobileUID);
@@ -114,33 +95,31 @@ TEST_F(TraverseListTest, EntriesCanBeChangedThroughTheirParentDescriptor) {
 
 TEST_F(TraverseListTest, BlockErrorStopsTheWalkAndIsReturned) {
     int calls = 0;
-    auto walked = manager_->_traverseDirectory(
-        top_, [&](const QRNFileManager::TraversalEntry& entry) -> Status {
-            ++calls;
-            if (entry.level == 1) {
-                return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorInvalidPath, "stop at {}", entry.name));
-            }
-            return {};
-        });
+    auto walked = manager_._traverseDirectory(top_, [&](const auto& entry) -> Status {
+        ++calls;
+        if (entry.level == 1)
+            return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorInvalidPath, "stop at {}", entry.name));
+        return {};
+    });
     ASSERT_FALSE(walked);
     EXPECT_TRUE(walked.error().isQRN(kQRNErrorInvalidPath));
     EXPECT_EQ(calls, 2) << "no entry after the failing one";
 }
 
 TEST_F(TraverseListTest, FileSystemFailuresEndTheWalkWithTheRootInTheMessage) {
-    auto missing =
-        manager_->_traverseDirectory(top_ / "missing", [](const auto&) -> Status { return {}; });
+    int calls = 0;
+    auto count = [&](const auto&) -> Status {
+        ++calls;
+        return {};
+    };
+    auto missing = manager_._traverseDirectory(top_ / "missing", count);
     ASSERT_FALSE(missing);
     EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
     EXPECT_EQ(missing.error().message,
               "Error for path " + (top_ / "missing").string() + ": No such file or directory");
 
     env_->failCall(EnvCall::ReadDir, 3, EIO);
-    int calls = 0;
-    auto unreadable = manager_->_traverseDirectory(top_, [&](const auto&) -> Status {
-        ++calls;
-        return {};
-    });
+    auto unreadable = manager_._traverseDirectory(top_, count);
     ASSERT_FALSE(unreadable);
     EXPECT_TRUE(unreadable.error().isPOSIX(EIO));
     EXPECT_EQ(unreadable.error().message,
@@ -148,7 +127,7 @@ TEST_F(TraverseListTest, FileSystemFailuresEndTheWalkWithTheRootInTheMessage) {
     EXPECT_LT(calls, 13);
 
     env_->failCall(EnvCall::CloseDir, 1, EBADF);
-    auto closeFailed = manager_->_traverseDirectory(top_, [](const auto&) -> Status { return {}; });
+    auto closeFailed = manager_._traverseDirectory(top_, count);
     ASSERT_FALSE(closeFailed);
     EXPECT_EQ(closeFailed.error().message,
               "fts_close failed for " + top_.string() + " with error Bad file descriptor");
@@ -156,9 +135,8 @@ TEST_F(TraverseListTest, FileSystemFailuresEndTheWalkWithTheRootInTheMessage) {
 
 TEST_F(TraverseListTest, MountPointsOfOtherFileSystemsAreNotEntered) {
     auto mnt = top_ / "e";
-    if (::mount("tmpfs", mnt.c_str(), "tmpfs", 0, "size=1m") != 0) {
+    if (::mount("tmpfs", mnt.c_str(), "tmpfs", 0, "size=1m") != 0)
         GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
-    }
     writeFile(mnt / "inside", "x");
     auto visits = walk(top_);
     ::umount2(mnt.c_str(), MNT_DETACH);
@@ -167,43 +145,122 @@ TEST_F(TraverseListTest, MountPointsOfOtherFileSystemsAreNotEntered) {
     EXPECT_EQ(indexOf(visits, mnt / "inside", Kind::File), -1);
 }
 
-TEST_F(TraverseListTest, ListingSkipsDotNamesAndMarksDirectories) {
-    auto items = manager_->urlsForItemsInDirectoryAtURL(top_);
-    ASSERT_TRUE(items);
-    std::map<std::string, bool> found;
-    for (const auto& item : *items) {
-        EXPECT_EQ(item.url.parent_path(), top_);
-        found[item.url.filename().string()] = item.isDirectory;
+TEST_F(TraverseListTest, ListingSkipsDotNamesAndMarksDirectoriesButNotLinksToThem) {
+    std::map<fs::path, bool> found;
+    for (auto dir : {top_, top_ / "d1"}) {
+        auto items = manager_.urlsForItemsInDirectoryAtURL(dir);
+        ASSERT_TRUE(items);
+        for (const auto& item : *items)
+            found[item.url] = item.isDirectory;
     }
-    EXPECT_EQ(found, (std::map<std::string, bool>{{"d1", true}, {"e", true}, {"f", false}}));
-
-    auto withLink = manager_->urlsForItemsInDirectoryAtURL(top_ / "d1");
-    ASSERT_TRUE(withLink);
-    for (const auto& item : *withLink) {
-        if (item.url.filename() == "out") {
-            EXPECT_FALSE(item.isDirectory) << "a link to a directory is not a directory";
-        }
-    }
+    EXPECT_EQ(found, (std::map<fs::path, bool>{{top_ / "d1", true},
+                                               {top_ / "e", true},
+                                               {top_ / "f", false},
+                                               {top_ / "d1" / "d2", true},
+                                               {top_ / "d1" / "g", false},
+                                               {top_ / "d1" / "out", false}}));
 }
 
 TEST_F(TraverseListTest, ListingFailuresAreLoggedUnlessTheDirectoryIsMissing) {
     LogCapture log;
-    auto missing = manager_->urlsForItemsInDirectoryAtURL(top_ / "missing");
+    auto missing = manager_.urlsForItemsInDirectoryAtURL(top_ / "missing");
     ASSERT_FALSE(missing);
     EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
     EXPECT_EQ(missing.error().message, "_IterateDirectory for " + (top_ / "missing").string() +
                                            " returned No such file or directory");
     EXPECT_FALSE(log.contains("opendir of"));
 
-    auto file = manager_->urlsForItemsInDirectoryAtURL(top_ / "f");
+    auto file = manager_.urlsForItemsInDirectoryAtURL(top_ / "f");
     ASSERT_FALSE(file);
     EXPECT_TRUE(file.error().isPOSIX(ENOTDIR));
     EXPECT_TRUE(log.contains("opendir of " + (top_ / "f").string() + " failed: Not a directory"));
 
     env_->failCall(EnvCall::ReadDir, 2, EIO);
-    auto broken = manager_->urlsForItemsInDirectoryAtURL(top_);
+    auto broken = manager_.urlsForItemsInDirectoryAtURL(top_);
     ASSERT_FALSE(broken);
     EXPECT_TRUE(broken.error().isPOSIX(EIO));
+}
+
+TEST_F(TraverseListTest, DirectoryStructureNamesFilesWithoutAnOwnerAccount) {
+    writeFile(top_ / "d1" / "stray", "s");
+    ::lchown(top_.c_str(), kMobileUID, kMobileUID);
+    for (const auto& entry : fs::recursive_directory_iterator(top_))
+        ::lchown(entry.path().c_str(), kMobileUID, kMobileUID);
+    ASSERT_EQ(::lchown((top_ / "d1" / "stray").c_str(), 4242, 4242), 0);
+    LogCapture log;
+    manager_.printDirectoryStructureAtURL(top_);
+    EXPECT_TRUE(log.contains("\tOrphaned File: " + (top_ / "d1" / "stray").string()));
+    EXPECT_EQ(log.count("Orphaned File:"), 1u) << log.all();
+    EXPECT_TRUE(log.contains("\t    g (uid 501, gid 501, mode 644)")) << log.all();
+
+    log.clear();
+    manager_.printDirectoryStructureAtURL(top_ / "missing");
+    EXPECT_TRUE(log.contains("FTS returned error for " + (top_ / "missing").string() +
+                             " : No such file or directory"));
+}
+
+class DiskUsageTest : public FsTest {
+protected:
+    void SetUp() override {
+        fs::create_directories(tree() / "a" / "b");
+        writeFile(tree() / "small", "x");
+        writeFile(tree() / "a" / "big", std::string(256 * 1024, 'b'));
+        writeFile(tree() / "a" / "b" / "medium", std::string(40 * 1024, 'm'));
+        writeFile(root_ / "/outside", std::string(512 * 1024, 'o'));
+    }
+    fs::path tree() { return root_ / "/private/var/containers/Data/A"; }
+    // The allocated size of the items the test made, counted by hand.
+    std::int64_t allocated(std::initializer_list<const char*> items) {
+        std::int64_t total = 0;
+        for (auto item : items)
+            total += static_cast<std::int64_t>(lstatOf(tree() / item).st_blocks) * 512;
+        return total;
+    }
+    std::int64_t madeTree() { return allocated({"", "a", "a/b", "small", "a/big", "a/b/medium"}); }
+};
+
+TEST_F(DiskUsageTest, AllocatedSizesOfAKnownTree) {
+    const auto expected = madeTree();
+    ASSERT_GE(expected, 296 * 1024) << "the data itself is allocated";
+    EXPECT_EQ(manager_.diskUsageForURL(tree()), expected);
+    EXPECT_EQ(manager_.diskUsageForURL(tree() / "small"), allocated({"small"}));
+
+    // A hard link is counted once; a link's target outside is not counted.
+    fs::create_hard_link(tree() / "a" / "big", tree() / "again");
+    fs::create_symlink(root_ / "/outside", tree() / "link");
+    EXPECT_EQ(manager_.diskUsageForURL(tree()), expected + allocated({"link"}));
+
+    // A sparse file counts what it occupies, not its length.
+    writeFile(tree() / "sparse", "");
+    fs::resize_file(tree() / "sparse", 1 << 30);
+    EXPECT_LT(manager_.diskUsageForURL(tree()), expected + (1 << 20));
+}
+
+TEST_F(DiskUsageTest, FastSizingTriesDirectoryStatisticsThenWalksAndFailuresAreNegative) {
+    LogCapture log;
+    EXPECT_LT(manager_.diskUsageForURL(tree() / "missing"), 0);
+    EXPECT_TRUE(log.contains("Failed to get dirstats on " + (tree() / "missing").string() +
+                             " using fallback: (err 2)"))
+        << log.all();
+    EXPECT_LT(manager_.diskUsageForURL(fs::path()), 0);
+    EXPECT_LT(manager_.fastDiskUsageForURL(fs::path()), 0);
+    EXPECT_TRUE(log.contains("Failed to get path to url"));
+
+    for (bool on : {false, true}) {
+        root_.writeFile("/etc/quarnd/features/quarnd.plist",
+                        std::string("<plist version=\"1.0\"><dict><key>fast_container_sizing</key>"
+                                    "<dict><key>Enabled</key>") +
+                            (on ? "<true/>" : "<false/>") + "</dict></dict></plist>\n");
+        EXPECT_EQ(manager_.fastDiskUsageForURL(tree()), madeTree());
+        EXPECT_EQ(log.contains("dirstats on " + tree().string() + ":"), on) << "off: walk only";
+    }
+    EXPECT_TRUE(log.contains("Failed to set maintain-dir-stats on " + tree().string()));
+    EXPECT_TRUE(log.contains("Failed to get dirstats on " + tree().string() + ": (err " +
+                             std::to_string(ENOTSUP) + ")"));
+    EXPECT_TRUE(log.contains("descendants: 5, total size: " + std::to_string(madeTree()) +
+                             ", using fallback"))
+        << log.all();
+    EXPECT_LT(manager_.fastDiskUsageForURL(tree() / "missing"), 0);
 }
 
 } // namespace

@@ -1,0 +1,369 @@
+// Removal, moves and copies of whole trees.
+#include "FsTestSupport.h"
+
+#include <acl/libacl.h>
+#include <sys/acl.h>
+
+#include <algorithm>
+#include <climits>
+#include <random>
+
+namespace quarn::test {
+namespace {
+
+class RemoveTest : public FsTest {
+protected:
+    void SetUp() override { fs::create_directories(dir()); }
+    fs::path dir() { return root_ / "/private/var/containers/Data"; }
+
+    // name/{f1,f2,b/{f3,fifo,c/{f4}},empty/,link}
+    fs::path makeTree(const char* name = "a") {
+        auto top = dir() / name;
+        fs::create_directories(top / "b" / "c");
+        fs::create_directories(top / "empty");
+        for (auto f : {"f1", "f2", "b/f3", "b/c/f4"})
+            writeFile(top / f, f);
+        fs::create_symlink("f1", top / "link");
+        ::mkfifo((top / "b" / "fifo").c_str(), 0600);
+        return top;
+    }
+};
+
+TEST_F(RemoveTest, RemovesWholeTreesAndTreatsMissingItemsAsSuccess) {
+    auto top = makeTree();
+    ASSERT_TRUE(manager_.removeItemAtURL(top));
+    EXPECT_EQ(countEntries(dir()), 0);
+    EXPECT_TRUE(manager_.removeItemAtURL(top)) << "already gone";
+    EXPECT_TRUE(manager_.removeItemAtURL(dir() / "no" / "such" / "parent"));
+
+    writeFile(dir() / "file", "x");
+    EXPECT_TRUE(manager_.removeItemAtURL(dir() / "file"));
+    EXPECT_FALSE(existsNoFollow(dir() / "file"));
+    makeTree();
+    EXPECT_TRUE(manager_.removeItemAtURL(dir().string() + "/a/")) << "trailing separator";
+    EXPECT_FALSE(existsNoFollow(dir() / "a"));
+
+    auto empty = manager_.removeItemAtURL({});
+    ASSERT_FALSE(empty);
+    EXPECT_TRUE(empty.error().isPOSIX(EFAULT));
+    EXPECT_EQ(empty.error().message, "nil url passed to -removeItemAtURL:error:");
+}
+
+TEST_F(RemoveTest, LinksAreRemovedNeverFollowed) {
+    auto outside = root_ / "/outside";
+    fs::create_directories(outside / "sub");
+    writeFile(outside / "sub" / "keep", "k");
+    writeFile(outside / "keepfile", "k");
+    auto top = makeTree();
+    fs::create_directory_symlink(outside, top / "b" / "dirlink");
+    fs::create_symlink(outside / "keepfile", top / "filelink");
+    fs::create_symlink(outside / "sub", dir() / "rootlink");
+
+    ASSERT_TRUE(manager_.removeItemAtURL(top));
+    ASSERT_TRUE(manager_.removeItemAtURL(dir() / "rootlink")) << "the root itself a link";
+    EXPECT_EQ(countEntries(dir()), 0);
+    EXPECT_EQ(readFile(outside / "sub" / "keep"), "k");
+    EXPECT_EQ(readFile(outside / "keepfile"), "k");
+}
+
+TEST_F(RemoveTest, TenThousandEntriesAreAllRemoved) {
+    auto top = dir() / "big";
+    for (int d = 0; d < 100; ++d) {
+        auto sub = top / ("d" + std::to_string(d));
+        fs::create_directories(sub);
+        for (int f = 0; f < 100; ++f)
+            writeFile(sub / ("f" + std::to_string(f)), "");
+    }
+    ASSERT_EQ(countEntries(top), 10100);
+    ASSERT_TRUE(manager_.removeItemAtURL(top));
+    EXPECT_FALSE(existsNoFollow(top));
+    // One unlink per entry and the root: nothing walked twice.
+    EXPECT_EQ(env_->count(EnvCall::Unlink), 10101u);
+}
+
+TEST_F(RemoveTest, ImmutableEntriesHaveTheFlagClearedAndAreRemoved) {
+    auto top = makeTree();
+    fs::create_directories(top / "frozen" / "inner");
+    writeFile(top / "frozen" / "inner" / "f", "x");
+    fs::create_directories(top / "frozenEmpty");
+    writeFile(top / "frozen" / "g", "g");
+    int err = setImmutable(top / "f1", true);
+    if (err == EOPNOTSUPP || err == ENOTTY || err == EINVAL)
+        GTEST_SKIP() << "the file system refuses the immutable flag (" << std::strerror(err) << ")";
+    ASSERT_EQ(err, 0);
+    // A directory that is immutable blocks removing what is inside it.
+    ASSERT_EQ(setImmutable(top / "frozen", true), 0);
+    ASSERT_EQ(setImmutable(top / "frozenEmpty", true), 0);
+    ASSERT_EQ(::unlink((top / "frozen" / "inner" / "f").c_str()), 0) << "inner is not frozen";
+    ASSERT_NE(::unlink((top / "frozen" / "g").c_str()), 0);
+
+    LogCapture log;
+    auto removed = manager_.removeItemAtURL(top);
+    for (auto frozen : {"f1", "frozen", "frozenEmpty"})
+        setImmutable(top / frozen, false); // let the fixture clean up if it failed
+    ASSERT_TRUE(removed) << removed.error().description() << "\n" << log.all();
+    EXPECT_FALSE(existsNoFollow(top));
+    for (auto frozen : {"f1", "frozenEmpty"})
+        EXPECT_TRUE(log.contains("Unset the immutable flag on " + (top / frozen).string()));
+    auto messages = log.messages();
+    EXPECT_EQ(std::count(messages.begin(), messages.end(),
+                         "Unset the immutable flag on " + (top / "frozen").string()),
+              1)
+        << "cleared once, not once per child";
+}
+
+TEST_F(RemoveTest, FailingEntriesAreReportedWhileTheRestOfTheTreeGoes) {
+    auto top = makeTree();
+    LogCapture log;
+    env_->failCall(EnvCall::Unlink, 3, EIO);
+    env_->failCall(EnvCall::Unlink, 5, EACCES);
+    auto removed = manager_.removeItemAtURL(top);
+    ASSERT_FALSE(removed);
+    EXPECT_TRUE(removed.error().isPOSIX(EIO)) << "the first error wins";
+    EXPECT_EQ(removed.error().message, "remove of " + top.string() + " failed: Input/output error");
+    EXPECT_TRUE(log.contains("remove hit error for "));
+    // Only the two entries that failed and the directories holding them are left.
+    EXPECT_GE(countEntries(top), 1);
+    EXPECT_LE(countEntries(top), 4);
+    EXPECT_GT(env_->count(EnvCall::Unlink), 9u) << "the walk went on";
+    env_->clearFailures();
+    ASSERT_TRUE(manager_.removeItemAtURL(top));
+    EXPECT_FALSE(existsNoFollow(top));
+
+    // EPERM with no immutable flag in the way; a directory that cannot be read.
+    for (auto [call, nth, err] :
+         {std::tuple{EnvCall::Unlink, 1, EPERM}, {EnvCall::ReadDir, 2, EIO}}) {
+        top = makeTree(envCallName(call));
+        env_->failCall(call, nth, err);
+        auto failed = manager_.removeItemAtURL(top);
+        ASSERT_FALSE(failed) << envCallName(call);
+        EXPECT_TRUE(failed.error().isPOSIX(err)) << envCallName(call);
+        EXPECT_TRUE(existsNoFollow(top));
+    }
+    EXPECT_EQ(env_->count(EnvCall::SetFlags), 0u) << "no flag was in the way";
+}
+
+constexpr uid_t kOtherUID = 777;
+constexpr gid_t kOtherGID = 778;
+constexpr const char* kFileACL = "u::rw-,g::r--,g:1501:rwx,m::rwx,o::---";
+constexpr const char* kDefaultACL = "u::rwx,g::r-x,g:1501:rwx,m::rwx,o::---";
+
+// The ACL of `type` in its short text form, or "" when there is none.
+std::string aclText(const fs::path& p, acl_type_t type) {
+    acl_t acl = ::acl_get_file(p.c_str(), type);
+    char* text = acl ? ::acl_to_any_text(acl, nullptr, ',', TEXT_ABBREVIATE) : nullptr;
+    std::string result = text ? text : "";
+    ::acl_free(text);
+    ::acl_free(acl);
+    return result;
+}
+
+void setACL(const fs::path& p, acl_type_t type, const char* text) {
+    acl_t acl = ::acl_from_text(text);
+    ASSERT_EQ(::acl_set_file(p.c_str(), type, acl), 0) << p << ": " << std::strerror(errno);
+    ::acl_free(acl);
+}
+
+class MoveCopyTest : public RemoveTest {
+protected:
+    // Each item's mtime is one second after its atime; the nanoseconds are set alike.
+    static void setTimes(const fs::path& p, time_t seconds, long nanos) {
+        const struct timespec times[2] = {{seconds, nanos}, {seconds + 1, nanos}};
+        ASSERT_EQ(::utimensat(AT_FDCWD, p.c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << p;
+    }
+
+    // A tree with every kind of item and metadata the copy must carry.
+    fs::path makeRichTree() {
+        auto top = dir() / "src";
+        fs::create_directories(top / "sub" / "deeper");
+        std::string data(3 << 20, '\0');
+        std::mt19937 gen(42);
+        for (auto& c : data)
+            c = static_cast<char>(gen());
+        writeFile(top / "data", data);
+        writeFile(top / "sub" / "small", "small");
+        writeFile(top / "sub" / "deeper" / "empty", "");
+        fs::create_symlink("../data", top / "sub" / "link");
+        fs::create_symlink("/nonexistent/target", top / "dangling");
+        ::mkfifo((top / "fifo").c_str(), 0640);
+        ::chown((top / "data").c_str(), kOtherUID, kOtherGID);
+        ::chmod((top / "data").c_str(), 04751); // after the chown, which clears set-id bits
+        ::chmod((top / "sub").c_str(), 0710);
+        ::chown((top / "sub").c_str(), kMobileUID, kMobileUID);
+        ::lchown((top / "sub" / "link").c_str(), kOtherUID, kOtherGID);
+        ::setxattr((top / "sub" / "small").c_str(), "user.note", "hello", 5, 0);
+        ::setxattr((top / "sub").c_str(), kProtectionClassAttribute, "3", 1, 0);
+        setACL(top / "sub" / "small", ACL_TYPE_ACCESS, kFileACL);
+        setACL(top / "sub", ACL_TYPE_DEFAULT, kDefaultACL);
+        setTimes(top / "sub" / "deeper" / "empty", 1000000000, 123456789);
+        setTimes(top / "sub" / "link", 1100000000, 5);
+        setTimes(top / "sub" / "deeper", 1200000000, 7);
+        setTimes(top / "sub", 1300000000, 9);
+        setTimes(top, 1400000000, 11);
+        data_ = data;
+        return top;
+    }
+
+    // Everything makeRichTree set is found at `top`.
+    void expectRichTree(const fs::path& top) {
+        EXPECT_EQ(readFile(top / "data"), data_);
+        EXPECT_EQ(readFile(top / "sub" / "small"), "small");
+        EXPECT_EQ(fs::read_symlink(top / "sub" / "link"), "../data");
+        EXPECT_EQ(fs::read_symlink(top / "dangling"), "/nonexistent/target");
+        EXPECT_TRUE(S_ISFIFO(lstatOf(top / "fifo").st_mode));
+        EXPECT_EQ(lstatOf(top / "fifo").st_mode & 07777, 0640u);
+        auto data = lstatOf(top / "data");
+        EXPECT_EQ(data.st_mode & 07777, 04751u) << "set-id bit survives the chown";
+        EXPECT_EQ(data.st_uid, kOtherUID);
+        EXPECT_EQ(data.st_gid, kOtherGID);
+        EXPECT_EQ(lstatOf(top / "sub").st_mode & 07777, 0710u);
+        EXPECT_EQ(lstatOf(top / "sub").st_uid, kMobileUID);
+        EXPECT_EQ(lstatOf(top / "sub" / "link").st_uid, kOtherUID);
+        EXPECT_EQ(xattrOf(top / "sub" / "small", "user.note"), "hello");
+        EXPECT_EQ(xattrOf(top / "sub"), "3");
+        EXPECT_EQ(aclText(top / "sub" / "small", ACL_TYPE_ACCESS), kFileACL);
+        EXPECT_EQ(aclText(top / "sub", ACL_TYPE_DEFAULT), kDefaultACL);
+        auto empty = lstatOf(top / "sub" / "deeper" / "empty");
+        EXPECT_EQ(empty.st_mtim.tv_sec, 1000000001);
+        EXPECT_EQ(empty.st_mtim.tv_nsec, 123456789);
+        EXPECT_EQ(empty.st_atim.tv_sec, 1000000000);
+        EXPECT_EQ(lstatOf(top / "sub" / "link").st_mtim.tv_sec, 1100000001);
+        // Directory times are set after their contents were written.
+        EXPECT_EQ(lstatOf(top / "sub" / "deeper").st_mtim.tv_sec, 1200000001);
+        EXPECT_EQ(lstatOf(top / "sub").st_mtim.tv_sec, 1300000001);
+        EXPECT_EQ(lstatOf(top).st_mtim.tv_sec, 1400000001);
+    }
+
+    std::string data_;
+};
+
+TEST_F(MoveCopyTest, CopyCarriesDataAndEveryKindOfMetadata) {
+    auto src = makeRichTree();
+    ASSERT_TRUE(manager_.copyItemAtURL(src, dir() / "dst"));
+    expectRichTree(dir() / "dst");
+    expectRichTree(src); // the source is untouched
+}
+
+TEST_F(MoveCopyTest, MoveAcrossFileSystemsLeavesACompleteDestinationAndNoSource) {
+    struct stat shm {};
+    struct stat tmp {};
+    if (::stat("/dev/shm", &shm) != 0 || ::stat(fs::temp_directory_path().c_str(), &tmp) != 0 ||
+        shm.st_dev == tmp.st_dev)
+        GTEST_SKIP() << "no second file system (/dev/shm) to move across";
+    std::string other = "/dev/shm/quarn-test.XXXXXX";
+    ASSERT_TRUE(::mkdtemp(other.data()));
+    std::shared_ptr<void> removeOther(nullptr, [&](void*) { fs::remove_all(other); });
+    if (::setxattr(other.c_str(), "user.probe", "1", 1, 0) != 0)
+        GTEST_SKIP() << "/dev/shm holds no user extended attributes: " << std::strerror(errno);
+    auto src = makeRichTree();
+    ASSERT_TRUE(manager_.moveItemAtURL(src, fs::path(other) / "moved"));
+    EXPECT_EQ(env_->count(EnvCall::Rename), 1u);
+    EXPECT_FALSE(existsNoFollow(src));
+    expectRichTree(fs::path(other) / "moved");
+}
+
+TEST_F(MoveCopyTest, MoveIsARenameAndSucceedsAcrossDevicesEvenWhenTheSourceStays) {
+    auto src = makeRichTree();
+    auto inode = lstatOf(src / "data").st_ino;
+    ASSERT_TRUE(manager_.moveItemIfExistsAtURL(src, dir() / "renamed"));
+    EXPECT_EQ(lstatOf(dir() / "renamed" / "data").st_ino, inode);
+    EXPECT_EQ(env_->count(EnvCall::Open), 0u) << "nothing copied";
+
+    LogCapture log;
+    src = dir() / "renamed";
+    env_->failCall(EnvCall::Rename, 1, EXDEV); // as between two file systems
+    env_->failCallsFrom(EnvCall::Unlink, 1, EIO);
+    ASSERT_TRUE(manager_.moveItemAtURL(src, dir() / "moved"));
+    EXPECT_TRUE(existsNoFollow(src));
+    EXPECT_EQ(readFile(dir() / "moved" / "sub" / "small"), "small");
+    EXPECT_TRUE(log.contains("Failed to remove move source after copy at " + src.string() + " : "));
+}
+
+TEST_F(MoveCopyTest, MissingSourcesAndTheirMessages) {
+    const auto missing = dir() / "missing";
+    const auto x = dir() / "x";
+    EXPECT_TRUE(manager_.moveItemIfExistsAtURL(missing, x));
+    EXPECT_TRUE(manager_.copyItemIfExistsAtURL(missing, x));
+    EXPECT_FALSE(existsNoFollow(x));
+
+    auto moved = manager_.moveItemAtURL(missing, x);
+    ASSERT_FALSE(moved);
+    EXPECT_TRUE(moved.error().isPOSIX(ENOENT));
+    EXPECT_EQ(moved.error().message, "rename of [" + missing.string() + "] to [" + x.string() +
+                                         "] failed: No such file or directory");
+    auto copied = manager_.copyItemAtURL(missing, x);
+    ASSERT_FALSE(copied);
+    EXPECT_TRUE(copied.error().isPOSIX(ENOENT));
+    EXPECT_EQ(copied.error().message, "copy of " + missing.string() + " to " + x.string() +
+                                          " failed: No such file or directory");
+    env_->failCall(EnvCall::Stat, 1, EIO);
+    auto statFailed = manager_.moveItemIfExistsAtURL(missing, x);
+    ASSERT_FALSE(statFailed);
+    EXPECT_EQ(statFailed.error().message,
+              "stat of [" + missing.string() + "] failed: Input/output error");
+}
+
+TEST_F(MoveCopyTest, CopyNeverOverwritesOrFollowsAtTheDestination) {
+    auto src = makeRichTree();
+    fs::create_directories(dir() / "existing");
+    writeFile(dir() / "existing" / "keep", "keep");
+    auto copied = manager_.copyItemAtURL(src, dir() / "existing");
+    ASSERT_FALSE(copied);
+    EXPECT_TRUE(copied.error().isPOSIX(EEXIST));
+    EXPECT_EQ(readFile(dir() / "existing" / "keep"), "keep");
+
+    // A link at the destination name is not written through.
+    fs::create_directories(dir() / "elsewhere");
+    fs::create_directory_symlink(dir() / "elsewhere", dir() / "linkdst");
+    ASSERT_FALSE(manager_.copyItemAtURL(src / "sub" / "small", dir() / "linkdst"));
+    EXPECT_EQ(countEntries(dir() / "elsewhere"), 0);
+    // A source that is a link is copied as a link.
+    ASSERT_TRUE(manager_.copyItemAtURL(src / "sub" / "link", dir() / "copiedlink"));
+    EXPECT_EQ(fs::read_symlink(dir() / "copiedlink"), "../data");
+    // A copy into its own subdirectory ends.
+    ASSERT_TRUE(manager_.copyItemAtURL(src, src / "sub" / "copy"));
+    EXPECT_EQ(readFile(src / "sub" / "copy" / "sub" / "small"), "small");
+    EXPECT_FALSE(existsNoFollow(src / "sub" / "copy" / "sub" / "copy"));
+}
+
+TEST_F(MoveCopyTest, FailedCopyRemovesWhatItMade) {
+    auto src = makeRichTree();
+    // Data is cloned, or copied by copy_file_range, or read and written:
+    // make all three fail on the second file.
+    env_->failCallsFrom(EnvCall::Clone, 2, EIO);
+    env_->failCallsFrom(EnvCall::CopyRange, 2, EIO);
+    env_->failCallsFrom(EnvCall::Write, 2, EIO);
+    env_->failCall(EnvCall::SetXattr, 3, ENOSPC);
+    ASSERT_FALSE(manager_.copyItemAtURL(src, dir() / "dst"));
+    EXPECT_FALSE(existsNoFollow(dir() / "dst"));
+    EXPECT_TRUE(existsNoFollow(src / "sub" / "small"));
+}
+
+TEST_F(MoveCopyTest, TreesDeeperThanAPathCanBeAreCopiedWalkedAndRemoved) {
+    makeDeepTree(dir() / "deep", 150); // about 6000 characters of path
+    ASSERT_TRUE(manager_.copyItemAtURL(dir() / "deep", dir() / "copy"));
+    int directories = 0;
+    std::string bottom;
+    auto walked = manager_._traverseDirectory(
+        dir() / "copy", [&](const QRNFileManager::TraversalEntry& entry) -> Status {
+            directories += entry.kind == QRNFileManager::TraversalEntry::Kind::DirectoryPreOrder;
+            if (entry.name == "bottom") {
+                char buffer[8] = {};
+                int fd = ::openat(entry.parentFd, "bottom", O_RDONLY | O_CLOEXEC);
+                EXPECT_EQ(::read(fd, buffer, sizeof buffer), 4);
+                ::close(fd);
+                bottom = buffer;
+                EXPECT_GT(entry.path.string().size(), std::size_t{PATH_MAX});
+            }
+            return {};
+        });
+    ASSERT_TRUE(walked) << walked.error().description();
+    EXPECT_EQ(directories, 151);
+    EXPECT_EQ(bottom, "deep");
+    EXPECT_TRUE(manager_.removeItemAtURL(dir() / "copy"));
+    EXPECT_TRUE(manager_.removeItemAtURL(dir() / "deep"));
+    EXPECT_EQ(countEntries(dir()), 0);
+}
+
+} // namespace
+} // namespace quarn::test
