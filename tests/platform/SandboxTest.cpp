@@ -1,0 +1,229 @@
+// Sandbox extension tokens, their issuer with its key file, and the
+// in-memory sandbox kernel.
+
+#include "Daemon/platform/LinuxSandboxExtensions.h"
+#include "Daemon/platform/SandboxExtensionToken.h"
+#include "Daemon/platform/SandboxKernel.h"
+
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <iterator>
+#include <sstream>
+#include <vector>
+
+using namespace quarn;
+
+namespace {
+
+using Token = SandboxExtensionToken;
+using Parts = std::vector<std::string>;
+
+Token::Key keyOf(std::uint8_t fill) {
+    Token::Key key;
+    key.fill(fill);
+    return key;
+}
+
+Parts partsOf(const std::string& token) {
+    Parts parts;
+    std::stringstream in(token);
+    for (std::string part; std::getline(in, part, ';');) {
+        parts.push_back(part);
+    }
+    return parts;
+}
+
+std::string joined(const Parts& parts, std::size_t index = 0,
+                   std::optional<std::string> value = {}) {
+    std::string token;
+    for (std::size_t i = 0; i < parts.size(); ++i) {
+        token += (i ? ";" : "") + (i == index && value ? *value : parts[i]);
+    }
+    return token;
+}
+
+// The last hex digit flipped (0 <-> 1 keeps it lower-case hex).
+std::string flipped(std::string field) {
+    field.back() = field.back() == '0' ? '1' : '0';
+    return field;
+}
+
+const std::string kClass = "com.orvex.sandbox.container";
+const std::string kPath = "/private/var/mobile/Containers/Data/Application/X;Y";
+
+} // namespace
+
+TEST(SandboxExtensionTokenTest, VerifiesOnlyUnderItsKeyWithEveryFieldUnchanged) {
+    const auto token = Token::make(keyOf(7), kClass, kPath, 4242, 123456789);
+    ASSERT_TRUE(token);
+    const auto fields = Token::parse(*token);
+    ASSERT_TRUE(fields);
+    EXPECT_EQ(std::tie(fields->extensionClass, fields->path, fields->pid, fields->startTime),
+              std::make_tuple(kClass, kPath, 4242u, 123456789u));
+    EXPECT_TRUE(Token::verify(*token, keyOf(7)));
+    EXPECT_FALSE(Token::verify(*token, keyOf(8)));
+
+    const Parts parts = partsOf(*token);
+    ASSERT_EQ(parts.size(), 6u);
+    for (const auto& forged :
+         {joined(parts, 1, "com.orvex.sandbox.application-group"), joined(parts, 2, "4243"),
+          joined(parts, 3, "123456788"), joined(parts, 4, flipped(parts[4])),
+          joined(parts, 5, flipped(parts[5]))}) {
+        EXPECT_TRUE(Token::parse(forged)) << forged;
+        EXPECT_FALSE(Token::verify(forged, keyOf(7))) << forged;
+    }
+
+    // Class "a.b" with path "/c" and class "a" with path ".b/c" concatenate
+    // alike; the MAC of one must not carry over to the other.
+    const auto first = Token::make(keyOf(3), "a.b", "/c", 1, 2);
+    const auto second = Token::make(keyOf(3), "a", ".b/c", 1, 2);
+    ASSERT_TRUE(first && second);
+    EXPECT_FALSE(Token::verify(joined(partsOf(*second), 5, partsOf(*first)[5]), keyOf(3)));
+}
+
+TEST(SandboxExtensionTokenTest, RefusesFieldsThatCannotBeWrittenGarbageAndSecondSpellings) {
+    const auto key = keyOf(5);
+    for (const auto& [cls, path] : std::initializer_list<std::pair<std::string, std::string>>{
+             {"", kPath},
+             {"a;b", kPath},
+             {"with space", kPath},
+             {kClass, ""},
+             {kClass, std::string(Token::kMaxPathSize + 1, 'p')}}) {
+        EXPECT_FALSE(Token::make(key, cls, path, 1, 1)) << cls << " " << path.size();
+    }
+
+    const auto token = Token::make(key, "c", "/p", 12, 34);
+    ASSERT_TRUE(token);
+    const auto parts = partsOf(*token);
+    std::string upper = parts[5];
+    for (char& c : upper) {
+        c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+    }
+    for (const auto& text :
+         {std::string(), std::string("v1"), joined(parts, 0, "v2"), *token + ";extra",
+          joined({parts.begin(), parts.end() - 1}), joined(parts, 2, "012"),
+          joined(parts, 2, "+12"), joined(parts, 2, "4294967296"), joined(parts, 3, "-1"),
+          joined(parts, 4, ""), joined(parts, 4, parts[4] + "0"), joined(parts, 4, "zz"),
+          joined(parts, 5, parts[5].substr(2)), joined(parts, 5, upper), std::string(20000, 'a')}) {
+        EXPECT_FALSE(Token::parse(text)) << text;
+        EXPECT_FALSE(Token::verify(text, key)) << text;
+    }
+}
+
+namespace {
+
+class SandboxExtensionsTest : public quarn::test::TempRootTest {
+protected:
+    std::filesystem::path keyFile() const {
+        return Paths(root_.path()).runDirectory() / LinuxSandboxExtensions::kKeyFileName;
+    }
+    Token::Key keyFromFile() const {
+        struct stat st {};
+        EXPECT_EQ(::stat(keyFile().c_str(), &st), 0);
+        EXPECT_EQ(st.st_mode & 07777, 0600u);
+        std::ifstream in(keyFile(), std::ios::binary);
+        const std::string bytes{std::istreambuf_iterator<char>(in), {}};
+        Token::Key key{};
+        EXPECT_EQ(bytes.size(), key.size());
+        std::copy_n(bytes.begin(), std::min(bytes.size(), key.size()), key.begin());
+        return key;
+    }
+    Paths paths() const { return Paths(root_.path()); }
+};
+
+} // namespace
+
+TEST_F(SandboxExtensionsTest, IssuesTokensTheKeyFileVerifiesAndRefusesEmptyPathAndPidZero) {
+    LinuxSandboxExtensions extensions(paths());
+    auto peer = IpcPeer::fromPID(::getpid());
+    ASSERT_TRUE(peer);
+    auto issued = extensions.issueFileExtension(
+        SandboxExtensions::kContainerClass, "/private/var/mobile/Containers/X", peer->auditToken());
+    ASSERT_TRUE(issued) << issued.error().description();
+    EXPECT_TRUE(Token::verify(*issued, keyFromFile()));
+    const auto fields = Token::parse(*issued);
+    ASSERT_TRUE(fields);
+    EXPECT_EQ(fields->pid, static_cast<std::uint32_t>(::getpid()));
+    EXPECT_EQ(fields->startTime, IpcPeer::fieldsOfAuditToken(peer->auditToken()).startTime);
+
+    IpcPeer::TokenFields kernel = IpcPeer::fieldsOfAuditToken(peer->auditToken());
+    kernel.pid = 0;
+    for (const auto& [path, token] :
+         {std::pair{"", peer->auditToken()}, std::pair{"/p", IpcPeer::makeAuditToken(kernel)}}) {
+        auto refused =
+            extensions.issueFileExtension(SandboxExtensions::kContainerClass, path, token);
+        ASSERT_FALSE(refused) << path;
+        EXPECT_EQ(refused.error().domain, Error::Domain::POSIX) << path;
+    }
+}
+
+TEST_F(SandboxExtensionsTest, KeyIsSharedThroughTheFileKeptInMemoryAndReplacedWhenUnusable) {
+    auto keyNow = [](LinuxSandboxExtensions& extensions) {
+        auto key = extensions.key();
+        EXPECT_TRUE(key);
+        return key ? *key : Token::Key{};
+    };
+    LinuxSandboxExtensions first(paths());
+    LinuxSandboxExtensions second(paths());
+    const Token::Key firstKey = keyNow(first);
+    EXPECT_EQ(keyNow(second), firstKey);
+    // Once read, the key no longer depends on the file.
+    std::filesystem::remove(keyFile());
+    EXPECT_EQ(keyNow(first), firstKey);
+
+    for (const auto& [contents, mode] :
+         {std::pair<std::string, mode_t>{"short", 0600},
+          std::pair<std::string, mode_t>{std::string(32, 'k'), 0644}}) {
+        std::ofstream(keyFile(), std::ios::binary | std::ios::trunc) << contents;
+        ::chmod(keyFile().c_str(), mode);
+        LinuxSandboxExtensions fresh(paths());
+        const Token::Key key = keyNow(fresh);
+        EXPECT_EQ(keyFromFile(), key);
+        EXPECT_NE(std::string(key.begin(), key.end()), contents);
+    }
+}
+
+namespace {
+SandboxItem item(std::string id, std::uint64_t cls, std::string path) {
+    return SandboxItem{1, std::move(id), cls, 501, std::move(path)};
+}
+} // namespace
+
+TEST(SandboxKernel, MappingsArePerUserAndReplaceByIdentity) {
+    InMemorySandboxKernel k;
+    EXPECT_EQ(k.setContainerMapping(501, item("com.a", 2, "/c/A")), 0);
+    EXPECT_EQ(k.setContainerMapping(501, item("com.a", 2, "/c/B")), 0); // same container, new path
+    EXPECT_EQ(k.setContainerMapping(501, item("com.a", 4, "/c/P")), 0);
+    EXPECT_EQ(k.setContainerMapping(502, item("com.a", 2, "/d/A")), 0);
+    std::vector<std::string> paths;
+    k.forEachItem(501, [&](const SandboxItem& i) {
+        paths.push_back(i.path);
+        return true;
+    });
+    EXPECT_EQ(paths, (std::vector<std::string>{"/c/B", "/c/P"}));
+    EXPECT_EQ(k.count(502), 1u);
+    EXPECT_EQ(k.count(503), 0u);
+
+    EXPECT_EQ(k.removeContainerMapping(501, item("com.a", 2, "")), 0);
+    EXPECT_EQ(k.removeContainerMapping(501, item("com.a", 2, "")), ENOENT);
+    EXPECT_EQ(k.count(501), 1u);
+    EXPECT_EQ(k.setContainerMapping(501, item("", 2, "/x")), EINVAL);
+
+    // Iteration stops when asked and tolerates removal from inside.
+    for (int i = 0; i < 4; ++i) {
+        k.setContainerMapping(501, item("id" + std::to_string(i), 2, "/p"));
+    }
+    int seen = 0;
+    k.forEachItem(501, [&](const SandboxItem& i) {
+        k.removeContainerMapping(501, i); // must not deadlock
+        return ++seen < 3;
+    });
+    EXPECT_EQ(seen, 3);
+    EXPECT_EQ(k.count(501), 2u);
+}
