@@ -188,37 +188,30 @@ TEST(PropertyList, HostileBytesGiveErrorsNotCrashes) {
 }
 
 TEST(PropertyList, RefusesShapesThatWouldExhaustTheParser) {
+    auto refusal = [](const Bytes& bytes) { return messageOf(valueFromPropertyListBytes(bytes)); };
     std::string deepXML = "<plist>";
-    for (int i = 0; i < 100000; ++i) {
+    for (int i = 0; i < 100000; ++i)
         deepXML += "<array>";
-    }
     EXPECT_NE(messageOf(parse(deepXML)).find("nested too deeply"), std::string::npos);
 
     auto chain = [](std::uint16_t levels) {
         std::vector<Bytes> objects;
-        for (std::uint16_t i = 1; i < levels; ++i) {
+        for (std::uint16_t i = 1; i < levels; ++i)
             objects.push_back(arrayOf({i}));
-        }
         objects.push_back({0x10, 0x05});
         return binaryFrom(objects);
     };
-    EXPECT_NE(messageOf(valueFromPropertyListBytes(chain(5000))).find("nested too deeply"),
-              std::string::npos);
+    EXPECT_NE(refusal(chain(5000)).find("nested too deeply"), std::string::npos);
     EXPECT_TRUE(valueFromPropertyListBytes(chain(100)));
 
     // Each level refers twice to the next: 2^40 nodes once expanded.
     std::vector<Bytes> laughs;
-    for (std::uint16_t i = 1; i <= 40; ++i) {
+    for (std::uint16_t i = 1; i <= 40; ++i)
         laughs.push_back(arrayOf({i, i}));
-    }
     laughs.push_back({0x10, 0x01});
-    EXPECT_NE(messageOf(valueFromPropertyListBytes(binaryFrom(laughs))).find("too many objects"),
-              std::string::npos);
-
-    EXPECT_NE(messageOf(valueFromPropertyListBytes(binaryFrom({arrayOf({0})}))).find("cycle"),
-              std::string::npos);
-    EXPECT_NE(messageOf(valueFromPropertyListBytes(binaryFrom({arrayOf({7})}))).find("outside"),
-              std::string::npos);
+    EXPECT_NE(refusal(binaryFrom(laughs)).find("too many objects"), std::string::npos);
+    EXPECT_NE(refusal(binaryFrom({arrayOf({0})})).find("cycle"), std::string::npos);
+    EXPECT_NE(refusal(binaryFrom({arrayOf({7})})).find("outside"), std::string::npos);
     // A keyed-archive UID means nothing outside its archive.
     EXPECT_FALSE(valueFromPropertyListBytes(binaryFrom({arrayOf({1}), {0x80, 0x01}})));
 }

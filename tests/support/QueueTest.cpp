@@ -6,7 +6,8 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
+#include <functional>
+#include <future>
 #include <latch>
 #include <memory>
 #include <mutex>
@@ -21,22 +22,11 @@ namespace {
 
 // A one-shot gate. Waits are bounded only so that a broken queue fails the
 // test instead of hanging it; nothing is measured.
-class Gate {
-public:
-    void open() {
-        std::lock_guard lock(mutex_);
-        open_ = true;
-        cv_.notify_all();
-    }
-    bool wait() {
-        std::unique_lock lock(mutex_);
-        return cv_.wait_for(lock, 30s, [&] { return open_; });
-    }
-
-private:
-    std::mutex mutex_;
-    std::condition_variable cv_;
-    bool open_ = false;
+struct Gate {
+    std::promise<void> promise;
+    std::shared_future<void> future = promise.get_future().share();
+    void open() { promise.set_value(); }
+    bool wait() const { return future.wait_for(30s) == std::future_status::ready; }
 };
 
 // Counts concurrently running blocks and remembers the peak.
@@ -299,43 +289,40 @@ TEST(Queue, BlocksOwnMoveOnlyCapturesUntilTheyFinish) {
     EXPECT_EQ(ProcessTransaction::count(), 0u);
 }
 
-using QueueDeathTest = ::testing::Test;
-
-TEST_F(QueueDeathTest, MisuseStopsTheProcess) {
+TEST(QueueDeathTest, MisuseStopsTheProcess) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
+    const std::pair<std::function<void()>, const char*> misuses[] = {
+        {[] {
+             Queue q("self");
+             q.sync([&] { q.sync([] {}); });
+         },
+         "sync onto a queue the caller is already running on"},
+        {[] {
+             Queue a("a"), b("b");
+             a.sync([&] { b.sync([&] { a.sync([] {}); }); });
+         },
+         "already running on"},
+        {[] {
+             Queue q("unbalanced");
+             q.suspend();
+             q.resume();
+             q.resume();
+         },
+         "not suspended"},
+        {[] {
+             Queue q("elsewhere");
+             QRN_ASSERT_ON_QUEUE(q);
+         },
+         "must run on queue elsewhere"},
+    };
     // The fault line is the last word before the abort: show it on stderr.
-    auto faultsToStderr = [] { Log::addStderr(); };
-    EXPECT_DEATH(
-        {
-            faultsToStderr();
-            Queue q("self");
-            q.sync([&] { q.sync([] {}); });
-        },
-        "sync onto a queue the caller is already running on");
-    EXPECT_DEATH(
-        {
-            faultsToStderr();
-            Queue a("a");
-            Queue b("b");
-            a.sync([&] { b.sync([&] { a.sync([] {}); }); });
-        },
-        "already running on");
-    EXPECT_DEATH(
-        {
-            faultsToStderr();
-            Queue q("unbalanced");
-            q.suspend();
-            q.resume();
-            q.resume();
-        },
-        "not suspended");
-    EXPECT_DEATH(
-        {
-            faultsToStderr();
-            Queue q("elsewhere");
-            QRN_ASSERT_ON_QUEUE(q);
-        },
-        "must run on queue elsewhere");
+    for (const auto& [misuse, message] : misuses)
+        EXPECT_DEATH(
+            {
+                Log::addStderr();
+                misuse();
+            },
+            message);
 }
 
 TEST(ProcessTransaction, CountsOpenTransactionsOnce) {
