@@ -1,8 +1,6 @@
 // The request service's socket: frames, peers, the listener, and who wrote
 // each message (the credentials the kernel stamps on every write).
 
-#include "Daemon/platform/CborCodec.h"
-#include "Daemon/platform/IpcFrame.h"
 #include "Daemon/platform/IpcListener.h"
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/platform/Paths.h"
@@ -25,7 +23,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <chrono>
 #include <condition_variable>
 #include <fstream>
 #include <map>
@@ -112,14 +109,15 @@ TEST(IpcPeerTest, SocketPeerIsThisProcessWithItsToken) {
     const auto startTime = IpcPeer::processStartTime(::getpid());
     ASSERT_TRUE(startTime);
     EXPECT_EQ(peer->startTime(), *startTime);
+    const auto u32 = [](auto v) { return static_cast<std::uint32_t>(v); };
     const IpcPeer::TokenFields expected{IpcPeer::fieldsOfAuditToken(peer->auditToken()).loginUID,
                                         ::geteuid(),
                                         ::getegid(),
                                         ::getuid(),
                                         ::getgid(),
-                                        static_cast<std::uint32_t>(::getpid()),
-                                        static_cast<std::uint32_t>(::getsid(0)),
-                                        static_cast<std::uint32_t>(*startTime)};
+                                        u32(::getpid()),
+                                        u32(::getsid(0)),
+                                        u32(*startTime)};
     EXPECT_EQ(peer->auditToken(), IpcPeer::makeAuditToken(expected));
     EXPECT_EQ(IpcPeer::fromPID(::getpid())->auditToken(), peer->auditToken());
 }
