@@ -54,27 +54,22 @@ protected:
 
 } // namespace
 
-TEST_F(PropertyListFileTest, AtomicWriteReplacesTheFileAndLeavesNothingBehind) {
-    fs::path file = dir_ / "state.plist";
-    write(file, "old contents");
-    WriteOptions all{.atomic = true, .lowestProtection = true, .fsync = true};
-    ASSERT_TRUE(QRN_writeToURL(dict_, file, all));
-    EXPECT_EQ(entries(), std::set<std::string>{"state.plist"});
-    EXPECT_EQ(contents(file).substr(0, 8), "bplist00");
-    EXPECT_EQ(protectionClassOf(file), ProtectionClassAttribute::kLowestClass);
-    auto back = QRN_dictionaryWithContentsOfURL(file);
-    ASSERT_TRUE(back);
-    EXPECT_EQ(*back, dict_);
-}
-
-TEST_F(PropertyListFileTest, InPlaceWriteKeepsOtherOptions) {
-    fs::path file = dir_ / "metadata.plist";
-    write(file, std::string(10000, 'x')); // longer than the new contents: truncated
-    ASSERT_TRUE(QRN_writeToURL(dict_, file, {.lowestProtection = true}));
-    EXPECT_EQ(QRN_dictionaryWithContentsOfURL(file).value_or(Value()), dict_);
-    EXPECT_EQ(protectionClassOf(file), ProtectionClassAttribute::kLowestClass);
-    ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / "plain.plist"));
-    EXPECT_EQ(protectionClassOf(dir_ / "plain.plist"), ProtectionClassAttribute::kNoClass);
+TEST_F(PropertyListFileTest, WritesReplaceTheFileAndLeaveNothingBehind) {
+    // Each over an older, longer file (in place: truncated); a class only when asked.
+    using P = ProtectionClassAttribute;
+    const std::tuple<const char*, WriteOptions, int> writes[] = {
+        {"atomic", {.atomic = true, .lowestProtection = true, .fsync = true}, P::kLowestClass},
+        {"inPlace", {.lowestProtection = true}, P::kLowestClass},
+        {"plain", {}, P::kNoClass}};
+    for (const auto& [name, options, protectionClass] : writes) {
+        SCOPED_TRACE(name);
+        write(dir_ / name, std::string(10000, 'x'));
+        ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / name, options));
+        EXPECT_EQ(contents(dir_ / name).substr(0, 8), "bplist00");
+        EXPECT_EQ(protectionClassOf(dir_ / name), protectionClass);
+        EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / name).value_or(Value()), dict_);
+    }
+    EXPECT_EQ(entries(), (std::set<std::string>{"atomic", "inPlace", "plain"}));
 }
 
 TEST_F(PropertyListFileTest, FailedWritesLeaveTheOldFileAlone) {
