@@ -22,7 +22,8 @@ namespace {
 
 class HandlerGroupsTest : public VellEventFixture {
 protected:
-    static Value groupRequest(std::uint64_t command, const char* key, const std::string& name) {
+    static Value groupRequest(std::uint64_t command, const std::string& name,
+                              const char* key = "Identifier") {
         return dictionaryOf({{"Command", Value(command)}, {key, Value(name)}});
     }
     static std::filesystem::path pathIn(const Value& reply, const char* key, const char* group) {
@@ -33,86 +34,81 @@ protected:
 };
 
 TEST_F(HandlerGroupsTest, GroupIdentifiersOfTheClientFromItsRecord) {
-    setClient(kVellClient, dictionaryOf({{"com.orvex.private.Quarn.allowed", Value(true)}}));
-    EXPECT_EQ(*send(groupRequest(14, "Identifier", "ignored")).get("ReplyGroupIdentifiersArray"),
-              Value::array());
+    setClient(kVellClient, allowed());
+    const Value request = groupRequest(14, "ignored");
+    EXPECT_EQ(*send(request).get("ReplyGroupIdentifiersArray"), Value::array());
     mapping_->appGroups[kVellClient] = arrayOf({Value("group.a"), Value(3u), Value("group.b")});
-    EXPECT_EQ(*send(groupRequest(14, "Identifier", "ignored")).get("ReplyGroupIdentifiersArray"),
+    EXPECT_EQ(*send(request).get("ReplyGroupIdentifiersArray"),
               arrayOf({Value("group.a"), Value("group.b")}));
     mapping_->appGroups[kVellClient] = Value("group.a");
-    EXPECT_EQ(replyError(send(groupRequest(14, "Identifier", "ignored"))), 11u);
+    EXPECT_EQ(codeOf(request), 11u);
     EXPECT_EQ(QRNGroupManager::defaultManager()
                   .groupContainerIdentifiersForOwnerIdentifier("", 7)
                   .error(),
               11u);
 }
 
-TEST_F(HandlerGroupsTest, GroupContainersOfAnOwnerSkipTheOnesThatCannotBeMade) {
+TEST_F(HandlerGroupsTest, GroupContainersOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingBadOnes) {
+    // Its lookups take no lock of their own, so two requests that reach the
+    // same new group at once would each create one.
     mapping_->appGroups[kVellClient] = arrayOf({Value("group.a"), Value(""), Value("group.b")});
-    Value reply = send(groupRequest(13, "Identifier", kVellClient));
+    std::vector<std::int32_t> states;
+    mapping_->onQuery = [&states] {
+        states.push_back(QRNLocks::shared().snapshot().allReaderWriterState);
+    };
+    Value reply = send(groupRequest(13, kVellClient));
     ASSERT_EQ(replyError(reply), 1u) << reply.description();
+    EXPECT_EQ(states, std::vector<std::int32_t>{-1});
+    EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
     EXPECT_EQ(reply.get("ReplyGroupContainerDict")->size(), 2u);
     EXPECT_TRUE(std::filesystem::is_directory(pathIn(reply, "ReplyGroupContainerDict", "group.a")));
     EXPECT_TRUE(cached("group.b", kQRNContainerClassAppGroup));
     EXPECT_EQ(reply.get("ReplySandboxTokenDict"), nullptr);
 }
 
-TEST_F(HandlerGroupsTest, AnOwnersGroupsAreFoundAndMadeUnderTheGlobalWriteLock) {
-    // Its lookups take no lock of their own, so two requests that reach the
-    // same new group at once would each create one.
-    mapping_->appGroups[kVellClient] = arrayOf({Value("group.a")});
-    std::vector<std::int32_t> states;
-    mapping_->onQuery = [&states] {
-        states.push_back(QRNLocks::shared().snapshot().allReaderWriterState);
-    };
-    ASSERT_EQ(replyError(send(groupRequest(13, "Identifier", kVellClient))), 1u);
-    EXPECT_EQ(states, std::vector<std::int32_t>{-1});
-    EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
-}
-
 TEST_F(HandlerGroupsTest, AnotherOwnersGroupsNeedALookupGrant) {
     mapping_->appGroups["com.example.owner"] = arrayOf({Value("group.o")});
-    EXPECT_EQ(replyError(send(groupRequest(13, "Identifier", "com.example.owner"))), 55u);
+    EXPECT_EQ(codeOf(groupRequest(13, "com.example.owner")), 55u);
     EXPECT_FALSE(cached("group.o", kQRNContainerClassAppGroup));
     setClient(
         kVellClient,
         dictionaryOf({{"com.orvex.private.Quarn.lookup",
                        dictionaryOf({{"appGroup", arrayOf({Value("com.example.owner")})}})}}));
-    Value reply = send(groupRequest(13, "Identifier", "com.example.owner"));
+    Value reply = send(groupRequest(13, "com.example.owner"));
     EXPECT_FALSE(pathIn(reply, "ReplyGroupContainerDict", "group.o").empty())
         << reply.description();
 }
 
 TEST_F(HandlerGroupsTest, SystemGroupsOfAnOwner) {
     mapping_->systemGroups[kVellClient] = arrayOf({Value("systemgroup.com.example.one")});
-    Value reply = send(groupRequest(16, "Identifier", kVellClient));
+    Value reply = send(groupRequest(16, kVellClient));
     std::filesystem::path path =
         pathIn(reply, "ReplyGroupContainerDict", "systemgroup.com.example.one");
     EXPECT_EQ(path.parent_path().parent_path().filename(), "Shared") << reply.description();
 }
 
 TEST_F(HandlerGroupsTest, OneSystemGroupByEntitlementOrWhenOpenToAll) {
-    const char* key = "GroupIdentifier";
-    Value logging = send(groupRequest(17, key, "systemgroup.com.orvex.sharedpclogging"));
+    auto one = [](const char* group) { return groupRequest(17, group, "GroupIdentifier"); };
+    Value logging = send(one("systemgroup.com.orvex.sharedpclogging"));
     EXPECT_EQ(replyError(logging), 1u) << logging.description();
     EXPECT_TRUE(std::filesystem::is_directory(*logging.get("ReplyPath")->asString()));
 
-    Value wellknown = send(groupRequest(17, key, "systemgroup.com.orvex.pairing"));
+    Value wellknown = send(one("systemgroup.com.orvex.pairing"));
     ASSERT_EQ(replyError(wellknown), 1u);
     EXPECT_EQ(std::filesystem::path(*wellknown.get("ReplyPath")->asString()).filename(),
               "systemgroup.com.orvex.pairing");
 
     LogCapture log;
-    EXPECT_EQ(replyError(send(groupRequest(17, key, "systemgroup.com.example.secret"))), 55u);
+    EXPECT_EQ(codeOf(one("systemgroup.com.example.secret")), 55u);
     EXPECT_TRUE(log.contains("com.example.vellclient is not entitled for system group identifier: "
                              "systemgroup.com.example.secret.  Only entitled for: []"))
         << log.all();
 
     mapping_->systemGroups[kVellClient] = arrayOf({Value("systemgroup.com.example.secret")});
-    Value entitled = send(groupRequest(17, key, "systemgroup.com.example.secret"));
+    Value entitled = send(one("systemgroup.com.example.secret"));
     EXPECT_EQ(replyError(entitled), 1u);
     EXPECT_TRUE(entitled.get("ReplyPath"));
-    EXPECT_EQ(replyError(send(dictionaryOf({{"Command", Value(17u)}}))), 18u);
+    EXPECT_EQ(codeOf(dictionaryOf({{"Command", Value(17u)}})), 18u);
 }
 
 // Tokens: handlers run directly, since a client's persona comes from its
@@ -140,42 +136,37 @@ protected:
         EXPECT_EQ(error, expected) << request.description();
         return reply.dictionary();
     }
-    static Value create(std::uint64_t cls) {
-        return dictionaryOf({{"ContainerClass", Value(cls)}, {"CreateIfNecessary", Value(true)}});
+    Value createIn(std::uint64_t cls, QRNClientConnection& client) {
+        return run(
+            &QRNCommandHandlers::createOrLookupContainer,
+            dictionaryOf({{"ContainerClass", Value(cls)}, {"CreateIfNecessary", Value(true)}}),
+            client);
     }
 };
 
 TEST_F(SandboxTokenTest, OnlySandboxedEnterpriseClientsGetTokens) {
     LogCapture log;
     auto sandboxed = client(enterprise(), true);
-    Value data = run(&QRNCommandHandlers::createOrLookupContainer, create(2), *sandboxed);
+    Value data = createIn(2, *sandboxed);
     const std::string path = *data.get("ReplyPath")->asString();
     const std::string devicePath = Paths(root_.path()).devicePath(path);
     ASSERT_NE(devicePath, path);
     EXPECT_EQ(*data.get("ReplySandboxToken"),
               Value("token:com.orvex.sandbox.container:" + devicePath));
     EXPECT_EQ(*data.get("ReplyPersonaUniqueString"), Value("P-ENT"));
-    ASSERT_EQ(extensions_->issued.size(), 1u);
-    EXPECT_EQ(extensions_->issued[0].token[0], 0xAB);
+    ASSERT_EQ(extensions_->tokens.size(), 1u);
+    EXPECT_EQ(extensions_->tokens[0][0], 0xAB);
 
-    // A class without an extension class, and the same persona unsandboxed.
-    EXPECT_EQ(run(&QRNCommandHandlers::createOrLookupContainer, create(9), *sandboxed)
-                  .get("ReplySandboxToken"),
-              nullptr);
+    // A class without an extension class, the same persona unsandboxed, and
+    // a sandboxed client of the personal persona get none.
+    EXPECT_EQ(createIn(9, *sandboxed).get("ReplySandboxToken"), nullptr);
     EXPECT_TRUE(log.contains("is sandboxed and container (type: 9) is enterprise: 1. NOT issuing"));
-    EXPECT_EQ(
-        run(&QRNCommandHandlers::createOrLookupContainer, create(2), *client(enterprise(), false))
-            .get("ReplySandboxToken"),
-        nullptr);
-    EXPECT_EQ(run(&QRNCommandHandlers::createOrLookupContainer, create(2), *client(user(), true))
-                  .get("ReplySandboxToken"),
-              nullptr);
-    EXPECT_EQ(extensions_->issued.size(), 1u);
+    EXPECT_EQ(createIn(2, *client(enterprise(), false)).get("ReplySandboxToken"), nullptr);
+    EXPECT_EQ(createIn(2, *client(user(), true)).get("ReplySandboxToken"), nullptr);
+    EXPECT_EQ(extensions_->tokens.size(), 1u);
 
     extensions_->failing = true;
-    EXPECT_EQ(run(&QRNCommandHandlers::createOrLookupContainer, create(2), *sandboxed)
-                  .get("ReplySandboxToken"),
-              nullptr);
+    EXPECT_EQ(createIn(2, *sandboxed).get("ReplySandboxToken"), nullptr);
     EXPECT_TRUE(
         log.contains("issuing a sandbox extension failed for com.example.vellclient at path " +
                      devicePath + ": 1"))

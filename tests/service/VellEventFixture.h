@@ -6,27 +6,30 @@
 // group records stands in for the code-signing database.
 
 #include "Daemon/codesigning/QRNCodeSigningMapping.h"
+#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNMetadata.h"
+#include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/platform/CodeSigningRegistry.h"
 #include "Daemon/platform/IpcConnection.h"
 #include "Daemon/platform/SandboxExtensions.h"
+#include "Daemon/service/QRNVellEvent.h"
+#include "Daemon/support/Queue.h"
 
 #include "common/TempRoot.h"
 #include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
-#include <cstdint>
+#include <unistd.h>
+
 #include <functional>
-#include <initializer_list>
 #include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
-#include <utility>
 #include <vector>
 
 namespace quarn::test {
@@ -35,7 +38,6 @@ inline constexpr const char* kVellClient = "com.example.vellclient";
 
 class FakeIpcConnection : public IpcConnection {
 public:
-    FakeIpcConnection();
     const IpcPeer& peer() const override { return peer_; }
     void setEventHandler(EventHandler) override {}
     void resume() override {}
@@ -57,7 +59,10 @@ public:
     }
 
 private:
-    IpcPeer peer_;
+    IpcPeer peer_{
+        getpid(),   kMobileUID,
+        kMobileUID, IpcPeer::makeAuditToken({.euid = kMobileUID, .pid = 4242, .startTime = 99}),
+        99,         nullptr};
     // Guards replies_ and cancelled_: asynchronous replies come from other threads.
     mutable std::mutex mutex_;
     std::vector<Value> replies_;
@@ -74,14 +79,15 @@ public:
 
 class FakeSandboxExtensions : public SandboxExtensions {
 public:
-    struct Issued {
-        std::string extensionClass;
-        std::string path;
-        IpcPeer::AuditToken token;
-    };
     Result<std::string> issueFileExtension(std::string_view extensionClass, std::string_view path,
-                                           const IpcPeer::AuditToken& token) override;
-    std::vector<Issued> issued;
+                                           const IpcPeer::AuditToken& token) override {
+        if (failing) {
+            return QRN_UNEXPECTED(QRN_POSIX_ERROR(EPERM, "refused"));
+        }
+        tokens.push_back(token);
+        return "token:" + std::string(extensionClass) + ":" + std::string(path);
+    }
+    std::vector<IpcPeer::AuditToken> tokens; // of every extension issued
     bool failing = false;
 };
 
@@ -89,50 +95,109 @@ public:
 class RecordedGroupsMapping : public QRNCodeSigningMapping {
 public:
     using QRNCodeSigningMapping::QRNCodeSigningMapping;
-    std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view identifier) override;
-    std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier) override;
     using Records = std::map<std::string, Value, std::less<>>;
+    std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view identifier) override {
+        return recorded(appGroups, identifier);
+    }
+    std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier) override {
+        return recorded(systemGroups, identifier);
+    }
     Records appGroups;
     Records systemGroups;
     // Called at each query, for a test to look at what holds then.
     std::function<void()> onQuery;
 
 private:
-    std::optional<Value> recorded(const Records& records, std::string_view identifier) const;
+    std::optional<Value> recorded(const Records& records, std::string_view identifier) const {
+        if (onQuery) {
+            onQuery();
+        }
+        auto found = records.find(identifier);
+        return found == records.end() ? std::nullopt : std::optional<Value>(found->second);
+    }
 };
 
 // An event of `kind` from the connection's peer.
-IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body, bool expectsReply);
+inline IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body,
+                                    bool expectsReply) {
+    IpcConnection::Event event;
+    event.kind = kind;
+    event.body = std::move(body);
+    event.expectsReply = expectsReply;
+    return event;
+}
 
 class VellEventFixture : public ::testing::Test {
 protected:
-    VellEventFixture();
-    ~VellEventFixture() override;
+    VellEventFixture() {
+        root_.context().install<CodeSigningRegistry>(registry_);
+        root_.context().install<SandboxExtensions>(extensions_);
+        root_.context().install<QRNCodeSigningMapping>(mapping_);
+        setClient(kVellClient, Value::dictionary());
+    }
+    ~VellEventFixture() override { drainDeathRow(); }
 
     // The client the registry reports from now on.
-    void setClient(const std::string& identifier, Value entitlements, bool sandboxed = false);
-    void setUnknownClient() { registry_->info.reset(); }
+    void setClient(const std::string& identifier, Value entitlements) {
+        registry_->info = CodeSigningInfo{identifier, std::move(entitlements), false};
+    }
+    static Value allowed() {
+        return dictionaryOf({{"com.orvex.private.Quarn.allowed", Value(true)}});
+    }
 
     // Delivers one request with a reply context; answers every reply sent
-    // on the connection so far for it.
-    std::vector<Value> dispatch(const Value& request);
+    // on the connection for it.
+    std::vector<Value> dispatch(const Value& request) {
+        const std::size_t before = connection_->replies().size();
+        QRNProcessVellEvent(connection_,
+                            eventOf(IpcConnection::Event::Kind::Message, request, true));
+        std::vector<Value> replies = connection_->replies();
+        return {replies.begin() + static_cast<std::ptrdiff_t>(before), replies.end()};
+    }
     // The one reply a request must get.
-    Value send(const Value& request);
+    Value send(const Value& request) {
+        std::vector<Value> replies = dispatch(request);
+        EXPECT_EQ(replies.size(), 1u) << request.description();
+        return replies.empty() ? Value() : replies.back();
+    }
+    std::uint64_t codeOf(const Value& request) { return replyError(send(request)); }
 
-    QRNUserIdentityPtr user() const;
+    static QRNUserIdentityPtr user() {
+        return QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity();
+    }
+    static QRNContainerIdentityPtr identity(const std::string& identifier, std::uint64_t cls) {
+        auto made =
+            QRNContainerIdentity::containerIdentityWithUserIdentity(user(), identifier, cls);
+        EXPECT_TRUE(made.has_value());
+        return made ? *made : nullptr;
+    }
     // Creates (or finds) a container with every right.
-    QRNMetadataPtr create(const std::string& identifier, std::uint64_t cls);
+    static QRNMetadataPtr create(const std::string& identifier, std::uint64_t cls) {
+        auto made = QRNClientConnection::privilegedClientConnectionWithUserIdentity(user())
+                        ->createOrLookupContainerWithContainerIdentity(identity(identifier, cls),
+                                                                       true, false, true);
+        EXPECT_TRUE(made.has_value()) << "code " << (made ? 1 : made.error());
+        return made ? *made : nullptr;
+    }
     // Whether the cache still knows the container.
-    bool cached(const std::string& identifier, std::uint64_t cls);
+    static bool cached(const std::string& identifier, std::uint64_t cls) {
+        return QRNContainerCache::sharedInstance()
+            .containerForContainerIdentity(identity(identifier, cls))
+            .has_value();
+    }
     // Waits for the background deletion passes started so far.
-    static void drainDeathRow();
+    static void drainDeathRow() {
+        QRNClientConnection::_sharedDeathrowQueue()->sync([] {});
+        QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
+    }
 
     TempRoot root_;
     std::shared_ptr<FakeIpcConnection> connection_ = std::make_shared<FakeIpcConnection>();
     std::shared_ptr<FakeCodeSigningRegistry> registry_ =
         std::make_shared<FakeCodeSigningRegistry>();
     std::shared_ptr<FakeSandboxExtensions> extensions_ = std::make_shared<FakeSandboxExtensions>();
-    std::shared_ptr<RecordedGroupsMapping> mapping_;
+    std::shared_ptr<RecordedGroupsMapping> mapping_ =
+        std::make_shared<RecordedGroupsMapping>(root_.context());
 };
 
 } // namespace quarn::test
