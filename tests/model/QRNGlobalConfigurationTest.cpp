@@ -150,16 +150,13 @@ TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
         c.getPerUserConfigurationForUserIdentity(mobile())->containerDirectoryURLForContentClass(
             1, false));
     EXPECT_TRUE(log.contains("Invalid class for a per user container directory: 1"));
-}
 
-TEST_F(QRNGlobalConfigurationTest, StagingDirectoryPerClass) {
-    auto& c = config();
-    const auto global = c.stagingDirectory();
-    const auto perUser = home() / "Containers/Staging";
+    // Per-user classes stage in the user's home, all others globally.
     for (std::uint64_t cls = 0; cls <= 15; ++cls) {
         const bool user =
             cls == 2 || cls == 4 || cls == 6 || cls == 7 || cls == 9 || cls == 10 || cls == 11;
-        EXPECT_EQ(c.stagingDirectoryURLForUserIdentity(mobile(), cls), user ? perUser : global)
+        EXPECT_EQ(c.stagingDirectoryURLForUserIdentity(mobile(), cls),
+                  user ? home() / "Containers/Staging" : c.stagingDirectory())
             << cls;
     }
     EXPECT_FALSE(c.stagingDirectoryURLForUserIdentity(nullptr, 2));
@@ -202,23 +199,17 @@ TEST_F(QRNGlobalConfigurationTest, MigrationFilesAndInternalImage) {
     EXPECT_FALSE(c.isInternalImage());
 }
 
-TEST(QRNGlobalConfigurationNoMobile, MissingMobileAccountGivesZeroIds) {
+TEST(QRNGlobalConfigurationMobile, MobileIdsAreReadOrZeroWithoutTheAccount) {
     LogCapture log;
-    TempRoot root(TempRoot::Options{.withMobileUser = false});
-    auto& c = QRNGlobalConfiguration::sharedInstance();
-    EXPECT_EQ(c.currentMobileUserId(), 0u);
-    EXPECT_EQ(c.currentMobileGroupId(), 0u);
-    EXPECT_TRUE(log.contains("Failed to get mobile uid. This is bad"));
-    // Role uids never get an identity, so the default falls back to 501.
-    auto def = QRNUserIdentitySharedCache::defaultUserIdentity();
-    ASSERT_NE(def, nullptr);
-    EXPECT_EQ(def->posixUID(), 501u);
-}
-
-TEST(QRNGlobalConfigurationMobile, MobileIdsAreRead) {
-    LogCapture log;
-    TempRoot root;
-    EXPECT_EQ(QRNGlobalConfiguration::sharedInstance().currentMobileUserId(), 501u);
-    EXPECT_EQ(QRNGlobalConfiguration::sharedInstance().currentMobileGroupId(), 501u);
-    EXPECT_TRUE(log.contains("Current mobile user ID is 501, group ID is 501"));
+    for (bool withMobileUser : {true, false}) {
+        SCOPED_TRACE(withMobileUser);
+        TempRoot root(TempRoot::Options{.withMobileUser = withMobileUser});
+        auto& c = QRNGlobalConfiguration::sharedInstance();
+        EXPECT_EQ(c.currentMobileUserId(), withMobileUser ? 501u : 0u);
+        EXPECT_EQ(c.currentMobileGroupId(), withMobileUser ? 501u : 0u);
+        EXPECT_TRUE(log.contains(withMobileUser ? "Current mobile user ID is 501, group ID is 501"
+                                                : "Failed to get mobile uid. This is bad"));
+        // Role uids never get an identity, so the default falls back to 501.
+        EXPECT_EQ(QRNUserIdentitySharedCache::defaultUserIdentity()->posixUID(), 501u);
+    }
 }

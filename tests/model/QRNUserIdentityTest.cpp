@@ -85,7 +85,6 @@ TEST_F(QRNUserIdentityTest, DefaultAndCopyKeepKernelPersona501) {
     EXPECT_EQ(copy->kernelPersonaID(), 501u);
     EXPECT_EQ(copy->posixUID(), 900u);
     EXPECT_EQ(copy->posixGID(), 901u);
-    EXPECT_EQ(copy->identifier(), "ENT");
     EXPECT_EQ(copy->personaUniqueString(), std::optional<std::string>("ENT"));
     EXPECT_EQ(copy->personaType(), kQRNPersonaTypeEnterprise);
     EXPECT_EQ(copy->homeDirectoryURL(), home());
@@ -114,39 +113,33 @@ TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBack) {
 // non-dictionaries give no identity and no code.
 TEST_F(QRNUserIdentityTest, PlistReadersRefuseBadInput) {
     LogCapture log;
-    const auto bad = [&](const Value& plist) {
-        auto r = read(plist);
-        EXPECT_FALSE(r) << plist.description();
-        return r ? 0 : r.error();
+    const Value gid{501u}, v1{"1"}, v2{"2"};
+    const std::pair<Value, const char*> refused[] = {
+        {dict({{"posixUID", "501"}, {"posixGID", gid}, {"type", 0u}, {"version", v2}}),
+         "Invalid user identity plist data. Expected number for posixUID, got string. Data:"},
+        {dict({{"posixUID", 501u}, {"type", 0u}, {"version", v2}}),
+         "Expected number for posixGID, got nil"},
+        {dict({{"posixUID", 501u}, {"posixGID", gid}, {"version", v2}}), "type"},
+        {dict({{"posixUID", 501u}, {"posixGID", gid}, {"type", true}, {"version", v2}}), "type"},
+        {dict({{"posixUID", 501u}, {"posixGID", gid}, {"type", 3u}, {"version", v2}}),
+         "Invalid user identity plist data. Expected persona type for type, got 3. Data:"},
+        {dict({{"posixUID", -1}, {"posixGID", gid}, {"version", v1}}), "posixUID"},
+        {dict({{"posixUID", 501u}, {"posixGID", 1.5}, {"version", v1}}), "posixGID"},
+        {dict({{"posixUID", std::uint64_t{1} << 32}, {"posixGID", gid}, {"version", v1}}),
+         "posixUID"},
     };
-    EXPECT_EQ(bad(dict({{"posixUID", "501"}, {"posixGID", 501u}, {"type", 0u}, {"version", "2"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_TRUE(log.contains(
-        "Invalid user identity plist data. Expected number for posixUID, got string. Data:"))
-        << log.all();
-    EXPECT_EQ(bad(dict({{"posixUID", 501u}, {"type", 0u}, {"version", "2"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_TRUE(log.contains("Expected number for posixGID, got nil"));
-    EXPECT_EQ(bad(dict({{"posixUID", 501u}, {"posixGID", 501u}, {"version", "2"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_EQ(bad(dict({{"posixUID", 501u}, {"posixGID", 501u}, {"type", true}, {"version", "2"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_EQ(bad(dict({{"posixUID", 501u}, {"posixGID", 501u}, {"type", 3u}, {"version", "2"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_TRUE(log.contains(
-        "Invalid user identity plist data. Expected persona type for type, got 3. Data:"));
-    EXPECT_EQ(bad(dict({{"posixUID", -1}, {"posixGID", 501u}, {"version", "1"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_EQ(bad(dict({{"posixUID", 501u}, {"posixGID", 1.5}, {"version", "1"}})),
-              kQRNErrorInvalidUserIdentityPlist);
-    EXPECT_EQ(
-        bad(dict({{"posixUID", std::uint64_t{1} << 32}, {"posixGID", 501u}, {"version", "1"}})),
-        kQRNErrorInvalidUserIdentityPlist);
-
+    for (const auto& [plist, message] : refused) {
+        SCOPED_TRACE(plist.description());
+        log.clear();
+        auto r = read(plist);
+        ASSERT_FALSE(r);
+        EXPECT_EQ(r.error(), kQRNErrorInvalidUserIdentityPlist);
+        EXPECT_TRUE(log.contains(message)) << log.all();
+    }
     for (const Value& noIdentity :
-         {dict({{"posixUID", 501u}, {"posixGID", 501u}, {"type", 0u}, {"version", "3"}}),
-          dict({{"posixUID", 501u}, {"posixGID", 501u}, {"type", 0u}, {"version", 2u}}),
-          dict({{"posixUID", 501u}, {"posixGID", 501u}}), Value(Value::Array{}), Value("2")}) {
+         {dict({{"posixUID", 501u}, {"posixGID", gid}, {"type", 0u}, {"version", "3"}}),
+          dict({{"posixUID", 501u}, {"posixGID", gid}, {"type", 0u}, {"version", 2u}}),
+          dict({{"posixUID", 501u}, {"posixGID", gid}}), Value(Value::Array{}), Value("2")}) {
         auto r = read(noIdentity);
         ASSERT_TRUE(r) << noIdentity.description();
         EXPECT_EQ(*r, nullptr) << noIdentity.description();
@@ -168,13 +161,4 @@ TEST_F(QRNUserIdentityTest, Version1ReadsThroughTheCache) {
     r = read(dict({{"posixUID", 0u}, {"posixGID", 0u}, {"version", "1"}}));
     ASSERT_TRUE(r);
     EXPECT_EQ((*r)->posixUID(), 501u);
-}
-
-TEST_F(QRNUserIdentityTest, Descriptions) {
-    auto u = make(501, 20, kQRNPersonaTypeUnspecific, std::nullopt, 9);
-    EXPECT_EQ(u->shortDescription(),
-              fmt::format("<QRNUserIdentity: {}; 501/20/501/2/9>", fmt::ptr(u.get())));
-    EXPECT_EQ(u->description(), fmt::format("<QRNUserIdentity: {}; posixUID = 501, posixGID = 20, "
-                                            "identifier = 501, homeDirectoryURL = {}>",
-                                            fmt::ptr(u.get()), home().string()));
 }
