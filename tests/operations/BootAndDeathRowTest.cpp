@@ -53,9 +53,6 @@ protected:
     static std::shared_ptr<Queue> background() {
         return QRNClientConnection::_sharedDeathrowBackgroundQueue();
     }
-    static QRNGlobalConfiguration& configuration() {
-        return QRNGlobalConfiguration::sharedInstance();
-    }
     fs::path makeFile(const std::string& absolute) {
         root_.writeFile(absolute, absolute);
         return root_ / absolute;

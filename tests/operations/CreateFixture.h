@@ -4,19 +4,27 @@
 // operations left on disk.
 
 #include "Daemon/fs/FaultInjectingEnv.h"
+#include "Daemon/fs/LinuxEnv.h"
+#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNContainerIdentity.h"
+#include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNMetadata.h"
+#include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientConnection.h"
+#include "Daemon/operations/QRNClientIdentity.h"
+#include "Daemon/support/Queue.h"
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
 #include <sys/stat.h>
 
-#include <cstdint>
+#include <algorithm>
 #include <filesystem>
+#include <fstream>
 #include <memory>
 #include <optional>
 #include <string>
@@ -34,46 +42,123 @@ struct Rights {
 
 class CreateFixture : public ::testing::Test {
 protected:
+    using Path = std::filesystem::path;
+
     // Unless `holdDeathRow` is false, death row keeps what it receives until
     // the fixture ends, so tests can look at it.
-    explicit CreateFixture(bool holdDeathRow = true);
-    ~CreateFixture() override;
+    explicit CreateFixture(bool holdDeathRow = true) : holdDeathRow_(holdDeathRow) {
+        // Before anything makes the file manager, which takes the Env once.
+        root_.context().install<Env>(env_);
+        if (holdDeathRow_) {
+            QRNClientConnection::_sharedDeathrowBackgroundQueue()->suspend();
+        }
+    }
+    ~CreateFixture() override {
+        env_->clearFailures();
+        env_->setHook(nullptr);
+        // Let the deletion passes run to their end while the root still exists.
+        if (holdDeathRow_) {
+            QRNClientConnection::_sharedDeathrowBackgroundQueue()->resume();
+        }
+        drainBackground();
+    }
 
-    std::shared_ptr<QRNClientConnection> connectionFor(const std::string& bundleIdentifier,
-                                                       Rights rights = {});
+    std::shared_ptr<QRNClientConnection> connectionFor(const std::string& bundle,
+                                                       Rights rights = {}) {
+        auto client = QRNClientIdentity::initWithBundleIdentifier(
+            bundle, kMobileUID, kMobileUID, 4242, user(), Value::dictionary(), false,
+            QRNClientIdentity::AuditToken{}, false);
+        return std::make_shared<QRNClientConnection>(client, rights.unrestricted, rights.otherIds,
+                                                     rights.unrestricted, rights.lookup,
+                                                     std::nullopt, nullptr);
+    }
     std::shared_ptr<QRNClientConnection> privileged() {
         return connectionFor(kClientBundle, {.unrestricted = true});
     }
     static QRNClientConnection& shared() { return QRNClientConnection::sharedClientConnection(); }
-
-    static QRNUserIdentityPtr user();
-    static QRNContainerIdentityPtr identity(const std::string& identifier, std::uint64_t cls);
-
+    static QRNGlobalConfiguration& configuration() {
+        return QRNGlobalConfiguration::sharedInstance();
+    }
+    static QRNUserIdentityPtr user() {
+        return QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity();
+    }
+    static QRNContainerIdentityPtr identity(const std::string& identifier, std::uint64_t cls) {
+        auto made =
+            QRNContainerIdentity::containerIdentityWithUserIdentity(user(), identifier, cls);
+        EXPECT_TRUE(made.has_value());
+        return made ? *made : nullptr;
+    }
     // Creates (or finds) with an unrestricted connection; fails the test on error.
-    QRNMetadataPtr create(const std::string& identifier, std::uint64_t cls, bool transient = false);
-    static bool cached(const QRNContainerIdentityPtr& identity, bool transient = false);
+    QRNMetadataPtr create(const std::string& identifier, std::uint64_t cls,
+                          bool transient = false) {
+        auto made = privileged()->createOrLookupContainerWithContainerIdentity(
+            identity(identifier, cls), true, transient, true);
+        EXPECT_TRUE(made.has_value()) << identifier << ": code " << (made ? 1 : made.error());
+        return made ? *made : nullptr;
+    }
+    static bool cached(const QRNContainerIdentityPtr& identity, bool transient = false) {
+        return QRNContainerCache::sharedInstance()
+            .containerForContainerIdentity(identity, transient)
+            .has_value();
+    }
 
-    static std::filesystem::path classDirectory(std::uint64_t cls, bool transient = false);
-    static std::filesystem::path stagingDirectory(std::uint64_t cls);
-    static std::filesystem::path deathRow();
+    static Path classDirectory(std::uint64_t cls, bool transient = false) {
+        return *configuration().containerDirectoryURLForUserIdentity(user(), cls, transient);
+    }
+    static Path stagingDirectory(std::uint64_t cls) {
+        return *configuration().stagingDirectoryURLForUserIdentity(user(), cls);
+    }
+    static Path deathRow() { return configuration().deathrowDirectory(); }
     // Names directly inside a directory (dot files included); empty when missing.
-    static std::vector<std::string> namesIn(const std::filesystem::path& directory);
+    static std::vector<std::string> namesIn(const Path& directory) {
+        std::vector<std::string> names;
+        std::error_code ec;
+        for (const auto& entry : std::filesystem::directory_iterator(directory, ec)) {
+            names.push_back(entry.path().filename().string());
+        }
+        std::sort(names.begin(), names.end());
+        return names;
+    }
     // Every item below death row's unique directories, by last component.
-    static std::vector<std::string> namesOnDeathRow();
+    static std::vector<std::string> namesOnDeathRow() {
+        std::vector<std::string> names;
+        for (const std::string& unique : namesIn(deathRow())) {
+            for (const std::string& name : namesIn(deathRow() / unique)) {
+                names.push_back(name);
+            }
+        }
+        std::sort(names.begin(), names.end());
+        return names;
+    }
     // A directory holding a subdirectory with a file.
-    static std::filesystem::path makeTree(const std::filesystem::path& directory);
+    static Path makeTree(const Path& directory) {
+        std::filesystem::create_directories(directory / "inner");
+        std::ofstream(directory / "inner" / "file") << "x";
+        return directory;
+    }
     // Waits for the background passes queued so far.
-    static void drainBackground();
+    static void drainBackground() {
+        QRNClientConnection::_sharedBackgroundQueue()->sync([] {});
+        QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
+    }
     // Every Env call made so far, of any kind.
-    std::uint64_t totalCalls() const;
-    static struct stat lstatOf(const std::filesystem::path& path);
-    // Makes the directories a creation needs first, so that fault counts
-    // start at the container itself.
-    void primeDirectories(std::uint64_t cls, bool transient = false);
+    std::uint64_t totalCalls() const {
+        std::uint64_t total = 0;
+        for (std::size_t call = 0; call < static_cast<std::size_t>(EnvCall::Count_); ++call) {
+            total += env_->count(static_cast<EnvCall>(call));
+        }
+        return total;
+    }
+    static struct stat lstatOf(const Path& path) {
+        struct stat st {};
+        EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
+        return st;
+    }
 
     const bool holdDeathRow_;
     TempRoot root_;
-    std::shared_ptr<FaultInjectingEnv> env_;
+    std::shared_ptr<FaultInjectingEnv> env_ =
+        std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>());
 };
 
 } // namespace quarn::test

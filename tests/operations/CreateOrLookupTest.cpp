@@ -10,8 +10,6 @@
 #include "Daemon/operations/QRNLocks.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"
 
-#include "common/shared/RequestValues.h"
-
 #include <sys/xattr.h>
 
 #include <cerrno>
@@ -150,21 +148,6 @@ TEST_F(CreateOrLookupTest, SystemContainersAreClosedAndOwnedByNobody) {
     EXPECT_EQ(lstatOf(bundle->url()).st_uid, 33u);
     EXPECT_EQ(namesIn(bundle->url()),
               std::vector<std::string>{std::string(QRNMetadata::kFileName)});
-}
-
-TEST_F(CreateOrLookupTest, WellKnownSystemContainersLiveUnderTheirNames) {
-    auto settings = create("com.orvex.devicesettings", kQRNContainerClassSystemData);
-    ASSERT_TRUE(settings);
-    EXPECT_EQ(settings->url(),
-              classDirectory(kQRNContainerClassSystemData) / "com.orvex.devicesettings");
-    auto group = create("systemgroup.com.orvex.pairing", kQRNContainerClassSystemGroup);
-    ASSERT_TRUE(group);
-    EXPECT_EQ(group->url().filename(), "systemgroup.com.orvex.pairing");
-    // Found again under the name (the cache accepts well-known names).
-    auto found = privileged()->createOrLookupContainerWithContainerIdentity(
-        identity("com.orvex.devicesettings", kQRNContainerClassSystemData), false, false, true);
-    ASSERT_TRUE(found.has_value());
-    EXPECT_EQ((*found)->uuid(), settings->uuid());
 }
 
 TEST_F(CreateOrLookupTest, TransientContainersAreNeverReused) {
@@ -320,7 +303,15 @@ TEST_F(CreateOrLookupTest, WellKnownSystemClientGetsItsSystemContainerOnly) {
 // and gives the global lock back.
 class CreateFailureTest : public CreateOrLookupTest {
 protected:
-    void SetUp() override { primeDirectories(kClass); }
+    // Makes the directories a creation needs first, so that fault counts
+    // start at the container itself, and the cache entry of the class, so no
+    // listing happens later.
+    void SetUp() override {
+        classDirectory(kClass);
+        stagingDirectory(kClass);
+        deathRow();
+        ASSERT_EQ(codeOf(*privileged(), "com.example.absent", kClass), kQRNErrorContainerNotFound);
+    }
     std::uint64_t createCode(bool transient = false) {
         return codeOf(*privileged(), kClientBundle, kClass, true, transient);
     }
