@@ -41,12 +41,12 @@ protected:
     // the way the daemon writes it; `recordedClass` lets it lie about itself.
     QRNMetadataPtr makeContainer(std::uint64_t cls, const std::string& identifier,
                                  std::string name = {}, bool transient = false,
-                                 std::uint64_t recordedClass = 0) {
+                                 std::uint64_t recordedClass = 0, QRNUserIdentityPtr owner = {}) {
         const UUID uuid = UUID::random();
         const auto url = classDirectory(cls, transient) / (name.empty() ? uuid.string() : name);
         std::filesystem::create_directories(url);
         auto concrete = QRNConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, mobile(), identifier, recordedClass ? recordedClass : cls);
+            uuid, owner ? owner : mobile(), identifier, recordedClass ? recordedClass : cls);
         auto metadata = std::make_shared<const QRNMetadata>(*concrete, Value(), url, std::nullopt);
         EXPECT_TRUE(metadata->writeMetadataToFileURL(url / QRNMetadata::kFileName));
         return metadata;
@@ -207,13 +207,8 @@ TEST_F(QRNContainerCacheTest, EachFilesStoredUserIdentityIsChecked) {
     for (int i = 0; i < 4; ++i) {
         expected.push_back(fmt::format("com.example.mine{}", i));
         makeContainer(kQRNContainerClassAppData, expected.back());
-        const UUID uuid = UUID::random();
-        const auto url = classDirectory(kQRNContainerClassAppData) / uuid.string();
-        std::filesystem::create_directories(url);
-        auto theirs = QRNConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, other, fmt::format("com.example.theirs{}", i), kQRNContainerClassAppData);
-        ASSERT_TRUE(QRNMetadata(*theirs, Value(), url, std::nullopt)
-                        .writeMetadataToFileURL(url / QRNMetadata::kFileName));
+        makeContainer(kQRNContainerClassAppData, fmt::format("com.example.theirs{}", i), {}, false,
+                      0, other);
     }
     EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), expected);
     EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
@@ -298,27 +293,15 @@ TEST_F(QRNContainerCacheTest, OnlyPermanentContainersAreMappedAndAnEntryOnlyOnce
     EXPECT_EQ(log_.count("Pushed user: 501, itemType: 2, identifier group.example"), 1u);
 }
 
-TEST_F(QRNContainerCacheTest, AKernelMappingWhoseMetadataValidatesAnswersWithoutAScan) {
-    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
-    // As a kernel that kept its mapping while the daemon restarted.
-    sandbox().setContainerMapping(
-        501, {1, "com.example.app", kQRNContainerClassAppData, 501, made->url().string()});
-    auto id = identity(kQRNContainerClassAppData, "com.example.app");
-
-    auto found = cache().containerForContainerIdentity(id, false, false, true);
-    ASSERT_TRUE(found) << log_.all();
-    EXPECT_EQ((*found)->uuid(), made->uuid());
-    EXPECT_EQ(rebuilds("[501]-appData"), 0u);
-    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
-    EXPECT_EQ(rebuilds("[501]-appData"), 1u);
-}
-
-TEST_F(QRNContainerCacheTest, AKernelMappingThatDoesNotHoldTheContainerFallsBackToTheScan) {
+// A mapping the kernel kept while the daemon restarted answers without a
+// scan when the metadata at its path validates; otherwise the scan decides.
+TEST_F(QRNContainerCacheTest, AKernelMappingIsTrustedOnlyWhenItHoldsTheContainer) {
     auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
     auto impostor = makeContainer(kQRNContainerClassAppData, "com.example.impostor");
     const auto bare = classDirectory(kQRNContainerClassAppData) / "bare";
     std::filesystem::create_directories(bare);
     const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
+        {made->url(), ""},
         {impostor->url(),
          fmt::format("Attempted to fetch container from Sandbox-provided path [{}] that was not "
                      "what was expected; expected class: 2, expected identifier: "
@@ -328,14 +311,18 @@ TEST_F(QRNContainerCacheTest, AKernelMappingThatDoesNotHoldTheContainerFallsBack
         {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
                            bare.string())},
     };
+    const auto id = identity(kQRNContainerClassAppData, "com.example.app");
     for (const auto& [path, logged] : cases) {
+        SCOPED_TRACE(path);
         sandbox().setContainerMapping(
             501, {1, "com.example.app", kQRNContainerClassAppData, 501, path.string()});
-        auto found = cache().containerForContainerIdentity(
-            identity(kQRNContainerClassAppData, "com.example.app"), false, false, true);
+        auto found = cache().containerForContainerIdentity(id, false, false, true);
         ASSERT_TRUE(found) << log_.all();
         EXPECT_EQ((*found)->uuid(), made->uuid());
         EXPECT_TRUE(log_.contains(logged)) << log_.all();
+        EXPECT_EQ(rebuilds("[501]-appData"), logged.empty() ? 0u : 1u);
+        // Without the kernel's word the entry is built from disk.
+        ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
         EXPECT_EQ(rebuilds("[501]-appData"), 1u);
         cache().invalidateUserIdentity(mobile()); // back to an unbuilt entry
         log_.clear();

@@ -233,54 +233,58 @@ TEST_F(QRNMetadataTest, ReadingFromTheTreeKeepsTheFullChecks) {
 
 TEST_F(QRNMetadataTest, UnreadableFilesGiveCode12) {
     LogCapture log;
-    auto dir = containerDir(mobile(), 2, UUID::random());
-    auto url = dir / QRNMetadata::kFileName;
+    auto url = containerDir(mobile(), 2, UUID::random()) / QRNMetadata::kFileName;
     EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
     EXPECT_TRUE(log.contains("Failed to read metadata at URL " + url.string()));
-
-    Value array = Value::array();
-    array.append("x");
-    ASSERT_TRUE(binaryPropertyList(array));
-    auto bytes = *binaryPropertyList(array);
-    std::ofstream(url, std::ios::binary)
-        .write(reinterpret_cast<const char*>(bytes.data()),
-               static_cast<std::streamsize>(bytes.size()));
-    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
-
-    std::ofstream(url, std::ios::binary | std::ios::trunc) << "bplist00 and then garbage";
-    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+    auto array = *binaryPropertyList(Value(Value::Array{"x"}));
+    for (const std::string& bytes :
+         {std::string(array.begin(), array.end()), std::string("bplist00 and then garbage")}) {
+        std::ofstream(url, std::ios::binary | std::ios::trunc) << bytes;
+        EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+    }
 }
 
 // A file without a stored identity belongs to whoever the caller expects;
-// one with a stored identity must match.
-TEST_F(QRNMetadataTest, UserIdentityFromFileOrCaller) {
-    auto other = user(600);
-    auto url = fileWith(other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); });
-    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, other, true);
-    ASSERT_TRUE(read);
-    EXPECT_EQ((*read)->userIdentity(), other);
-    EXPECT_EQ((*read)->containerIdentity()->userIdentity(), other);
-
-    auto mobileFile = fileWith(mobile(), [](Value&) {});
-    EXPECT_EQ(failureOf(mobileFile, other, false), kQRNErrorInvalidMetadata);
-}
-
-// The legacy owner entry is checked against the expected identity's owner
-// for the class, except for the default identity.
-TEST_F(QRNMetadataTest, LegacyOwnerEntry) {
+// one with a stored identity must match. The legacy owner entry is checked
+// against the expected identity's owner for the class, except for the
+// default identity.
+TEST_F(QRNMetadataTest, OwnerEntriesAgainstTheExpectedUser) {
     LogCapture log;
     auto other = user(600);
-    auto good = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", 600u); });
-    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(good, other, true));
-    auto bad = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", 601u); });
-    EXPECT_EQ(failureOf(bad, other), kQRNErrorInvalidMetadata);
-    EXPECT_TRUE(log.contains("Incorrect UserId: 601, expecting: 600 for com.example.app at "))
-        << log.all();
-    auto notNumber = fileWith(other, [](Value& d) { d.set("QRNMetadataPersona", "600"); });
-    EXPECT_EQ(failureOf(notNumber, other), kQRNErrorInvalidMetadata);
-
-    auto renumbered = fileWith(mobile(), [](Value& d) { d.set("QRNMetadataPersona", 999u); });
-    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(renumbered, mobile(), true));
+    struct Case {
+        QRNUserIdentityPtr writer, reader;
+        std::function<void(Value&)> edit;
+        const char* refusal; // null: accepted
+    };
+    const auto persona = [](Value v) { return [=](Value& d) { d.set("QRNMetadataPersona", v); }; };
+    const Case cases[] = {
+        {other, other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); }, nullptr},
+        {mobile(), other, [](Value&) {}, "Incorrect User Identity: "},
+        {other, other, persona(600u), nullptr},
+        {other, other, persona(601u),
+         "Incorrect UserId: 601, expecting: 600 for com.example.app at "},
+        {other, other, persona("600"), ""},
+        {mobile(), mobile(), persona(999u), nullptr},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.refusal ? c.refusal : "accepted");
+        log.clear();
+        auto url = fileWith(c.writer, c.edit);
+        auto read =
+            QRNMetadata::readAndValidateMetadataAtFileUrl(url, c.reader, c.writer == c.reader);
+        if (!c.refusal) {
+            ASSERT_TRUE(read);
+            EXPECT_TRUE((*read)->userIdentity()->isEqual(*c.reader));
+            if (&c == &cases[0]) { // nothing stored: the caller's own object
+                EXPECT_EQ((*read)->userIdentity(), c.reader);
+                EXPECT_EQ((*read)->containerIdentity()->userIdentity(), c.reader);
+            }
+            continue;
+        }
+        ASSERT_FALSE(read);
+        EXPECT_EQ(read.error(), kQRNErrorInvalidMetadata);
+        EXPECT_TRUE(log.contains(c.refusal)) << log.all();
+    }
 }
 
 TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
