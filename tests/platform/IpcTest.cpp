@@ -9,10 +9,12 @@
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
+#include "common/shared/ChildProcess.h"
 #include "common/shared/FrameSocket.h"
 
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <linux/sockios.h>
@@ -123,20 +125,12 @@ TEST(IpcPeerTest, SocketPeerIsThisProcessWithItsToken) {
 }
 
 TEST(IpcPeerTest, AnotherProcessHasItsOwnTokenAndNoneOnceGone) {
-    int gate[2];
-    ASSERT_EQ(::pipe(gate), 0);
-    const pid_t child = ::fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        ::close(gate[1]);
-        char c;
-        (void)!::read(gate[0], &c, 1); // until the parent closes its end
-        ::_exit(0);
-    }
-    ::close(gate[0]);
+    auto sleeper = ChildProcess::spawn({"/bin/sleep", {"60"}, {}, {}, {}});
+    ASSERT_TRUE(sleeper);
+    const pid_t child = sleeper->pid();
     auto peer = IpcPeer::fromPID(child);
-    ::close(gate[1]);
-    ::waitpid(child, nullptr, 0);
+    sleeper->signal(SIGKILL);
+    ASSERT_TRUE(sleeper->waitFor(kGuard));
     ASSERT_TRUE(peer);
     EXPECT_EQ(IpcPeer::fieldsOfAuditToken(peer->auditToken()).pid,
               static_cast<std::uint32_t>(child));
@@ -408,35 +402,27 @@ TEST_F(IpcListenerTest, MalformedFrameClosesOnlyItsConnectionWithOneLogLine) {
     }
 }
 
-TEST_F(IpcListenerTest, ReplyMayBeSentLaterFromAnotherThread) {
-    // Both requests are answered by the test thread, after both handlers returned.
-    ASSERT_TRUE(start([](const auto&, const Event&) {}));
-    Client client(socketPath());
-    client.send(message(1));
-    client.send(message(2));
-    ASSERT_TRUE(waitUntil([&] { return writers_.size() == 2; }));
-    auto held = accepted(0);
-    held->sendReply(message(1));
-    held->sendReply(message(2));
-    EXPECT_EQ(seqOf(client.receive()), 1u);
-    EXPECT_EQ(seqOf(client.receive()), 2u);
-}
-
-TEST_F(IpcListenerTest, ConnectionNotResumedReadsNothing) {
-    ASSERT_TRUE(start(echo, options(), {0}));
+TEST_F(IpcListenerTest, HeldConnectionReadsNothingAndRepliesMayComeLaterFromAnotherThread) {
+    // No handler replies: the test thread answers, after the handlers returned.
+    ASSERT_TRUE(start([](const auto&, const Event&) {}, options(), {0}));
     Client waiting(socketPath());
     waiting.send(message(1));
-    auto connection = accepted(0);
+    auto held = accepted(0);
 
     // The pool is running: another connection is served meanwhile.
     Client other(socketPath());
     other.send(message(2));
-    ASSERT_TRUE(other.receive());
+    other.send(message(3));
+    ASSERT_TRUE(waitUntil([&] { return writers_.size() == 2; }));
+    accepted(1)->sendReply(message(2));
+    accepted(1)->sendReply(message(3));
+    EXPECT_EQ(seqOf(other.receive()), 2u);
+    EXPECT_EQ(seqOf(other.receive()), 3u);
     EXPECT_GT(waiting.unreadByService(), 0);
     EXPECT_EQ(messages(0), 0);
 
-    resume(connection); // from this thread, not the pool
-    EXPECT_EQ(seqOf(waiting.receive()), 1u);
+    resume(held); // from this thread, not the pool
+    ASSERT_TRUE(waitUntil([&] { return writers_.size() == 3; }));
     EXPECT_EQ(waiting.unreadByService(), 0);
 }
 
@@ -514,28 +500,27 @@ TEST_F(IpcListenerTest, AdoptsAnInheritedListeningSocketAndFindsSystemdsByName) 
     int pipeFds[2];
     ASSERT_GE(fd, 0);
     ASSERT_EQ(::pipe2(pipeFds, O_CLOEXEC), 0);
-    {
-        // The pipe and the socket where systemd puts them (3 and 4); what was
-        // there is put back afterwards.
-        const int sources[] = {::fcntl(pipeFds[0], F_DUPFD_CLOEXEC, 200),
-                               ::fcntl(fd, F_DUPFD_CLOEXEC, 200)};
-        const int saved[] = {::fcntl(3, F_DUPFD_CLOEXEC, 200), ::fcntl(4, F_DUPFD_CLOEXEC, 200)};
-        ::dup2(sources[0], 3);
-        ::dup2(sources[1], 4);
-        ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
-        ::setenv("LISTEN_FDS", "2", 1);
-        ::setenv("LISTEN_FDNAMES", "com.orvex.quarnd.upcall:com.orvex.quarnd", 1);
-        EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd"), 4);
-        EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd.upcall"), -1); // a pipe
-        EXPECT_EQ(IpcListener::socketFromSystemd("other"), -1);
-        for (const char* name : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) {
-            ::unsetenv(name);
-        }
-        for (int i = 0; i < 2; ++i) {
-            saved[i] >= 0 ? ::dup2(saved[i], 3 + i) : ::close(3 + i);
-            ::close(saved[i]);
-            ::close(sources[i]);
-        }
+    // The pipe and the socket where systemd puts them (3 and 4); what was
+    // there is put back afterwards.
+    int saved[2];
+    for (int i = 0; i < 2; ++i) {
+        const int source = ::fcntl(i ? fd : pipeFds[0], F_DUPFD_CLOEXEC, 200);
+        saved[i] = ::fcntl(3 + i, F_DUPFD_CLOEXEC, 200);
+        ::dup2(source, 3 + i);
+        ::close(source);
+    }
+    ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
+    ::setenv("LISTEN_FDS", "2", 1);
+    ::setenv("LISTEN_FDNAMES", "com.orvex.quarnd.upcall:com.orvex.quarnd", 1);
+    EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd"), 4);
+    EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd.upcall"), -1); // a pipe
+    EXPECT_EQ(IpcListener::socketFromSystemd("other"), -1);
+    for (const char* name : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) {
+        ::unsetenv(name);
+    }
+    for (int i = 0; i < 2; ++i) {
+        saved[i] >= 0 ? ::dup2(saved[i], 3 + i) : ::close(3 + i);
+        ::close(saved[i]);
     }
     EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd"), -1);
 
@@ -553,8 +538,9 @@ TEST_F(IpcListenerTest, AdoptsAnInheritedListeningSocketAndFindsSystemdsByName) 
     EXPECT_TRUE(client.receive());
 }
 
-TEST_F(IpcListenerTest, EachMessageNamesTheProcessThatWroteIt) {
+TEST_F(IpcListenerTest, EachMessageNamesItsWriterAndAFrameOfTwoWritersClosesTheConnection) {
     ASSERT_TRUE(start(echo));
+    LogCapture log;
     Client client(socketPath());
     client.send(message(1));
     EXPECT_EQ(seqOf(client.receive()), 1u);
@@ -562,29 +548,25 @@ TEST_F(IpcListenerTest, EachMessageNamesTheProcessThatWroteIt) {
     EXPECT_EQ(seqOf(client.receive()), 2u);
     client.send(message(3));
     EXPECT_EQ(seqOf(client.receive()), 3u);
-
     const IpcConnection::Sender self{::getpid(), ::getuid(), ::getgid()};
-    std::lock_guard lock(mutex_);
-    // The child that shares the connection, not the process that connected.
-    EXPECT_EQ(writers_, (std::vector<std::optional<IpcConnection::Sender>>{
-                            self, IpcConnection::Sender{child, ::getuid(), ::getgid()}, self}));
-}
+    {
+        std::lock_guard lock(mutex_);
+        // The child that shares the connection, not the process that connected.
+        EXPECT_EQ(writers_, (std::vector<std::optional<IpcConnection::Sender>>{
+                                self, IpcConnection::Sender{child, ::getuid(), ::getgid()}, self}));
+    }
 
-TEST_F(IpcListenerTest, AFrameWrittenByTwoProcessesClosesTheConnection) {
-    ASSERT_TRUE(start(echo));
-    LogCapture log;
-    Client client(socketPath());
-    const Bytes frame = IpcFrame::encodeMessage(message(1), true);
+    const Bytes frame = IpcFrame::encodeMessage(message(4), true);
     const auto half = frame.begin() + static_cast<std::ptrdiff_t>(frame.size() / 2);
     client.write({frame.begin(), half});
-    const pid_t child = inChild([&] { client.write({half, frame.end()}); });
+    const pid_t second = inChild([&] { client.write({half, frame.end()}); });
     EXPECT_TRUE(client.closedByService());
     EXPECT_TRUE(log.contains(fmt::format("Closing the connection of pid {}: a frame holds bytes "
                                          "written by pid {} and by pid {}",
-                                         ::getpid(), ::getpid(), child)))
+                                         ::getpid(), ::getpid(), second)))
         << log.all();
     listener_->stop();
-    EXPECT_EQ(messages(0), 0);
+    EXPECT_EQ(messages(0), 3);
     EXPECT_EQ(invalidations(0), 1);
 }
 

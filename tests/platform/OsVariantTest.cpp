@@ -7,51 +7,51 @@
 using namespace quarn;
 
 TEST(OsReleaseParsing, ShellQuotingAndLayoutNoiseAreUnderstoodAndMalformedLinesSkipped) {
-    using Fields = LinuxOsVariant::Fields;
     EXPECT_TRUE(LinuxOsVariant::parseOsRelease("").empty());
-    EXPECT_EQ(LinuxOsVariant::parseOsRelease("A=plain\n"
-                                             "B=\"two words\"\n"
-                                             "C='single \"quoted\" \\n kept'\n"
-                                             "D=\"esc \\\" \\\\ \\$ \\` and \\n kept\"\n"
-                                             "E=bare\\ escaped\\\\\n"
-                                             "F=\"\"\n"
-                                             "G=\n"
-                                             "H=\"a=b\"\n"
-                                             "I=trailing\\\n"
-                                             "J=\"ends in escaped quote\\\"\"\n"
-                                             "# comment=ignored\n"
-                                             "\n"
-                                             "   \t\n"
-                                             "  SPACED  =  \"value\"  \r\n"
-                                             "CRLF=yes\r\n"
-                                             "X=first\n"
-                                             "X=second\n"
-                                             "no equals sign\n"
-                                             "=novalue\n"
-                                             "1KEY=digit first\n"
-                                             "BAD-KEY=dash\n"
-                                             "OPEN=\"never closed\n"
-                                             "OPEN1='never closed either\n"
-                                             "JOINED=\"a\"'b'\n"
-                                             "AFTER=\"x\" junk\n"
-                                             "ESCAPED_END=\"x\\\"\n"
-                                             "KEY_2=ok\n"
-                                             "LAST=no-newline"),
-              (Fields{{"A", "plain"},
-                      {"B", "two words"},
-                      {"C", "single \"quoted\" \\n kept"},
-                      {"D", "esc \" \\ $ ` and \\n kept"},
-                      {"E", "bare escaped\\"},
-                      {"F", ""},
-                      {"G", ""},
-                      {"H", "a=b"},
-                      {"I", "trailing"},
-                      {"J", "ends in escaped quote\""},
-                      {"SPACED", "value"},
-                      {"CRLF", "yes"},
-                      {"X", "second"},
-                      {"KEY_2", "ok"},
-                      {"LAST", "no-newline"}}));
+    // Lines of one file, the key each names and its value (none: skipped).
+    const struct {
+        const char* lines;
+        const char* key;
+        std::optional<std::string> value;
+    } cases[] = {
+        {"A=plain", "A", "plain"},
+        {"B=\"two words\"", "B", "two words"},
+        {"C='single \"quoted\" \\n kept'", "C", "single \"quoted\" \\n kept"},
+        {"D=\"esc \\\" \\\\ \\$ \\` and \\n kept\"", "D", "esc \" \\ $ ` and \\n kept"},
+        {"E=bare\\ escaped\\\\", "E", "bare escaped\\"},
+        {"F=\"\"", "F", ""},
+        {"G=", "G", ""},
+        {"H=\"a=b\"", "H", "a=b"},
+        {"I=trailing\\", "I", "trailing"},
+        {"J=\"ends in escaped quote\\\"\"", "J", "ends in escaped quote\""},
+        {"# comment=ignored\n\n   \t", "# comment", {}},
+        {"  SPACED  =  \"value\"  \r", "SPACED", "value"},
+        {"CRLF=yes\r", "CRLF", "yes"},
+        {"X=first\nX=second", "X", "second"},
+        {"no equals sign\n=novalue", "", {}},
+        {"1KEY=digit first", "1KEY", {}},
+        {"BAD-KEY=dash", "BAD-KEY", {}},
+        {"OPEN=\"never closed", "OPEN", {}},
+        {"OPEN1='never closed either", "OPEN1", {}},
+        {"JOINED=\"a\"'b'", "JOINED", {}},
+        {"AFTER=\"x\" junk", "AFTER", {}},
+        {"ESCAPED_END=\"x\\\"", "ESCAPED_END", {}},
+        {"KEY_2=ok", "KEY_2", "ok"},
+        {"LAST=no-newline", "LAST", "no-newline"}, // last, without a newline
+    };
+    std::string text;
+    std::size_t kept = 0;
+    for (const auto& c : cases) {
+        text += (text.empty() ? "" : "\n") + std::string(c.lines);
+        kept += c.value.has_value();
+    }
+    const auto fields = LinuxOsVariant::parseOsRelease(text);
+    EXPECT_EQ(fields.size(), kept);
+    for (const auto& c : cases) {
+        const auto found = fields.find(c.key);
+        EXPECT_EQ(found == fields.end() ? std::nullopt : std::optional(found->second), c.value)
+            << c.lines;
+    }
 }
 
 namespace {
