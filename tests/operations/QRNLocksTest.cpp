@@ -96,10 +96,16 @@ std::uint64_t waiters(const QRNLocks& locks) {
     return locks.snapshot().conditionWaiters;
 }
 
+// Every test ends with nothing held, nothing waiting and no record left.
+class QRNLocksTest : public ::testing::Test {
+protected:
+    void TearDown() override { expectIdle(locks); }
+    QRNLocks locks;
+};
+
 } // namespace
 
-TEST(QRNLocksIdentifiers, DuplicatesAreLockedAndReleasedOnce) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, DuplicatesAreLockedAndReleasedOnce) {
     // A second write lock on "a" by this thread would never be granted.
     locks.write_lock_identifier(ids({"b", "a", "b", "a"}));
     auto s = locks.snapshot();
@@ -114,11 +120,9 @@ TEST(QRNLocksIdentifiers, DuplicatesAreLockedAndReleasedOnce) {
     EXPECT_EQ(locks.snapshot().records["x"].lockState, 1);
     locks.unlock_identifier(ids({"y", "x", "x"}));
     locks.read_lock_identifier(Value::array());
-    expectIdle(locks);
 }
 
-TEST(QRNLocksIdentifiers, ArraysAreLockedInAscendingOrder) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrder) {
     locks.write_lock_identifier("b");
     Holder h(locks, Kind::Write, ids({"b", "a"}));
     waitUntil("array locker queues on b", [&] { return locks.snapshot().records["b"].users == 2; });
@@ -128,7 +132,6 @@ TEST(QRNLocksIdentifiers, ArraysAreLockedInAscendingOrder) {
     locks.unlock_identifier("b");
     waitUntil("array locker gets both", [&] { return h.acquired(); });
     h.release();
-    expectIdle(locks);
 }
 
 TEST(QRNLocksIdentifiers, RecordLivesExactlyWhileUsed) {
@@ -148,8 +151,7 @@ TEST(QRNLocksIdentifiers, RecordLivesExactlyWhileUsed) {
     expectIdle(locks);
 }
 
-TEST(QRNLocksIdentifiers, HoldsAreMarkedFromLockToUnlock) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, HoldsAreMarkedFromLockToUnlock) {
     test::LogCapture log;
     auto ends = [&](std::string_view name) {
         auto lines = log.messages();
@@ -169,8 +171,7 @@ TEST(QRNLocksIdentifiers, HoldsAreMarkedFromLockToUnlock) {
     EXPECT_EQ(ends("ReadLockWithIdentifier") + ends("GlobalReadLock"), 3);
 }
 
-TEST(QRNLocksGlobal, WriterWaitsForIdentifierHoldersAndHoldsOffNewOnes) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, WriterWaitsForIdentifierHoldersAndHoldsOffNewOnes) {
     locks.read_lock_identifier("x");
     Holder global(locks, Kind::GlobalWrite);
     waitUntil("global writer waits", [&] { return waiters(locks) == 1; });
@@ -186,11 +187,9 @@ TEST(QRNLocksGlobal, WriterWaitsForIdentifierHoldersAndHoldsOffNewOnes) {
     waitUntil("identifier lockers get in", [&] { return reader.acquired() && writer.acquired(); });
     reader.release();
     writer.release();
-    expectIdle(locks);
 }
 
-TEST(QRNLocksGlobal, ReaderSharesWithIdentifierReadersOnly) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, ReaderSharesWithIdentifierReadersOnly) {
     locks.read_lock_identifier("x");
     Holder first(locks, Kind::GlobalRead);
     waitUntil("global reader beside an identifier reader", [&] { return first.acquired(); });
@@ -207,11 +206,9 @@ TEST(QRNLocksGlobal, ReaderSharesWithIdentifierReadersOnly) {
     writer.release();
     waitUntil("global reader gets in", [&] { return second.acquired(); });
     second.release();
-    expectIdle(locks);
 }
 
-TEST(QRNLocksGlobal, IdentifierWriterWaitsForGlobalReaders) {
-    QRNLocks locks;
+TEST_F(QRNLocksTest, IdentifierWriterWaitsForGlobalReaders) {
     locks.read_lock_all_identifiers();
     Holder writer(locks, Kind::Write, "x");
     waitUntil("writer waits", [&] { return waiters(locks) == 1; });
@@ -222,12 +219,11 @@ TEST(QRNLocksGlobal, IdentifierWriterWaitsForGlobalReaders) {
     locks.unlock_all_identifiers();
     waitUntil("writer gets in", [&] { return writer.acquired(); });
     writer.release();
-    expectIdle(locks);
 }
 
 // Threads mixing every kind of lock, identifier arrays in opposite orders
 // included: no deadlock, and never two incompatible holders at once.
-TEST(QRNLocksStress, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
+TEST_F(QRNLocksTest, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
     // Slots 0..2 stand for "a", "b", "c", slot 3 for the global lock. An
     // identifier lock also reads slot 3; a global lock takes every slot in
     // its mode. Reader/writer exclusion per slot is then the table above.
@@ -240,7 +236,6 @@ TEST(QRNLocksStress, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
         {Kind::Write, ids({"b", "a"}), {0, 1}}, {Kind::Write, ids({"a", "c", "b"}), {0, 1, 2}},
         {Kind::Read, ids({"c", "a"}), {0, 2}},  {Kind::Write, "c", {2}},
         {Kind::GlobalRead, {}, {0, 1, 2}},      {Kind::GlobalWrite, {}, {0, 1, 2}}};
-    QRNLocks locks;
     std::array<std::atomic<int>, 4> readers{}, writers{};
     std::atomic<int> violations{0};
     auto work = [&](unsigned seed) {
@@ -274,13 +269,11 @@ TEST(QRNLocksStress, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
         t.join();
     }
     EXPECT_EQ(violations, 0);
-    expectIdle(locks);
 }
 
-class QRNLocksDeathTest : public ::testing::Test {
+class QRNLocksDeathTest : public QRNLocksTest {
 protected:
     void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-    QRNLocks locks;
 };
 
 TEST_F(QRNLocksDeathTest, WrongArgumentTypesStopTheProcess) {
