@@ -42,67 +42,61 @@ protected:
         QRNClientConnection::_sharedBackgroundQueue()->sync([] {});
         QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
     }
-    fs::path notificationFile(std::string_view name) {
-        return root_.context().instance<Paths>().runDirectory() / "notifications" /
-               std::string(name);
-    }
-    static std::size_t lines(const fs::path& file) {
-        std::ifstream in(file);
-        return std::count(std::istreambuf_iterator<char>(in), {}, '\n');
-    }
-    // Index of the first message beginning with `prefix`, or -1.
-    static long indexOf(const test::LogCapture& log, std::string_view prefix) {
-        const auto messages = log.messages();
-        for (std::size_t i = 0; i < messages.size(); ++i) {
-            if (messages[i].rfind(prefix, 0) == 0) {
-                return static_cast<long>(i);
-            }
-        }
-        return -1;
+    // Lines in a notification file; -1 when there is none.
+    long notifications(std::string_view name) {
+        std::ifstream in(root_.context().instance<Paths>().runDirectory() / "notifications" /
+                         std::string(name));
+        return in ? std::count(std::istreambuf_iterator<char>(in), {}, '\n') : -1;
     }
 
     FirstBootMarker marker_;
 };
 
-TEST_F(DaemonInitTest, FirstBootRunsTheFirstBootPassesFirstAndLeavesTheMarker) {
-    const fs::path transient = QRNGlobalConfiguration::sharedInstance().transientDirectory();
-    test::LogCapture log;
-    {
-        QRNDaemon daemon(root_.sharedContext());
-        initialise(daemon);
+TEST_F(DaemonInitTest, FirstStartRunsTheFirstBootPassesFirstAndTheNextOnlyTheBootPasses) {
+    // The first start leaves the marker the second one finds.
+    for (bool firstBoot : {true, false}) {
+        SCOPED_TRACE(firstBoot ? "first start" : "second start");
+        const fs::path transient = QRNGlobalConfiguration::sharedInstance().transientDirectory();
+        fs::create_directories(transient);
+        test::LogCapture log;
+        {
+            QRNDaemon daemon(root_.sharedContext());
+            initialise(daemon);
+        }
+        // Index of the first message beginning with `prefix` (signposts begin
+        // with their name), or -1.
+        const auto messages = log.messages();
+        auto indexOf = [&](std::string_view prefix) {
+            auto found = std::find_if(messages.begin(), messages.end(),
+                                      [&](const std::string& m) { return m.starts_with(prefix); });
+            return found == messages.end() ? -1L : static_cast<long>(found - messages.begin());
+        };
+        const long setup = indexOf("BootSetup ["), cleanup = indexOf("BootCleanup [");
+        EXPECT_GE(setup, 0);
+        EXPECT_GE(cleanup, 0);
+        EXPECT_EQ(notifications(Notifications::kCleanupComplete), firstBoot ? 1 : 2);
+        EXPECT_TRUE(marker_.exists());
+        if (firstBoot) {
+            const long firstSetup = indexOf("FirstBootSetup [");
+            const long firstCleanup = indexOf("FirstBootCleanup [");
+            EXPECT_GE(indexOf("quarnd performing first boot initialization"), 0);
+            EXPECT_GE(firstSetup, 0);
+            EXPECT_LT(firstSetup, setup);
+            EXPECT_LT(setup, firstCleanup);
+            EXPECT_LT(firstCleanup, cleanup);
+            EXPECT_GE(indexOf("quarnd first boot cleanup complete"), 0) << log.all();
+            EXPECT_EQ(notifications(Notifications::kRebootCleanupComplete), 1);
+            EXPECT_FALSE(fs::exists(transient)) << "first-boot cleanup did not run";
+            EXPECT_TRUE(
+                fs::exists(QRNGlobalConfiguration::sharedInstance().logDirectory() / "quarnd.log"));
+        } else {
+            EXPECT_FALSE(log.contains("first boot")) << log.all();
+            EXPECT_FALSE(log.contains("FirstBoot")) << log.all();
+            // Still the one line of the first start.
+            EXPECT_EQ(notifications(Notifications::kRebootCleanupComplete), 1);
+            EXPECT_TRUE(fs::exists(transient)) << "transient data is kept until a first boot";
+        }
     }
-    EXPECT_GE(indexOf(log, "quarnd performing first boot initialization"), 0);
-    // Signposts begin with their name.
-    const long firstSetup = indexOf(log, "FirstBootSetup [");
-    const long firstCleanup = indexOf(log, "FirstBootCleanup [");
-    EXPECT_GE(firstSetup, 0);
-    EXPECT_LT(firstSetup, indexOf(log, "BootSetup ["));
-    EXPECT_LT(indexOf(log, "BootSetup ["), firstCleanup);
-    EXPECT_GE(firstCleanup, 0);
-    EXPECT_LT(firstCleanup, indexOf(log, "BootCleanup ["));
-    EXPECT_GE(indexOf(log, "quarnd first boot cleanup complete"), 0) << log.all();
-    EXPECT_TRUE(marker_.exists());
-    EXPECT_EQ(lines(notificationFile(Notifications::kRebootCleanupComplete)), 1u);
-    EXPECT_EQ(lines(notificationFile(Notifications::kCleanupComplete)), 1u);
-    EXPECT_FALSE(fs::exists(transient)) << "first-boot cleanup did not run";
-    EXPECT_TRUE(fs::exists(QRNGlobalConfiguration::sharedInstance().logDirectory() / "quarnd.log"));
-}
-
-TEST_F(DaemonInitTest, WithTheMarkerOnlyTheBootPassesRun) {
-    ASSERT_TRUE(marker_.create());
-    const fs::path transient = QRNGlobalConfiguration::sharedInstance().transientDirectory();
-    test::LogCapture log;
-    {
-        QRNDaemon daemon(root_.sharedContext());
-        initialise(daemon);
-    }
-    EXPECT_FALSE(log.contains("first boot")) << log.all();
-    EXPECT_FALSE(log.contains("FirstBoot")) << log.all();
-    EXPECT_GE(indexOf(log, "BootSetup ["), 0);
-    EXPECT_GE(indexOf(log, "BootCleanup ["), 0);
-    EXPECT_FALSE(fs::exists(notificationFile(Notifications::kRebootCleanupComplete)));
-    EXPECT_EQ(lines(notificationFile(Notifications::kCleanupComplete)), 1u);
-    EXPECT_TRUE(fs::exists(transient)) << "transient data is kept until a first boot";
 }
 
 TEST_F(DaemonInitTest, ALockedDeviceAtStartSuspendsTheLockStateQueue) {

@@ -7,7 +7,7 @@
 
 #include <gtest/gtest.h>
 
-#include <initializer_list>
+#include <vector>
 
 using namespace quarn;
 
@@ -15,70 +15,58 @@ namespace {
 
 class FakeLockState final : public LockState {
 public:
-    std::int32_t state() const override { return state_; }
+    std::int32_t state() const override { return current; }
     Status startWatching(Callback) override { return {}; }
     void stopWatching() override {}
-    void set(std::int32_t state) { state_ = state; }
-
-private:
-    std::int32_t state_ = kUnlocked;
+    std::int32_t current = kUnlocked;
 };
 
-class DaemonLockStateTest : public ::testing::Test {
-protected:
-    DaemonLockStateTest()
-        : lockState_(std::make_shared<FakeLockState>()),
-          queue_(std::make_shared<Queue>("test.lockstate", Queue::Kind::Manual)),
-          follower_(lockState_, queue_) {}
-
-    void report(std::initializer_list<std::int32_t> states) {
-        for (std::int32_t state : states) {
-            lockState_->set(state);
-            follower_.lockstated_notification_callback();
+TEST(DaemonLockStateTest, FollowerSuspendsAndResumesOncePerChange) {
+    constexpr std::int32_t kLocked = LockState::kLocked, kUnlocked = LockState::kUnlocked;
+    const struct {
+        const char* what;
+        bool heldElsewhere; // the queue is suspended by someone else first
+        std::vector<std::int32_t> reports;
+        std::int32_t recorded;
+        bool running;
+    } cases[] = {
+        {"locked suspends", false, {kLocked}, kLocked, false},
+        {"a second locked does not suspend again",
+         false,
+         {kLocked, kLocked, kUnlocked},
+         kUnlocked,
+         true},
+        {"a second unlocked does not resume again",
+         false,
+         {kLocked, kUnlocked, kUnlocked},
+         kUnlocked,
+         true},
+        {"transitional states change nothing", false, {kLocked, 2, -1}, kLocked, false},
+        {"nor after unlocking", false, {kLocked, kUnlocked, 7}, kUnlocked, true},
+        // A resume by the follower would let the other holder's block run.
+        {"a first unlocked resumes nothing", true, {kUnlocked}, kUnlocked, false},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.what);
+        auto lockState = std::make_shared<FakeLockState>();
+        auto queue = std::make_shared<Queue>("test.lockstate", Queue::Kind::Manual);
+        QRNLockStateFollower follower(lockState, queue);
+        EXPECT_EQ(follower.recordedState(), QRNLockStateFollower::kInitialState);
+        if (c.heldElsewhere) {
+            queue->suspend();
+        }
+        for (std::int32_t state : c.reports) {
+            lockState->current = state;
+            follower.lockstated_notification_callback();
+        }
+        EXPECT_EQ(follower.recordedState(), c.recorded);
+        queue->async([] {});
+        EXPECT_EQ(queue->runPending() > 0, c.running);
+        if (c.heldElsewhere) {
+            queue->resume();
+            EXPECT_EQ(queue->runPending(), 1u);
         }
     }
-    // Whether a block submitted now runs: the queue is not suspended.
-    bool running() {
-        queue_->async([] {});
-        return queue_->runPending() > 0;
-    }
-
-    std::shared_ptr<FakeLockState> lockState_;
-    std::shared_ptr<Queue> queue_;
-    QRNLockStateFollower follower_;
-};
-
-TEST_F(DaemonLockStateTest, RepeatedLockedSuspendsOnceAndUnlockedResumesOnce) {
-    EXPECT_EQ(follower_.recordedState(), QRNLockStateFollower::kInitialState);
-    report({LockState::kLocked});
-    EXPECT_FALSE(running()) << "locked did not suspend";
-    report({LockState::kLocked});
-    report({LockState::kUnlocked});
-    EXPECT_TRUE(running()) << "a second locked report suspended again";
-    EXPECT_EQ(follower_.recordedState(), LockState::kUnlocked);
-    report({LockState::kUnlocked});
-    EXPECT_TRUE(running());
-}
-
-TEST_F(DaemonLockStateTest, TransitionalStatesChangeNothing) {
-    report({LockState::kLocked, 2, -1});
-    EXPECT_EQ(follower_.recordedState(), LockState::kLocked);
-    EXPECT_FALSE(running());
-    report({LockState::kUnlocked});
-    EXPECT_TRUE(running());
-    report({7});
-    EXPECT_EQ(follower_.recordedState(), LockState::kUnlocked);
-    EXPECT_TRUE(running());
-}
-
-TEST_F(DaemonLockStateTest, FirstUnlockedReportResumesNothing) {
-    // Held by someone else: a resume by the follower would let this block run.
-    queue_->suspend();
-    report({LockState::kUnlocked});
-    EXPECT_EQ(follower_.recordedState(), LockState::kUnlocked);
-    EXPECT_FALSE(running());
-    queue_->resume();
-    EXPECT_EQ(queue_->runPending(), 1u);
 }
 
 } // namespace
