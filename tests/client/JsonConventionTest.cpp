@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <limits>
 
 using namespace quarn;
@@ -19,20 +20,12 @@ bool sameKinds(const Value& a, const Value& b) {
         return false;
     }
     if (const auto* items = a.asArray()) {
-        for (std::size_t i = 0; i < items->size(); ++i) {
-            if (!sameKinds((*items)[i], (*b.asArray())[i])) {
-                return false;
-            }
-        }
+        return std::equal(items->begin(), items->end(), b.asArray()->begin(), sameKinds);
     }
-    if (const auto* entries = a.asDictionary()) {
-        for (const auto& [key, item] : *entries) {
-            if (!sameKinds(item, *b.get(key))) {
-                return false;
-            }
-        }
-    }
-    return true;
+    const auto* entries = a.asDictionary();
+    return !entries || std::all_of(entries->begin(), entries->end(), [&](const auto& entry) {
+        return sameKinds(entry.second, *b.get(entry.first));
+    });
 }
 
 Value everyKind() {
@@ -55,13 +48,6 @@ Value everyKind() {
     dictionary.set("$$double", "escaped twice");
     dictionary.set("list", Value::Array{Value::Array{}, Value::dictionary(), std::int64_t{-1}});
     return dictionary;
-}
-
-void expectRefused(std::string_view text, std::string_view reason) {
-    auto parsed = JsonConvention::parse(text);
-    ASSERT_FALSE(parsed) << text << " parsed as " << parsed->description();
-    EXPECT_NE(parsed.error().message.find(reason), std::string::npos)
-        << text << ": " << parsed.error().message;
 }
 
 } // namespace
@@ -98,28 +84,34 @@ TEST(JsonConvention, ReadsTheDocumentedForms) {
 }
 
 TEST(JsonConvention, RefusesMalformedInput) {
-    expectRefused(R"({"$uuid": "not-a-uuid"})", "UUID");
-    expectRefused(R"({"$uuid": 5})", "UUID");
-    expectRefused(R"({"$data": "3q2+7w="})", "base64");
-    expectRefused(R"({"$data": "3q2+7w==!"})", "base64");
-    expectRefused(R"({"$date": "yesterday"})", "$date");
-    expectRefused(R"({"$date": 1e300})", "$date");
-    expectRefused(R"({"$int": 9223372036854775808})", "$int");
-    expectRefused(R"({"$int": 1.0})", "$int");
-    expectRefused(R"({"$when": 1})", "unknown key \"$when\"");
-    expectRefused(R"({"$uuid": "E621E1F8-C36C-495A-93FC-0C247A3E6E5F", "x": 1})", "only key");
-    expectRefused("18446744073709551616", "does not fit in 64 bits");
-    expectRefused("-9223372036854775809", "does not fit in 64 bits");
-    expectRefused("{\"a\": ", "not JSON");
-    expectRefused(std::string(JsonConvention::kMaxNesting + 1, '[') +
-                      std::string(JsonConvention::kMaxNesting + 1, ']'),
-                  "nested deeper");
+    const std::string tooDeep = std::string(JsonConvention::kMaxNesting + 1, '[') +
+                                std::string(JsonConvention::kMaxNesting + 1, ']');
+    const std::pair<std::string, std::string_view> cases[] = {
+        {R"({"$uuid": "not-a-uuid"})", "UUID"},
+        {R"({"$uuid": 5})", "UUID"},
+        {R"({"$data": "3q2+7w="})", "base64"},
+        {R"({"$data": "3q2+7w==!"})", "base64"},
+        {R"({"$date": "yesterday"})", "$date"},
+        {R"({"$date": 1e300})", "$date"},
+        {R"({"$int": 9223372036854775808})", "$int"},
+        {R"({"$int": 1.0})", "$int"},
+        {R"({"$when": 1})", "unknown key \"$when\""},
+        {R"({"$uuid": "E621E1F8-C36C-495A-93FC-0C247A3E6E5F", "x": 1})", "only key"},
+        {"18446744073709551616", "does not fit in 64 bits"},
+        {"-9223372036854775809", "does not fit in 64 bits"},
+        {"{\"a\": ", "not JSON"},
+        {tooDeep, "nested deeper"},
+    };
+    for (const auto& [text, reason] : cases) {
+        auto parsed = JsonConvention::parse(text);
+        ASSERT_FALSE(parsed) << text << " parsed as " << parsed->description();
+        EXPECT_NE(parsed.error().message.find(reason), std::string::npos)
+            << text << ": " << parsed.error().message;
+    }
 }
 
 TEST(JsonConvention, PrintsBytesThatAreNotUTF8InsteadOfFailing) {
-    auto printed = JsonConvention::print(Value(std::string("a\xFF"
-                                                           "b")),
-                                         -1);
+    auto printed = JsonConvention::print(Value(std::string("a\xFF") + "b"), -1);
     EXPECT_EQ(printed.front(), '"');
     EXPECT_NE(printed.find('a'), std::string::npos);
 }
