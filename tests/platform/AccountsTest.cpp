@@ -44,7 +44,7 @@ TEST_F(AccountsOnTempRoot, FindsTheRootsOwnUsersAndGroupsWithHomesBelowTheRoot) 
     EXPECT_FALSE(installed.groupByName(""));
 }
 
-TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndKeepsReading) {
+TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndHomesOutsideTheRoot) {
     root_.writeFile("/etc/passwd", "garbage without colons\n"
                                    "\n"
                                    "nouid:x::5:x:/h:/bin/sh\n"
@@ -54,7 +54,11 @@ TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndKeepsReading) {
                                    ":x:9:9::/empty-name:/bin/sh\n"
                                    "+compat:x:10:10::/p:/bin/sh\n"
                                    "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n"
-                                   "twin:x:501:20::/second:/bin/sh\n");
+                                   "twin:x:501:20::/second:/bin/sh\n"
+                                   "escape:x:600:600::/private/../../../etc:/bin/sh\n"
+                                   "nohome:x:601:601\n"
+                                   "emptyhome:x:602:602:::\n"
+                                   "relative:x:603:603::var/rel:/bin/sh\n");
     root_.writeFile("/etc/group", "bad\n"
                                   "nogid:x::a,b\n"
                                   ":x:1501:ghost\n"
@@ -72,14 +76,8 @@ TEST_F(AccountsOnTempRoot, SkipsMalformedLinesAndKeepsReading) {
     EXPECT_EQ(a.groupByGID(1501)->name, "systemusers");
     EXPECT_EQ(a.groupByGID(1501)->members, (std::vector<std::string>{"mobile", "other"}));
     EXPECT_FALSE(a.groupByName("nogid"));
-}
 
-TEST_F(AccountsOnTempRoot, HomesThatLeaveTheRootOrAreMissingAreEmpty) {
-    root_.writeFile("/etc/passwd", "escape:x:600:600::/private/../../../etc:/bin/sh\n"
-                                   "nohome:x:601:601\n"
-                                   "emptyhome:x:602:602:::\n"
-                                   "relative:x:603:603::var/rel:/bin/sh\n");
-    auto a = accounts();
+    // Homes that leave the root or are missing are empty.
     for (const char* name : {"escape", "nohome", "emptyhome"}) {
         ASSERT_TRUE(a.userByName(name)) << name;
         EXPECT_TRUE(a.userByName(name)->homeDirectory.empty()) << name;

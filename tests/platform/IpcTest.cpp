@@ -60,6 +60,10 @@ struct Client {
     }
     void write(const Bytes& bytes) { EXPECT_TRUE(FrameSocket::writeAll(fd.get(), bytes)); }
     void send(const Value& m) { write(IpcFrame::encodeMessage(m, true)); }
+    std::uint64_t roundTrip(std::uint64_t seq) {
+        send(message(seq));
+        return seqOf(receive());
+    }
     // The next reply, or none when the connection ended.
     std::optional<Value> receive() {
         Bytes body;
@@ -103,9 +107,8 @@ TEST(IpcPeerTest, SocketPeerIsThisProcessWithItsToken) {
     ::close(fds[0]);
     ::close(fds[1]);
     ASSERT_TRUE(peer) << peer.error().message;
-    EXPECT_EQ(peer->pid(), ::getpid());
-    EXPECT_EQ(peer->uid(), ::geteuid());
-    EXPECT_EQ(peer->gid(), ::getegid());
+    EXPECT_EQ(std::make_tuple(peer->pid(), peer->uid(), peer->gid()),
+              std::make_tuple(::getpid(), ::geteuid(), ::getegid()));
     EXPECT_GE(peer->pidfd(), 0); // pidfd_open exists since Linux 5.3
 
     const auto startTime = IpcPeer::processStartTime(::getpid());
@@ -297,14 +300,12 @@ TEST_F(IpcListenerTest, SocketFileIsMadeOpenToAllReplacedWhenStaleAndKeptWhenLiv
 
     ASSERT_TRUE(start(echo)); // over the stale file
     Client client(socketPath());
-    client.send(message(7));
-    EXPECT_EQ(seqOf(client.receive()), 7u);
+    EXPECT_EQ(client.roundTrip(7), 7u);
     EXPECT_EQ(accepted(0)->peer().pid(), ::getpid());
 
     IpcListener second(options());
     EXPECT_FALSE(second.start([](auto) {}));
-    client.send(message(8));
-    EXPECT_EQ(seqOf(client.receive()), 8u);
+    EXPECT_EQ(client.roundTrip(8), 8u);
 
     auto o = options();
     o.socketPath = root_ / "/not-a-socket";
@@ -392,8 +393,7 @@ TEST_F(IpcListenerTest, MalformedFrameClosesOnlyItsConnectionWithOneLogLine) {
             << log.all();
         EXPECT_TRUE(log.contains(c.reason)) << log.all();
         log.clear();
-        bystander.send(message(1));
-        EXPECT_TRUE(bystander.receive());
+        EXPECT_EQ(bystander.roundTrip(1), 1u);
     }
     listener_->stop();
     for (std::size_t i = 1; i <= std::size(cases); ++i) {
@@ -444,8 +444,7 @@ TEST_F(IpcListenerTest, ConnectionsPastTheLimitAreClosedUntilOthersEnd) {
     }
     ASSERT_TRUE(waitUntil([&] { return invalidations_.size() == 2; }));
     Client fourth(socketPath());
-    fourth.send(message(4));
-    EXPECT_EQ(seqOf(fourth.receive()), 4u);
+    EXPECT_EQ(fourth.roundTrip(4), 4u);
 }
 
 TEST_F(IpcListenerTest, EveryEndIsHeardOnceAndAfterTheHandlerReturned) {
@@ -471,8 +470,7 @@ TEST_F(IpcListenerTest, EveryEndIsHeardOnceAndAfterTheHandlerReturned) {
     EXPECT_TRUE(cancelled.closedByService());
     {
         Client gone(socketPath());
-        gone.send(Value::dictionary());
-        EXPECT_TRUE(gone.receive());
+        EXPECT_EQ(gone.roundTrip(5), 5u);
     }
     Client idle(socketPath());
     Client neverResumed(socketPath());
@@ -534,20 +532,17 @@ TEST_F(IpcListenerTest, AdoptsAnInheritedListeningSocketAndFindsSystemdsByName) 
     o.socketPath.clear();
     ASSERT_TRUE(start(echo, o));
     Client client(socketPath());
-    client.send(Value::dictionary());
-    EXPECT_TRUE(client.receive());
+    EXPECT_EQ(client.roundTrip(5), 5u);
 }
 
 TEST_F(IpcListenerTest, EachMessageNamesItsWriterAndAFrameOfTwoWritersClosesTheConnection) {
     ASSERT_TRUE(start(echo));
     LogCapture log;
     Client client(socketPath());
-    client.send(message(1));
-    EXPECT_EQ(seqOf(client.receive()), 1u);
+    EXPECT_EQ(client.roundTrip(1), 1u);
     const pid_t child = inChild([&] { client.send(message(2)); });
     EXPECT_EQ(seqOf(client.receive()), 2u);
-    client.send(message(3));
-    EXPECT_EQ(seqOf(client.receive()), 3u);
+    EXPECT_EQ(client.roundTrip(3), 3u);
     const IpcConnection::Sender self{::getpid(), ::getuid(), ::getgid()};
     {
         std::lock_guard lock(mutex_);

@@ -104,7 +104,7 @@ TEST_F(LockStateTest, WatchSeesWritesRenamesAndRemoval) {
     EXPECT_EQ(reports.waitFor(7), (V{1, 0, 2, 1, 0, 1, 0}));
 }
 
-TEST_F(LockStateTest, StoppedWatchesAreSilentAndRestartsWork) {
+TEST_F(LockStateTest, StoppedWatchesAreSilentRestartsWorkAndALostRunDirectoryIsUnlocked) {
     writeInPlace("1");
     Reports first, second, third;
     ASSERT_TRUE(lock_.startWatching(first.callback()));
@@ -116,8 +116,9 @@ TEST_F(LockStateTest, StoppedWatchesAreSilentAndRestartsWork) {
     lock_.stopWatching();
     lock_.stopWatching(); // twice is harmless
     ASSERT_TRUE(lock_.startWatching(third.callback()));
-    writeInPlace("0");
+    std::filesystem::remove_all(runDirectory());
     EXPECT_EQ(third.waitFor(1), V{0});
+    EXPECT_EQ(lock_.state(), LockState::kUnlocked);
     // The earlier watches were joined before their replacement started.
     EXPECT_EQ(first.waitFor(), V{0});
     EXPECT_EQ(second.waitFor(), V{1});
@@ -137,13 +138,4 @@ TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
     lock.reset(); // with a live watch: the thread must be gone before the object
     writeInPlace("0");
     EXPECT_EQ(reports.waitFor(), V{1});
-}
-
-TEST_F(LockStateTest, LosingTheRunDirectoryReportsUnlocked) {
-    writeInPlace("1");
-    Reports reports;
-    ASSERT_TRUE(lock_.startWatching(reports.callback()));
-    std::filesystem::remove_all(runDirectory());
-    EXPECT_EQ(reports.waitFor(1), V{0});
-    EXPECT_EQ(lock_.state(), LockState::kUnlocked);
 }
