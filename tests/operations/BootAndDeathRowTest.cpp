@@ -256,8 +256,11 @@ TEST_F(BootCleanupTest, MissingStagingIsSilentAndAnUnreadableOneDoesNotStopTheOt
 }
 
 TEST_F(BootCleanupTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsContainers) {
-    QRNMetadataPtr kept = create("com.example.kept", kQRNContainerClassAppData);
-    ASSERT_TRUE(kept);
+    // The daemon's own connection may make any identifier's container.
+    auto made = shared().createOrLookupContainerWithContainerIdentity(
+        identity("com.example.kept", kQRNContainerClassAppData), true, false, true);
+    ASSERT_TRUE(made.has_value()) << made.error();
+    const QRNMetadataPtr kept = *made;
     const std::string orphanName = UUID::random().string();
     const fs::path orphan = makeTree(classDirectory(kQRNContainerClassAppData) / orphanName);
     const fs::path junk = makeTree(classDirectory(kQRNContainerClassAppData) / "not-a-uuid");

@@ -1,7 +1,7 @@
 // Client identities and the rights they bring: what the code-signing
 // registry says about the peer process, the installer's remembered
-// identity, entitlements as booleans, the lookup entitlement per class, the
-// daemon's own privileged connection and the protection class asked for.
+// identity, entitlements as booleans, the lookup entitlement per class and
+// the protection class asked for.
 
 #include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
@@ -174,16 +174,6 @@ TEST_F(ClientIdentityTest, OnlyBooleansAndNumbersGrantAnEntitlement) {
         EXPECT_EQ(identity->boolValueOfEntitlement(name), granted == "flag" || granted == "one")
             << name;
     }
-}
-
-TEST_F(ClientIdentityTest, SharedConnectionIsPrivilegedAndOneInstance) {
-    auto& shared = QRNClientConnection::sharedClientConnection();
-    EXPECT_EQ(&shared, &QRNClientConnection::sharedClientConnection());
-    EXPECT_TRUE(shared.unrestricted() && shared.allowOtherIdLookup());
-    ASSERT_TRUE(shared.clientIdentity());
-    EXPECT_FALSE(shared.clientIdentity()->isKernel());
-    EXPECT_EQ(shared.clientBundleIdentifier(), "com.orvex.quarnd.internal");
-    EXPECT_TRUE(shared.commandQueue());
 }
 
 TEST_F(ClientIdentityTest, LookupEntitlementIsReadPerClassByShortName) {

@@ -169,7 +169,7 @@ TEST_F(ClientIdentityCacheTest, ARegistryChangeIsSeenByTheNextMessage) {
     EXPECT_FALSE(identityOf(self()));
 }
 
-TEST_F(ClientIdentityCacheTest, AGoneWriterOrOneWithOtherIdsIsIdentifiedAgain) {
+TEST_F(ClientIdentityCacheTest, AGoneWriterOrOneWithOtherIdsIsIdentifiedAgainAndNoWriterIsThePeer) {
     registerSelf(kAllowed);
     Child forked;
     const IpcConnection::Sender gone = forked.sender();
@@ -185,12 +185,9 @@ TEST_F(ClientIdentityCacheTest, AGoneWriterOrOneWithOtherIdsIsIdentifiedAgain) {
     ASSERT_TRUE(again);
     EXPECT_NE(again, parent) << "other ids are another key";
     EXPECT_EQ(again->posixUID(), ::geteuid()) << "the ids are read again from the process";
-}
 
-TEST_F(ClientIdentityCacheTest, WithoutWriterTheConnectionsPeerIsTheWriter) {
-    registerSelf(kAllowed);
-    const auto identity = identityOf(self());
+    // Without a writer the connection's peer is the writer.
     connection_.sender.reset();
-    EXPECT_EQ(cache_.identityFor(connection_), identity);
+    EXPECT_EQ(cache_.identityFor(connection_), identityOf(self()));
     EXPECT_FALSE(identityOf({0, 0, 0})) << "a writer the kernel could not name has no identity";
 }
