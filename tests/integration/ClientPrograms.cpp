@@ -119,7 +119,6 @@ void ClientPrograms::install(const std::filesystem::path& clientProgram, std::st
     std::filesystem::permissions(target, std::filesystem::perms::owner_all |
                                              std::filesystem::perms::group_read |
                                              std::filesystem::perms::group_exec);
-    copied_ = true;
 }
 
 } // namespace quarn::test

@@ -39,15 +39,11 @@ public:
                    const std::filesystem::path& directory, const std::filesystem::path& registry);
 
     std::filesystem::path pathOf(std::string_view name) const { return directory_ / name; }
-    // True when the directory is on another file system than the client,
-    // so that the copies had to be copied instead of linked.
-    bool copied() const { return copied_; }
 
 private:
     void install(const std::filesystem::path& clientProgram, std::string_view name);
 
     std::filesystem::path directory_;
-    bool copied_ = false;
 };
 
 } // namespace quarn::test

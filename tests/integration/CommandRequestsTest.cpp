@@ -38,19 +38,10 @@ Value command(std::uint64_t number, Value::Dictionary keys = {}) {
     return Value(std::move(keys));
 }
 
-std::string stringAt(const Value& reply, std::string_view key) {
+// The reply's value at `key`; none when absent.
+Value at(const Value& reply, std::string_view key) {
     const Value* value = reply.get(key);
-    return value && value->asString() ? *value->asString() : std::string();
-}
-
-std::optional<bool> boolAt(const Value& reply, std::string_view key) {
-    const Value* value = reply.get(key);
-    return value ? value->asBool() : std::nullopt;
-}
-
-std::optional<UUID> uuidAt(const Value& reply, std::string_view key) {
-    const Value* value = reply.get(key);
-    return value ? value->asUUID() : std::nullopt;
+    return value ? *value : Value();
 }
 
 } // namespace
@@ -74,11 +65,12 @@ TEST_F(CommandRequests, CreateThenLookUpFindsTheSameContainerWithItsSubdirectori
         const auto replies = repliesOf(P::kAllowed, {createOrLookup(identifier, c.containerClass),
                                                      createOrLookup(identifier, c.containerClass)});
         ASSERT_EQ(replyError(replies[0]), kQRNErrorNone) << replies[0].description();
-        EXPECT_EQ(boolAt(replies[0], "ReplyExisted"), false);
-        EXPECT_EQ(stringAt(replies[0], "ReplyIdentifier"), identifier);
-        const std::optional<UUID> uuid = uuidAt(replies[0], "ReplyUUID");
-        ASSERT_TRUE(uuid);
-        const std::filesystem::path path = stringAt(replies[0], "ReplyPath");
+        EXPECT_EQ(at(replies[0], "ReplyExisted"), Value(false));
+        EXPECT_EQ(at(replies[0], "ReplyIdentifier"), Value(identifier));
+        const std::optional<UUID> uuid = at(replies[0], "ReplyUUID").asUUID();
+        const Value replyPath = at(replies[0], "ReplyPath");
+        ASSERT_TRUE(uuid && replyPath.asString());
+        const std::filesystem::path path = *replyPath.asString();
         EXPECT_EQ(path.filename(), uuid->string());
         EXPECT_EQ(path.parent_path(),
                   daemon() / "/private/var/mobile/Containers" / c.classDirectory);
@@ -87,9 +79,9 @@ TEST_F(CommandRequests, CreateThenLookUpFindsTheSameContainerWithItsSubdirectori
             EXPECT_TRUE(std::filesystem::is_directory(path / subdirectory)) << subdirectory;
         }
         ASSERT_EQ(replyError(replies[1]), kQRNErrorNone);
-        EXPECT_EQ(boolAt(replies[1], "ReplyExisted"), true);
-        EXPECT_EQ(uuidAt(replies[1], "ReplyUUID"), uuid);
-        EXPECT_EQ(stringAt(replies[1], "ReplyPath"), path.string());
+        EXPECT_EQ(at(replies[1], "ReplyExisted"), Value(true));
+        EXPECT_EQ(at(replies[1], "ReplyUUID"), Value(*uuid));
+        EXPECT_EQ(at(replies[1], "ReplyPath"), Value(path.string()));
     }
 }
 
@@ -127,13 +119,14 @@ TEST_F(CommandRequests, UnentitledClientStaysWithinItsOwnIdentity) {
                              createOrLookup("com.orvex.test.someone-else", 2)});
     // No "Identifier": the client's own, as the registry names it.
     EXPECT_EQ(replyError(replies[0]), kQRNErrorNone) << replies[0].description();
-    EXPECT_EQ(stringAt(replies[0], "ReplyIdentifier"), P::identifierOf(P::kNone));
+    EXPECT_EQ(at(replies[0], "ReplyIdentifier"), Value(P::identifierOf(P::kNone)));
     // Its own system container only when its code signature declares one.
     EXPECT_EQ(replyError(replies[1]), kQRNErrorNotEntitled) << replies[1].description();
     // A well-known system container is open to all, and named by its identifier.
     EXPECT_EQ(replyError(replies[2]), kQRNErrorNone) << replies[2].description();
-    const std::filesystem::path path = stringAt(replies[2], "ReplyPath");
-    EXPECT_EQ(path, daemon() / "/private/var/containers/Data/System" / kWellKnown);
+    const std::filesystem::path path =
+        daemon() / "/private/var/containers/Data/System" / kWellKnown;
+    EXPECT_EQ(at(replies[2], "ReplyPath"), Value(path.string()));
     EXPECT_TRUE(std::filesystem::is_directory(path));
     // Another identifier's container is out of reach, and nothing is made.
     EXPECT_EQ(replyError(replies[3]), kQRNErrorNotEntitled);

@@ -9,17 +9,12 @@
 #include <signal.h>
 
 #include <fstream>
-#include <iostream>
 #include <iterator>
 #include <thread>
 
 namespace quarn::test {
 
-namespace {
-
 using Clock = std::chrono::steady_clock;
-
-} // namespace
 
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds limit) {
     const Clock::time_point deadline = Clock::now() + limit;
@@ -40,9 +35,6 @@ DaemonHarness::DaemonHarness() {
                                        "VARIANT_ID=internal\n");
     clients_.emplace(QUARN_TEST_CLIENT_PATH, root() / "clients",
                      Paths(root()).configDirectory() / "codesign.d");
-    if (clients_->copied()) {
-        std::cout << "note: the test clients are copies, not hard links (another file system)\n";
-    }
 }
 
 std::filesystem::path DaemonHarness::operator/(std::string_view absolute) const {
@@ -89,10 +81,6 @@ bool DaemonHarness::waitUntilAccepting() {
         }
     }
     return false;
-}
-
-bool DaemonHarness::start() {
-    return spawn() && waitUntilAccepting();
 }
 
 bool DaemonHarness::isRunning() const {
@@ -173,12 +161,9 @@ Result<QRNClient> DaemonHarness::connect() const {
 Value DaemonHarness::request(const Value& request) const {
     auto client = connect();
     auto reply = client ? client->send(request) : Result<Value>(QRN_UNEXPECTED(client.error()));
-    if (!reply) {
-        ADD_FAILURE() << "no reply to " << request.description() << ": "
-                      << reply.error().description();
-        return Value();
-    }
-    return *reply;
+    EXPECT_TRUE(reply) << "no reply to " << request.description() << ": "
+                       << reply.error().description();
+    return reply ? *reply : Value();
 }
 
 } // namespace quarn::test

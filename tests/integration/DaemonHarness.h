@@ -44,7 +44,6 @@ public:
     std::filesystem::path operator/(std::string_view absolute) const;
     std::filesystem::path runDirectory() const;
     std::filesystem::path socketPath() const;
-    const ClientPrograms& clients() const { return *clients_; }
 
     // Spawns quarnd on the root (with `environment` added) and returns at
     // once. False when it cannot be spawned.
@@ -52,8 +51,7 @@ public:
     // Polls connecting to the socket until it accepts; false when the
     // daemon ended or the limit passed first.
     bool waitUntilAccepting();
-    // spawn() and waitUntilAccepting().
-    bool start();
+    bool start() { return spawn() && waitUntilAccepting(); }
     bool isRunning() const;
     // SIGTERM, then waits for the exit; none when the daemon does not end.
     std::optional<ChildProcess::Exit> stop();

@@ -2,11 +2,10 @@
 // prints each reply. The integration tests run hard-linked copies of it,
 // each registered in the code-signing registry with other entitlements.
 //
-//   quarn_test_client --socket PATH [HEX...]
+//   quarn_test_client --socket PATH HEX...
 //
-// Each HEX is the CBOR of one request dictionary; without any, one request
-// is read per line of stdin. Each reply is printed as hex CBOR on its own
-// line. When a request gets no reply, a line "!<error>" says why and the
+// Each HEX is the CBOR of one request dictionary. Each reply is printed as
+// hex CBOR on its own line. When a request gets no reply, a line "!<error>" says why and the
 // client stops: 0 all answered, 1 usage or bad input, 2 cannot connect,
 // 3 a request went unanswered.
 
@@ -14,7 +13,6 @@
 #include "common/shared/HexCbor.h"
 
 #include <cstdio>
-#include <iostream>
 #include <string>
 #include <vector>
 
@@ -47,17 +45,10 @@ int sendAll(QRNClient& client, const std::vector<std::string>& requests) {
 
 int main(int argc, char** argv) {
     if (argc < 3 || std::string(argv[1]) != "--socket") {
-        std::fprintf(stderr, "usage: %s --socket PATH [HEX...]\n", argv[0]);
+        std::fprintf(stderr, "usage: %s --socket PATH HEX...\n", argv[0]);
         return 1;
     }
-    std::vector<std::string> requests(argv + 3, argv + argc);
-    if (requests.empty()) {
-        for (std::string line; std::getline(std::cin, line);) {
-            if (!line.empty()) {
-                requests.push_back(line);
-            }
-        }
-    }
+    const std::vector<std::string> requests(argv + 3, argv + argc);
     auto client = QRNClient::connect(argv[2]);
     if (!client) {
         std::printf("!%s\n", client.error().description().c_str());

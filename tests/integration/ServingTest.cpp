@@ -1,0 +1,238 @@
+// One daemon that must keep serving: under hostile frames, lock-state
+// changes and many concurrent clients.
+
+#include "Client/QRNClientRequests.h"
+#include "Daemon/platform/CborCodec.h"
+#include "Daemon/platform/IpcFrame.h"
+#include "Daemon/support/Descriptor.h"
+#include "SharedDaemonTest.h"
+#include "common/shared/FrameSocket.h"
+
+#include <fmt/format.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <fstream>
+#include <latch>
+#include <map>
+#include <set>
+#include <thread>
+
+namespace quarn::test {
+
+namespace {
+
+class Serving : public SharedDaemonTest {
+protected:
+    // Fails the calling test unless a client of the registry is served.
+    static void expectServed(const std::string& identifier) {
+        const Value reply =
+            daemon().request(QRNClientRequests::createOrLookup(identifier, 2, true, false));
+        EXPECT_EQ(replyError(reply), kQRNErrorNone) << reply.description();
+    }
+};
+
+constexpr std::uint8_t kReply = IpcFrame::kExpectsReply;
+
+Value create(Value::Dictionary keys) {
+    keys.emplace("ContainerClass", 2u);
+    keys.emplace("CreateIfNecessary", true);
+    keys.emplace("Command", 0u);
+    return Value(std::move(keys));
+}
+
+// A request whose "Deep" key holds arrays nested so that, with the
+// request's own map, `depth` containers sit inside each other.
+Value nested(std::size_t depth) {
+    Value deep = Value::array();
+    for (std::size_t level = 2; level < depth; ++level) {
+        deep = Value(Value::Array{deep});
+    }
+    return create({{"Identifier", "com.orvex.test.nested"}, {"Deep", deep}});
+}
+
+// A request padded to exactly `size` bytes of CBOR.
+Value padded(std::size_t size) {
+    Value request = create({{"Identifier", "com.orvex.test.padded"}, {"Pad", Value::Data()}});
+    const std::size_t bare = CborCodec::encode(request).size();
+    // A byte string this long has a length field of a fixed size.
+    request.set("Pad", Value::Data(size - bare - 4));
+    EXPECT_EQ(CborCodec::encode(request).size(), size);
+    return request;
+}
+
+} // namespace
+
+// Frames no well-behaved client sends, over a raw socket: each may end its
+// own connection, never the daemon.
+TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
+    enum class After { Wait, HangUp, ShutdownWrite };
+    struct Case {
+        std::string name;
+        std::vector<std::uint8_t> bytes;
+        After after;
+        std::vector<std::uint64_t> replies; // the expected codes, in order
+        const char* closesWith;             // null: the daemon keeps the connection
+    };
+    const Value normal = create({{"Identifier", "com.orvex.test.hostile"}});
+    const std::vector<std::uint8_t> body = CborCodec::encode(normal);
+    const auto raw = [](std::uint32_t length, std::uint8_t flags, std::vector<std::uint8_t> bytes) {
+        return FrameSocket::rawFrame(length, flags, bytes);
+    };
+    const auto frame = [](const Value& v) { return FrameSocket::frame(v, kReply); };
+    std::vector<std::uint8_t> twoRequests = frame(normal);
+    const auto second = frame(create({{"ContainerClass", 0u}}));
+    twoRequests.insert(twoRequests.end(), second.begin(), second.end());
+    const Case cases[] = {
+        {"truncated header", {0x10, 0x00, 0x00}, After::ShutdownWrite, {}, ""},
+        {"truncated body, then gone", raw(100, kReply, {0xa1, 0x67}), After::HangUp, {}, nullptr},
+        {"frame over 1 MiB", raw((1u << 20) + 1, kReply, {}), After::Wait, {}, "over the limit"},
+        {"reserved flag bits",
+         raw(static_cast<std::uint32_t>(body.size()), 0x03, body),
+         After::Wait,
+         {},
+         "reserved bits"},
+        {"not CBOR", raw(3, kReply, {0xff, 0xfe, 0x13}), After::Wait, {}, "does not decode"},
+        {"CBOR that is no map",
+         frame(Value(Value::Array{0u})),
+         After::Wait,
+         {},
+         "not a dictionary"},
+        {"nesting 33 deep", frame(nested(33)), After::Wait, {}, "nest deeper than 32"},
+        {"reply flag clear",
+         FrameSocket::frame(normal, 0x00),
+         After::Wait,
+         {},
+         "Dictionary does not have reply context"},
+        {"frame of exactly 1 MiB", frame(padded(1u << 20)), After::Wait, {kQRNErrorNone}, nullptr},
+        {"nesting 32 deep", frame(nested(32)), After::Wait, {kQRNErrorNone}, nullptr},
+        {"unknown keys",
+         frame(create({{"Identifier", "com.orvex.test.unknown"},
+                       {"NoSuchKey", Value(Value::Dictionary{{"a", 1u}})}})),
+         After::Wait,
+         {kQRNErrorNone},
+         nullptr},
+        {"two requests in one write",
+         twoRequests,
+         After::Wait,
+         {kQRNErrorNone, kQRNErrorUnexpectedContainerType},
+         nullptr},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        const std::size_t logStart = daemon().logSize();
+        Descriptor connection(FrameSocket::connectTo(daemon().socketPath()));
+        // Every read ends by the limit: a silent daemon fails the test, not hangs it.
+        const timeval limit{.tv_sec = DaemonHarness::kWaitLimit.count(), .tv_usec = 0};
+        ASSERT_EQ(::setsockopt(connection.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit), 0);
+        ASSERT_TRUE(FrameSocket::writeAll(connection.get(), c.bytes));
+        if (c.after == After::HangUp) {
+            connection.close();
+        } else if (c.after == After::ShutdownWrite) {
+            ::shutdown(connection.get(), SHUT_WR);
+        }
+        for (std::uint64_t expected : c.replies) {
+            std::vector<std::uint8_t> replyBody;
+            const auto reply = FrameSocket::readFrame(connection.get(), replyBody);
+            ASSERT_TRUE(reply && reply->message) << "no reply";
+            EXPECT_EQ(replyError(*reply->message), expected) << reply->message->description();
+        }
+        if (c.closesWith) {
+            std::uint8_t byte = 0;
+            const ssize_t n = ::recv(connection.get(), &byte, 1, 0);
+            EXPECT_TRUE(n == 0 || (n < 0 && errno == ECONNRESET)) << "still open";
+            EXPECT_NE(daemon().log(logStart).find(c.closesWith), std::string::npos);
+        }
+        if (connection.valid()) {
+            connection.close();
+        }
+        // Whatever that connection did, the next client is served.
+        expectServed("com.orvex.test.after");
+        ASSERT_TRUE(daemon().isRunning());
+    }
+}
+
+// The device lock state, which the daemon follows from "<run>/lockstate",
+// changes under it: locked, transitional, unlocked, locked again, and the
+// file removed (which reads as unlocked). Requests are served in each.
+TEST_F(Serving, LockStateChangesDoNotDisturbServing) {
+    const std::filesystem::path file = daemon().runDirectory() / "lockstate";
+    std::size_t seen = daemon().logSize(); // where the previous report ended in the log
+    for (const char* state : {"1", "2", "0", "1", ""}) {
+        SCOPED_TRACE(*state ? state : "removed");
+        if (*state) {
+            std::ofstream(file, std::ios::trunc) << state << "\n";
+        } else {
+            std::filesystem::remove(file);
+        }
+        const std::string report = std::string("LockState=") + (*state ? state : "0");
+        const std::size_t at = daemon().waitForLog(report, seen);
+        ASSERT_NE(at, std::string::npos) << "the daemon did not report " << report;
+        seen = at + report.size();
+        expectServed("com.orvex.test.lockstate");
+    }
+}
+
+// Many clients at once, colliding on shared identifiers: each identity gets
+// exactly one container, however its creations and lookups interleave.
+TEST_F(Serving, ConcurrentClientsGetOneContainerPerIdentity) {
+    constexpr std::size_t kClients = 16, kShared = 4, kOwn = 12, kRounds = 3;
+    // Used by no other test of this daemon, so its directory holds only ours.
+    constexpr std::uint64_t kClass = 10;
+    std::vector<std::vector<std::pair<std::string, Value>>> replies(kClients);
+    std::latch start(kClients);
+    {
+        std::vector<std::jthread> clients;
+        for (std::size_t client = 0; client < kClients; ++client) {
+            clients.emplace_back([&, client] {
+                std::vector<std::string> identifiers;
+                for (std::size_t i = 0; i < kShared + kOwn; ++i) {
+                    identifiers.push_back(
+                        i < kShared ? fmt::format("com.orvex.test.shared.{}", i)
+                                    : fmt::format("com.orvex.test.client{}.{}", client, i));
+                }
+                // Each starts at another place of the list, to collide on every one.
+                std::rotate(identifiers.begin(), identifiers.begin() + client % identifiers.size(),
+                            identifiers.end());
+                auto connection = daemon().connect();
+                start.arrive_and_wait();
+                for (std::size_t round = 0; connection && round < kRounds; ++round) {
+                    for (const std::string& identifier : identifiers) {
+                        auto reply = connection->send(
+                            QRNClientRequests::createOrLookup(identifier, kClass, true, false));
+                        replies[client].emplace_back(identifier, reply ? *reply : Value());
+                    }
+                }
+            });
+        }
+    }
+    std::map<std::string, std::set<UUID>> uuidsOf;
+    std::map<std::string, std::size_t> creationsOf;
+    std::size_t count = 0;
+    for (const auto& ofClient : replies) {
+        for (const auto& [identifier, reply] : ofClient) {
+            ++count;
+            ASSERT_EQ(replyError(reply), kQRNErrorNone) << identifier;
+            const Value* uuid = reply.get("ReplyUUID");
+            ASSERT_TRUE(uuid && uuid->asUUID()) << identifier;
+            uuidsOf[identifier].insert(*uuid->asUUID());
+            const Value* existed = reply.get("ReplyExisted");
+            creationsOf[identifier] += existed && existed->asBool().value_or(false) ? 0 : 1;
+        }
+    }
+    EXPECT_EQ(count, kClients * kRounds * (kShared + kOwn));
+    EXPECT_EQ(uuidsOf.size(), kShared + kClients * kOwn);
+    std::set<std::string> expectedOnDisk, onDisk;
+    for (const auto& [identifier, uuids] : uuidsOf) {
+        EXPECT_EQ(uuids.size(), 1u) << identifier;
+        EXPECT_EQ(creationsOf[identifier], 1u) << identifier;
+        expectedOnDisk.insert(uuids.begin()->string());
+    }
+    for (const auto& entry : std::filesystem::directory_iterator(
+             daemon() / "/private/var/mobile/Containers/Data/InternalDaemon")) {
+        onDisk.insert(entry.path().filename().string());
+    }
+    EXPECT_EQ(onDisk, expectedOnDisk);
+}
+
+} // namespace quarn::test
