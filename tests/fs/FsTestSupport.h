@@ -11,14 +11,17 @@
 
 #include <gtest/gtest.h>
 
+#include <acl/libacl.h>
 #include <fcntl.h>
 #include <linux/fs.h>
+#include <sys/acl.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
@@ -61,6 +64,37 @@ inline std::optional<std::string> xattrOf(const fs::path& path,
     char buffer[256];
     auto n = ::lgetxattr(path.c_str(), name, buffer, sizeof buffer);
     return n < 0 ? std::nullopt : std::optional(std::string(buffer, static_cast<std::size_t>(n)));
+}
+
+// "mode uid:gid class" of `p`, e.g. "711 501:501 3" ("-" when it has no class).
+inline std::string describe(const fs::path& p) {
+    auto st = lstatOf(p);
+    char text[64];
+    std::snprintf(text, sizeof text, "%o %u:%u ", st.st_mode & 07777, st.st_uid, st.st_gid);
+    return text + xattrOf(p).value_or("-");
+}
+
+// The ACL of `type` in its short numeric form ("u::rw-,g:1501:rwx,..."), "" when none.
+inline std::string aclText(const fs::path& p, acl_type_t type = ACL_TYPE_ACCESS) {
+    acl_t acl = ::acl_get_file(p.c_str(), type);
+    char* text =
+        acl ? ::acl_to_any_text(acl, nullptr, ',', TEXT_ABBREVIATE | TEXT_NUMERIC_IDS) : nullptr;
+    std::string result = text ? text : "";
+    ::acl_free(text);
+    ::acl_free(acl);
+    return result;
+}
+
+// Passes when `result` failed with POSIX `err` and, when one is given, exactly `message`.
+template <class Result>
+testing::AssertionResult failedWith(const Result& result, int err,
+                                    const std::string& message = {}) {
+    if (result)
+        return testing::AssertionFailure() << "it succeeded";
+    const auto& e = result.error();
+    if (!e.isPOSIX(err) || (!message.empty() && e.message != message))
+        return testing::AssertionFailure() << e.description() << ": " << e.message;
+    return testing::AssertionSuccess();
 }
 
 // Sets or clears FS_IMMUTABLE_FL; answers the errno (0 on success).

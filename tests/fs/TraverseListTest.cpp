@@ -112,25 +112,17 @@ TEST_F(TraverseListTest, FileSystemFailuresEndTheWalkWithTheRootInTheMessage) {
         ++calls;
         return {};
     };
-    auto missing = manager_._traverseDirectory(top_ / "missing", count);
-    ASSERT_FALSE(missing);
-    EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
-    EXPECT_EQ(missing.error().message,
-              "Error for path " + (top_ / "missing").string() + ": No such file or directory");
-
+    EXPECT_TRUE(failedWith(manager_._traverseDirectory(top_ / "missing", count), ENOENT,
+                           "Error for path " + (top_ / "missing").string() +
+                               ": No such file or directory"));
     env_->failCall(EnvCall::ReadDir, 3, EIO);
-    auto unreadable = manager_._traverseDirectory(top_, count);
-    ASSERT_FALSE(unreadable);
-    EXPECT_TRUE(unreadable.error().isPOSIX(EIO));
-    EXPECT_EQ(unreadable.error().message,
-              "Error for path " + top_.string() + ": Input/output error");
+    EXPECT_TRUE(failedWith(manager_._traverseDirectory(top_, count), EIO,
+                           "Error for path " + top_.string() + ": Input/output error"));
     EXPECT_LT(calls, 13);
-
     env_->failCall(EnvCall::CloseDir, 1, EBADF);
-    auto closeFailed = manager_._traverseDirectory(top_, count);
-    ASSERT_FALSE(closeFailed);
-    EXPECT_EQ(closeFailed.error().message,
-              "fts_close failed for " + top_.string() + " with error Bad file descriptor");
+    EXPECT_TRUE(
+        failedWith(manager_._traverseDirectory(top_, count), EBADF,
+                   "fts_close failed for " + top_.string() + " with error Bad file descriptor"));
 }
 
 TEST_F(TraverseListTest, MountPointsOfOtherFileSystemsAreNotEntered) {
@@ -163,22 +155,14 @@ TEST_F(TraverseListTest, ListingSkipsDotNamesAndMarksDirectoriesButNotLinksToThe
 
 TEST_F(TraverseListTest, ListingFailuresAreLoggedUnlessTheDirectoryIsMissing) {
     LogCapture log;
-    auto missing = manager_.urlsForItemsInDirectoryAtURL(top_ / "missing");
-    ASSERT_FALSE(missing);
-    EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
-    EXPECT_EQ(missing.error().message, "_IterateDirectory for " + (top_ / "missing").string() +
-                                           " returned No such file or directory");
+    EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_ / "missing"), ENOENT,
+                           "_IterateDirectory for " + (top_ / "missing").string() +
+                               " returned No such file or directory"));
     EXPECT_FALSE(log.contains("opendir of"));
-
-    auto file = manager_.urlsForItemsInDirectoryAtURL(top_ / "f");
-    ASSERT_FALSE(file);
-    EXPECT_TRUE(file.error().isPOSIX(ENOTDIR));
+    EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_ / "f"), ENOTDIR));
     EXPECT_TRUE(log.contains("opendir of " + (top_ / "f").string() + " failed: Not a directory"));
-
     env_->failCall(EnvCall::ReadDir, 2, EIO);
-    auto broken = manager_.urlsForItemsInDirectoryAtURL(top_);
-    ASSERT_FALSE(broken);
-    EXPECT_TRUE(broken.error().isPOSIX(EIO));
+    EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_), EIO));
 }
 
 TEST_F(TraverseListTest, DirectoryStructureNamesFilesWithoutAnOwnerAccount) {
