@@ -1,51 +1,47 @@
 #include "Daemon/support/PropertyList.h"
+#include "Daemon/support/ProtectionClassAttribute.h"
 
 #include <gtest/gtest.h>
 
-#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
 #include <limits>
+#include <optional>
 #include <random>
+#include <set>
 
 using namespace quarn;
+namespace fs = std::filesystem;
 
 namespace {
 
 using Bytes = std::vector<std::uint8_t>;
 constexpr std::int64_t k2001 = 978307200LL * 1000000; // microseconds from 1970 to 2001
 
-Value roundTrip(const Value& v) {
-    auto bytes = binaryPropertyList(v);
-    EXPECT_TRUE(bytes) << bytes.error().message;
-    auto back = valueFromPropertyListBytes(*bytes);
-    EXPECT_TRUE(back) << back.error().message;
-    return back.value_or(Value());
+Bytes bytesOf(std::string_view text) {
+    return Bytes(text.begin(), text.end());
 }
 
-Result<Value> parse(std::string_view text) {
-    return valueFromPropertyListBytes(
-        std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()));
-}
-
-// A binary list from encoded objects, with one-byte offsets and two-byte
-// references, for shapes no writer produces.
-Bytes binaryFrom(const std::vector<Bytes>& objects, std::uint64_t top = 0) {
-    Bytes b = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
+// A binary list from encoded objects, with two-byte offsets and references,
+// for shapes no writer produces.
+Bytes binaryFrom(const std::vector<Bytes>& objects) {
+    Bytes b = bytesOf("bplist00");
     std::vector<std::size_t> offsets;
     for (const auto& o : objects) {
         offsets.push_back(b.size());
         b.insert(b.end(), o.begin(), o.end());
     }
     std::size_t table = b.size();
-    for (auto o : offsets) {
-        b.push_back(static_cast<std::uint8_t>(o >> 8));
-        b.push_back(static_cast<std::uint8_t>(o));
-    }
+    for (auto o : offsets)
+        b.insert(b.end(), {static_cast<std::uint8_t>(o >> 8), static_cast<std::uint8_t>(o)});
     Bytes trailer(32, 0);
-    trailer[6] = 2; // offset size
-    trailer[7] = 2; // reference size
+    trailer[6] = trailer[7] = 2; // offset and reference sizes; the top object is 0
     for (int i = 0; i < 8; ++i) {
         trailer[15 - i] = static_cast<std::uint8_t>(objects.size() >> (8 * i));
-        trailer[23 - i] = static_cast<std::uint8_t>(top >> (8 * i));
         trailer[31 - i] = static_cast<std::uint8_t>(table >> (8 * i));
     }
     b.insert(b.end(), trailer.begin(), trailer.end());
@@ -54,15 +50,9 @@ Bytes binaryFrom(const std::vector<Bytes>& objects, std::uint64_t top = 0) {
 
 Bytes arrayOf(std::vector<std::uint16_t> refs) {
     Bytes o = {static_cast<std::uint8_t>(0xA0 | refs.size())};
-    for (auto r : refs) {
-        o.push_back(static_cast<std::uint8_t>(r >> 8));
-        o.push_back(static_cast<std::uint8_t>(r));
-    }
+    for (auto r : refs)
+        o.insert(o.end(), {static_cast<std::uint8_t>(r >> 8), static_cast<std::uint8_t>(r)});
     return o;
-}
-
-std::string messageOf(const Result<Value>& r) {
-    return r ? "" : r.error().message;
 }
 
 } // namespace
@@ -88,35 +78,32 @@ TEST(PropertyList, EveryTypeRoundTripsThroughTheBinaryForm) {
     };
     Value expected = v;
     expected.set("uuid", uuid.string()); // no property-list type: its canonical string
-    Value back = roundTrip(v);
+    auto bytes = binaryPropertyList(v);
+    ASSERT_TRUE(bytes) << bytes.error().message;
+    Value back = valueFromPropertyListBytes(*bytes).value_or(Value());
     EXPECT_EQ(back, expected) << back.description();
-
-    // Signedness survives, not just the bits.
-    const auto& u = *back.get("unsigned")->asArray();
-    EXPECT_EQ(u[5].asUInt64(), UINT64_MAX);
-    EXPECT_EQ(u[4].asUInt64(), 1ull << 63);
-    const auto& s = *back.get("signed")->asArray();
-    EXPECT_EQ(s[0].asInt64(), -1);
-    EXPECT_EQ(s[2].asInt64(), std::numeric_limits<std::int64_t>::min());
+    // Signedness survives, not just the bits (equality does not tell).
+    EXPECT_EQ(back.get("unsigned")->asArray()->at(5).asUInt64(), UINT64_MAX);
+    EXPECT_EQ(back.get("signed")->asArray()->at(2).asInt64(),
+              std::numeric_limits<std::int64_t>::min());
 }
 
 TEST(PropertyList, IntegersUseTheFormatsSignedAndUnsignedEncodings) {
     // Other readers take an 8-byte integer as signed and a 16-byte one as
-    // unsigned: check the encoding itself.
-    auto minusOne = *binaryPropertyList(Value(-1));
-    Bytes eightFF(8, 0xFF);
-    ASSERT_GE(minusOne.size(), 17u);
-    EXPECT_EQ(minusOne[8], 0x13);
-    EXPECT_TRUE(std::equal(eightFF.begin(), eightFF.end(), minusOne.begin() + 9));
-    auto max = *binaryPropertyList(Value(UINT64_MAX));
-    ASSERT_GE(max.size(), 25u);
-    EXPECT_EQ(max[8], 0x14);
-    EXPECT_TRUE(std::all_of(max.begin() + 9, max.begin() + 17, [](auto b) { return b == 0; }));
-    EXPECT_TRUE(std::equal(eightFF.begin(), eightFF.end(), max.begin() + 17));
+    // unsigned: check the encoding itself (the object after the header).
+    auto object = [](const Value& v, std::size_t size) {
+        auto bytes = *binaryPropertyList(v);
+        return Bytes(bytes.begin() + 8, bytes.begin() + 8 + size);
+    };
+    Bytes minusOne = {0x13}, max = {0x14, 0, 0, 0, 0, 0, 0, 0, 0};
+    minusOne.resize(9, 0xFF);
+    max.resize(17, 0xFF);
+    EXPECT_EQ(object(Value(-1), 9), minusOne);
+    EXPECT_EQ(object(Value(UINT64_MAX), 17), max);
 }
 
 TEST(PropertyList, ReadsXML) {
-    auto v = parse(R"(<?xml version="1.0" encoding="UTF-8"?>
+    auto v = valueFromPropertyListBytes(bytesOf(R"(<?xml version="1.0" encoding="UTF-8"?>
 <!DOCTYPE plist PUBLIC "-//Apple//DTD PLIST 1.0//EN" "http://www.apple.com/DTDs/PropertyList-1.0.dtd">
 <plist version="1.0"><dict>
   <key>negative</key><integer>-3</integer>
@@ -128,23 +115,24 @@ TEST(PropertyList, ReadsXML) {
   <key>date</key><date>2000-06-01T12:00:00Z</date>
   <!-- <array> in a comment is not an element -->
   <key>list</key><array><integer>1</integer><dict/></array>
-</dict></plist>)");
+</dict></plist>)"));
     ASSERT_TRUE(v) << v.error().message;
     EXPECT_EQ(v->get("negative")->asInt64(), -3);
     EXPECT_EQ(v->get("big")->asUInt64(), UINT64_MAX);
-    EXPECT_EQ(*v->get("real"), Value(2.5));
-    EXPECT_EQ(*v->get("yes"), Value(true));
-    EXPECT_EQ(*v->get("text"), Value("a & b"));
-    EXPECT_EQ(*v->get("data"), Value(Value::Data{0, 1, 2}));
-    EXPECT_EQ(v->get("date")->asDate(), Date{959860800LL * 1000000});
-    EXPECT_EQ(*v->get("list"), Value(Value::Array{1u, Value::dictionary()}));
+    EXPECT_EQ(*v, Value(Value::Dictionary{{"negative", -3},
+                                          {"big", UINT64_MAX},
+                                          {"real", 2.5},
+                                          {"yes", true},
+                                          {"text", "a & b"},
+                                          {"data", Value::Data{0, 1, 2}},
+                                          {"date", Date{959860800LL * 1000000}},
+                                          {"list", Value::Array{1u, Value::dictionary()}}}));
 }
 
 TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
     Value deep = 1u;
-    for (int i = 0; i < 300; ++i) {
+    for (int i = 0; i < 300; ++i)
         deep = Value::Array{deep};
-    }
     for (const Value& bad : {Value(), Value(std::string("a\0b", 3)),
                              Value(Value::Dictionary{{std::string("k\0", 2), 1u}}),
                              Value(Date{k2001 - 70LL * 365 * 86400 * 1000000}),
@@ -157,43 +145,27 @@ TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
     }
 }
 
-TEST(PropertyList, HostileBytesGiveErrorsNotCrashes) {
+TEST(PropertyList, TruncatedOrCorruptBytesGiveErrorsNotCrashes) {
     auto good = *binaryPropertyList(Value::Dictionary{
         {"a", Value::Array{1u, "two", 3.0, Date{k2001}}}, {"b", Value::Data{1, 2, 3}}});
-    // Every truncation of a valid list.
-    for (std::size_t n = 0; n < good.size(); ++n) {
+    for (std::size_t n = 0; n < good.size(); ++n)
         EXPECT_FALSE(valueFromPropertyListBytes(std::span(good.data(), n))) << n;
-    }
     // Random corruption of binary and XML lists: any outcome but a crash.
-    auto xmlText =
-        std::string("<plist><dict><key>a</key><array><integer>1</integer>"
-                    "<string>x</string><date>2001-01-01T00:00:00Z</date><data>AA==</data>"
-                    "</array></dict></plist>");
-    Bytes xml(xmlText.begin(), xmlText.end());
+    auto xml = bytesOf("<plist><dict><key>a</key><array><integer>1</integer>"
+                       "<string>x</string><date>2001-01-01T00:00:00Z</date><data>AA==</data>"
+                       "</array></dict></plist>");
     std::mt19937 random(1234);
     for (const Bytes& base : {good, xml}) {
         for (int i = 0; i < 3000; ++i) {
             Bytes b = base;
-            for (int j = 0; j < 1 + static_cast<int>(random() % 4); ++j) {
+            for (int j = 0; j < 1 + static_cast<int>(random() % 4); ++j)
                 b[random() % b.size()] = static_cast<std::uint8_t>(random());
-            }
             (void)valueFromPropertyListBytes(b);
         }
     }
-    for (std::string_view junk : {"", "bplist00", "<plist>", "not a plist at all", "<plist><"}) {
-        auto r = parse(junk);
-        ASSERT_FALSE(r) << junk;
-        EXPECT_EQ(r.error().code, kGeneralErrorPropertyListReadCorrupt);
-    }
 }
 
-TEST(PropertyList, RefusesShapesThatWouldExhaustTheParser) {
-    auto refusal = [](const Bytes& bytes) { return messageOf(valueFromPropertyListBytes(bytes)); };
-    std::string deepXML = "<plist>";
-    for (int i = 0; i < 100000; ++i)
-        deepXML += "<array>";
-    EXPECT_NE(messageOf(parse(deepXML)).find("nested too deeply"), std::string::npos);
-
+TEST(PropertyList, RefusesHostileBytesWithTheReason) {
     auto chain = [](std::uint16_t levels) {
         std::vector<Bytes> objects;
         for (std::uint16_t i = 1; i < levels; ++i)
@@ -201,17 +173,173 @@ TEST(PropertyList, RefusesShapesThatWouldExhaustTheParser) {
         objects.push_back({0x10, 0x05});
         return binaryFrom(objects);
     };
-    EXPECT_NE(refusal(chain(5000)).find("nested too deeply"), std::string::npos);
     EXPECT_TRUE(valueFromPropertyListBytes(chain(100)));
-
     // Each level refers twice to the next: 2^40 nodes once expanded.
     std::vector<Bytes> laughs;
     for (std::uint16_t i = 1; i <= 40; ++i)
         laughs.push_back(arrayOf({i, i}));
     laughs.push_back({0x10, 0x01});
-    EXPECT_NE(refusal(binaryFrom(laughs)).find("too many objects"), std::string::npos);
-    EXPECT_NE(refusal(binaryFrom({arrayOf({0})})).find("cycle"), std::string::npos);
-    EXPECT_NE(refusal(binaryFrom({arrayOf({7})})).find("outside"), std::string::npos);
-    // A keyed-archive UID means nothing outside its archive.
-    EXPECT_FALSE(valueFromPropertyListBytes(binaryFrom({arrayOf({1}), {0x80, 0x01}})));
+    std::string deepXML = "<plist>";
+    for (int i = 0; i < 100000; ++i)
+        deepXML += "<array>";
+    const std::pair<Bytes, const char*> refusals[] = {
+        {bytesOf(deepXML), "nested too deeply"},
+        {chain(5000), "nested too deeply"},
+        {binaryFrom(laughs), "too many objects"},
+        {binaryFrom({arrayOf({0})}), "cycle"},
+        {binaryFrom({arrayOf({7})}), "outside"},
+        // A keyed-archive UID means nothing outside its archive.
+        {binaryFrom({arrayOf({1}), {0x80, 0x01}}), "Unsupported property-list node type"},
+        {bytesOf(""), "no data"},
+        {bytesOf("bplist00"), "correct format"},
+        {bytesOf("<plist>"), "correct format"},
+        {bytesOf("not a plist at all"), "correct format"},
+        {bytesOf("<plist><"), "correct format"},
+    };
+    for (const auto& [bytes, message] : refusals) {
+        auto r = valueFromPropertyListBytes(bytes);
+        ASSERT_FALSE(r) << message;
+        EXPECT_EQ(r.error().code, kGeneralErrorPropertyListReadCorrupt);
+        EXPECT_NE(r.error().message.find(message), std::string::npos) << r.error().message;
+    }
+}
+
+namespace {
+
+class PropertyListFileTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::string tmpl = (fs::temp_directory_path() / "quarn-plist.XXXXXX").string();
+        ASSERT_NE(mkdtemp(tmpl.data()), nullptr);
+        dir_ = tmpl;
+    }
+    void TearDown() override { fs::remove_all(dir_); }
+
+    std::set<std::string> entries() const {
+        std::set<std::string> names;
+        for (const auto& e : fs::directory_iterator(dir_))
+            names.insert(e.path().filename().string());
+        return names;
+    }
+    std::string contents(const fs::path& p) const {
+        std::ifstream in(p, std::ios::binary);
+        return std::string(std::istreambuf_iterator<char>(in), {});
+    }
+    void write(const fs::path& p, std::string_view text) const {
+        std::ofstream(p, std::ios::binary) << text;
+    }
+    static int protectionClassOf(const fs::path& p) {
+        int fd = open(p.c_str(), O_RDONLY | O_CLOEXEC);
+        int cls = ProtectionClassAttribute::getProtectionClass(fd).value_or(-1);
+        close(fd);
+        return cls;
+    }
+
+    fs::path dir_;
+    Value dict_ = Value::Dictionary{{"QRNMetadataVersion", "2"}, {"Class", 2u}};
+};
+
+} // namespace
+
+TEST_F(PropertyListFileTest, WritesReplaceTheFileAndLeaveNothingBehind) {
+    // Each over an older, longer file (in place: truncated); a class only when asked.
+    using P = ProtectionClassAttribute;
+    const std::tuple<const char*, WriteOptions, int> writes[] = {
+        {"atomic", {.atomic = true, .lowestProtection = true, .fsync = true}, P::kLowestClass},
+        {"inPlace", {.lowestProtection = true}, P::kLowestClass},
+        {"plain", {}, P::kNoClass}};
+    for (const auto& [name, options, protectionClass] : writes) {
+        SCOPED_TRACE(name);
+        write(dir_ / name, std::string(10000, 'x'));
+        ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / name, options));
+        EXPECT_EQ(contents(dir_ / name).substr(0, 8), "bplist00");
+        EXPECT_EQ(protectionClassOf(dir_ / name), protectionClass);
+        EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / name).value_or(Value()), dict_);
+    }
+    EXPECT_EQ(entries(), (std::set<std::string>{"atomic", "inPlace", "plain"}));
+}
+
+TEST_F(PropertyListFileTest, FailedWritesLeaveTheOldFileAlone) {
+    fs::path file = dir_ / "keep.plist";
+    write(file, "old");
+    Value unwritable = Value::Dictionary{{"bad", std::string("a\0b", 3)}};
+    for (bool atomic : {false, true}) {
+        auto r = QRN_writeToURL(unwritable, file, {.atomic = atomic});
+        ASSERT_FALSE(r);
+        EXPECT_EQ(r.error().code, kGeneralErrorPropertyListWriteInvalid);
+        EXPECT_FALSE(QRN_writeToURL(Value::Array{1u}, file, {.atomic = atomic}));
+        EXPECT_EQ(contents(file), "old");
+        // A missing directory is a POSIX error either way.
+        auto missing = QRN_writeToURL(dict_, dir_ / "nowhere" / "f.plist", {.atomic = atomic});
+        ASSERT_FALSE(missing);
+        EXPECT_TRUE(missing.error().isPOSIX(ENOENT)) << missing.error().message;
+    }
+    // The rename fails onto a directory: the temporary file goes away.
+    fs::create_directories(dir_ / "occupied" / "child");
+    auto r = QRN_writeToURL(dict_, dir_ / "occupied", {.atomic = true});
+    ASSERT_FALSE(r);
+    EXPECT_EQ(r.error().domain, Error::Domain::POSIX);
+    EXPECT_EQ(entries(), (std::set<std::string>{"keep.plist", "occupied"}));
+}
+
+// The Value reader and the tree reader refuse the same files with the same
+// error, and read the others to the same dictionary.
+TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
+    ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / "real"));
+    fs::create_symlink(dir_ / "real", dir_ / "link");
+    ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0); // must not block
+    write(dir_ / "huge", "");                            // refused by size, before anything is read
+    fs::resize_file(dir_ / "huge", kMaxPropertyListFileSize + 1);
+    // A keyed-archive UID nested in an array of the dictionary {"A": [UID 1]}.
+    Bytes uid = binaryFrom({{0xD1, 0, 1, 0, 2}, {0x51, 'A'}, arrayOf({3}), {0x80, 0x01}});
+    using enum Error::Domain;
+    const std::tuple<const char*, std::optional<std::string>, Error::Domain, std::int64_t>
+        refusals[] = {
+            {"missing", {}, POSIX, ENOENT},
+            {".", {}, POSIX, EISDIR},
+            {"link", {}, POSIX, ELOOP},
+            {"fifo", {}, POSIX, EINVAL},
+            {"huge", {}, POSIX, EFBIG},
+            {"array", "<plist><array><integer>1</integer></array></plist>", General,
+             kGeneralErrorFileReadCorrupt},
+            {"empty", "", General, kGeneralErrorPropertyListReadCorrupt},
+            {"garbage", "garbage", General, kGeneralErrorPropertyListReadCorrupt},
+            {"junk", "bplist00garbage", General, kGeneralErrorPropertyListReadCorrupt},
+            {"uid", std::string(uid.begin(), uid.end()), General,
+             kGeneralErrorPropertyListReadCorrupt},
+        };
+    for (const auto& [name, text, domain, code] : refusals) {
+        SCOPED_TRACE(name);
+        if (text)
+            write(dir_ / name, *text);
+        auto value = QRN_dictionaryWithContentsOfURL(dir_ / name);
+        auto tree = QRN_dictionaryNodeWithContentsOfFile((dir_ / name).native());
+        ASSERT_FALSE(value);
+        ASSERT_FALSE(tree);
+        EXPECT_EQ(value.error().domain, domain);
+        EXPECT_EQ(value.error().code, code) << value.error().message;
+        EXPECT_EQ(tree.error().domain, domain);
+        EXPECT_EQ(tree.error().code, code);
+        EXPECT_EQ(tree.error().message, value.error().message);
+    }
+    write(dir_ / "xml", "<plist><dict><key>Class</key><integer>2</integer>"
+                        "<key>QRNMetadataVersion</key><string>2</string></dict></plist>");
+    write(dir_ / "dated", "<plist><dict><key>When</key><date>2020-01-01T00:00:00Z</date>"
+                          "</dict></plist>");
+    EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / "xml").value_or(Value()), dict_);
+    for (const char* name : {"real", "xml", "dated"}) {
+        SCOPED_TRACE(name);
+        auto value = QRN_dictionaryWithContentsOfURL(dir_ / name);
+        auto tree = QRN_dictionaryNodeWithContentsOfFile((dir_ / name).native());
+        ASSERT_TRUE(value && tree);
+        EXPECT_TRUE(checkPropertyList(tree->get()));
+        EXPECT_EQ(valueFromPropertyList(tree->get()).value_or(Value()), *value);
+    }
+}
+
+TEST(PropertyListPaths, DotDotOnlyAsAWholeComponent) {
+    for (auto p : {"..", "../a", "/a/../b", "a/..", "a//../b", "/.."})
+        EXPECT_TRUE(containsDotDotPathComponents(p)) << p;
+    for (auto p : {"", ".", "/", "a..b", "...", "a/.../b", "..a", "a..", "/a/b/", "./a"})
+        EXPECT_FALSE(containsDotDotPathComponents(p)) << p;
 }

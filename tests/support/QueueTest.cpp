@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <functional>
@@ -31,15 +32,16 @@ struct Gate {
 
 // Counts concurrently running blocks and remembers the peak.
 struct Occupancy {
-    std::atomic<int> now{0};
-    std::atomic<int> peak{0};
+    std::mutex mutex;
+    int now = 0, peak = 0;
     void enter() {
-        int n = ++now;
-        int p = peak.load();
-        while (n > p && !peak.compare_exchange_weak(p, n)) {
-        }
+        std::lock_guard guard(mutex);
+        peak = std::max(peak, ++now);
     }
-    void leave() { --now; }
+    void leave() {
+        std::lock_guard guard(mutex);
+        --now;
+    }
 };
 
 } // namespace
@@ -48,38 +50,29 @@ TEST(Queue, SerialKeepsEachProducersOrderAndRunsOneAtATime) {
     constexpr int kProducers = 8, kEach = 500;
     Queue q("serial");
     Occupancy occupancy;
-    std::vector<std::pair<int, int>> seen; // touched only on the queue
-    std::vector<std::thread> producers;
-    for (int p = 0; p < kProducers; ++p) {
+    std::vector<int> next(kProducers, 0); // touched only on the queue
+    std::atomic<int> reordered{0};
+    std::vector<std::jthread> producers;
+    for (int p = 0; p < kProducers; ++p)
         producers.emplace_back([&, p] {
-            for (int i = 0; i < kEach; ++i) {
+            for (int i = 0; i < kEach; ++i)
                 q.async([&, p, i] {
                     occupancy.enter();
-                    seen.emplace_back(p, i);
+                    reordered += next[p]++ != i;
                     occupancy.leave();
                 });
-            }
         });
-    }
-    for (auto& t : producers) {
-        t.join();
-    }
-    auto copy = q.sync([&] { return seen; });
-    ASSERT_EQ(copy.size(), std::size_t(kProducers * kEach));
-    std::vector<int> next(kProducers, 0);
-    for (auto [p, i] : copy) {
-        ASSERT_EQ(i, next[p]) << "producer " << p << " reordered";
-        ++next[p];
-    }
-    EXPECT_EQ(occupancy.peak.load(), 1);
+    producers.clear(); // joins
+    EXPECT_EQ(q.sync([&] { return next; }), std::vector<int>(kProducers, kEach));
+    EXPECT_EQ(reordered.load(), 0);
+    EXPECT_EQ(occupancy.peak, 1);
 }
 
 TEST(Queue, SyncSeesEarlierAsyncWorkAndReturnsOrThrows) {
     Queue q("sync");
     int value = 0;
-    for (int i = 0; i < 100; ++i) {
+    for (int i = 0; i < 100; ++i)
         q.async([&] { ++value; });
-    }
     EXPECT_EQ(q.sync([&] { return value; }), 100);
     EXPECT_THROW(q.sync([]() -> int { throw std::runtime_error("boom"); }), std::runtime_error);
     // The queue still works after a block threw through sync.
@@ -89,8 +82,6 @@ TEST(Queue, SyncSeesEarlierAsyncWorkAndReturnsOrThrows) {
 TEST(Queue, SyncFromAnotherQueueAndFromPlainThreads) {
     Queue a(Queue::ownerLabel("a")), b(Queue::ownerLabel("b"));
     EXPECT_EQ(a.label(), "com.orvex.quarnd.a");
-    EXPECT_FALSE(a.isCurrent());
-    std::atomic<int> sum{0};
     bool aCurrentInside = false, bCurrentInside = false, bCurrentAfter = true;
     a.sync([&] {
         b.sync([&] {
@@ -99,30 +90,20 @@ TEST(Queue, SyncFromAnotherQueueAndFromPlainThreads) {
         });
         bCurrentAfter = b.isCurrent();
     });
-    EXPECT_TRUE(aCurrentInside);
-    EXPECT_TRUE(bCurrentInside);
-    EXPECT_FALSE(bCurrentAfter);
-    EXPECT_FALSE(a.isCurrent());
-    Gate done;
-    std::atomic<bool> onWorker{false};
-    a.async([&] {
-        onWorker = a.isCurrent() && !b.isCurrent();
-        done.open();
-    });
-    ASSERT_TRUE(done.wait());
-    EXPECT_TRUE(onWorker);
+    EXPECT_TRUE(aCurrentInside && bCurrentInside);
+    EXPECT_FALSE(bCurrentAfter || a.isCurrent());
+    std::promise<bool> onWorker;
+    a.async([&] { onWorker.set_value(a.isCurrent() && !b.isCurrent()); });
+    EXPECT_TRUE(onWorker.get_future().get());
 
-    std::vector<std::thread> threads;
-    for (int t = 0; t < 4; ++t) {
+    std::atomic<int> sum{0};
+    std::vector<std::jthread> threads;
+    for (int t = 0; t < 4; ++t)
         threads.emplace_back([&] {
-            for (int i = 0; i < 50; ++i) {
+            for (int i = 0; i < 50; ++i)
                 a.sync([&] { sum += b.sync([] { return 1; }); });
-            }
         });
-    }
-    for (auto& t : threads) {
-        t.join();
-    }
+    threads.clear(); // joins
     EXPECT_EQ(sum.load(), 200);
 }
 
@@ -133,54 +114,45 @@ TEST(Queue, ConcurrentRunsUpToWidthAtOnce) {
     // Each of the first kWidth blocks waits for all of them: this only
     // finishes when they really run at the same time.
     std::latch together(kWidth);
-    for (int i = 0; i < kWidth; ++i) {
+    for (int i = 0; i < kWidth; ++i)
         q.async([&] { together.arrive_and_wait(); });
-    }
     Occupancy occupancy;
-    for (int i = 0; i < 10 * kWidth; ++i) {
+    for (int i = 0; i < 10 * kWidth; ++i)
         q.async([&] {
             occupancy.enter();
             std::this_thread::yield();
             occupancy.leave();
         });
-    }
     q.barrierSync([] {});
-    EXPECT_LE(occupancy.peak.load(), kWidth);
+    EXPECT_LE(occupancy.peak, kWidth);
 }
 
 TEST(Queue, BarrierWaitsForEarlierRunsAloneAndHoldsLater) {
-    constexpr int kEarlier = 3, kLater = 3;
     Queue q("barrier", Queue::Kind::Concurrent, 4);
     Gate release;
-    std::latch earlierRunning(kEarlier);
-    std::atomic<int> earlierDone{0}, laterStarted{0};
-    std::atomic<bool> barrierDone{false}, violation{false};
-    for (int i = 0; i < kEarlier; ++i) {
+    std::latch earlierRunning(3);
+    std::atomic<int> earlierDone{0}, laterStarted{0}, violations{0};
+    std::atomic<bool> barrierDone{false};
+    for (int i = 0; i < 3; ++i)
         q.async([&] {
             earlierRunning.count_down();
             release.wait();
             ++earlierDone;
         });
-    }
     earlierRunning.wait();
     q.barrierAsync([&] {
-        if (earlierDone != kEarlier || laterStarted != 0) {
-            violation = true;
-        }
+        violations += earlierDone != 3 || laterStarted != 0;
         barrierDone = true;
     });
-    for (int i = 0; i < kLater; ++i) {
+    for (int i = 0; i < 3; ++i)
         q.async([&] {
             ++laterStarted;
-            if (!barrierDone) {
-                violation = true;
-            }
+            violations += !barrierDone;
         });
-    }
     release.open();
     q.barrierSync([] {});
-    EXPECT_FALSE(violation);
-    EXPECT_EQ(laterStarted.load(), kLater);
+    EXPECT_EQ(violations.load(), 0);
+    EXPECT_EQ(laterStarted.load(), 3);
 }
 
 TEST(Queue, SuspendHoldsWorkQueuedBeforeAndAfterAndNests) {
@@ -215,42 +187,36 @@ TEST(Queue, SuspendFromInsideLetsTheRunningBlockFinish) {
     EXPECT_FALSE(secondRan);
     q.resume();
     q.sync([] {});
-    EXPECT_TRUE(firstFinished);
-    EXPECT_TRUE(secondRan);
+    EXPECT_TRUE(firstFinished && secondRan);
 }
 
-TEST(Queue, DestructionRunsPendingWork) {
-    auto owner = std::make_unique<Queue>("drain");
-    Queue* q = owner.get(); // blocks use it while the destructor drains
-    Gate release;
-    std::atomic<int> ran{0};
-    q->async([&] { release.wait(); });
-    for (int i = 0; i < 100; ++i) {
-        q->async([&, i] {
-            ++ran;
-            if (i == 0) {
-                q->async([&] { ++ran; }); // queued while draining
+// Destruction waits for what is queued, even what is queued while draining,
+// behind a block still running; a suspended queue discards (and frees) it.
+TEST(Queue, DestructionRunsQueuedWorkUnlessSuspended) {
+    for (auto kind : {Queue::Kind::Serial, Queue::Kind::Concurrent, Queue::Kind::Manual})
+        for (bool suspended : {false, true}) {
+            SCOPED_TRACE(testing::Message() << "kind " << int(kind) << " suspended " << suspended);
+            auto owned = std::make_shared<int>(7);
+            std::atomic<int> ran{0};
+            Gate release;
+            std::jthread releaser;
+            {
+                Queue q("drain", kind, 2);
+                if (suspended)
+                    q.suspend();
+                q.async([&] { release.wait(); });
+                for (int i = 0; i < 100; ++i)
+                    q.async([&, i, owned] {
+                        ++ran;
+                        if (i == 0)
+                            q.async([&] { ++ran; }); // queued while draining
+                    });
+                q.barrierAsync([&ran, owned] { ++ran; });
+                releaser = std::jthread([&] { release.open(); });
             }
-        });
-    }
-    std::thread releaser([&] { release.open(); });
-    owner.reset();
-    releaser.join();
-    EXPECT_EQ(ran.load(), 101);
-}
-
-TEST(Queue, DestroyingASuspendedQueueDiscardsAndFreesHeldBlocks) {
-    auto owned = std::make_shared<int>(7);
-    bool ran = false;
-    {
-        Queue q("held", Queue::Kind::Concurrent, 2);
-        q.suspend();
-        q.async([&ran, owned] { ran = true; });
-        q.barrierAsync([owned] {});
-        EXPECT_EQ(owned.use_count(), 3);
-    }
-    EXPECT_FALSE(ran);
-    EXPECT_EQ(owned.use_count(), 1);
+            EXPECT_EQ(ran.load(), suspended ? 0 : 102);
+            EXPECT_EQ(owned.use_count(), 1);
+        }
 }
 
 TEST(Queue, ManualQueueRunsOnTheDrivingThread) {
@@ -258,35 +224,15 @@ TEST(Queue, ManualQueueRunsOnTheDrivingThread) {
     auto driver = std::this_thread::get_id();
     bool stop = false;
     std::atomic<int> onDriver{0};
-    std::thread other([&] {
-        for (int i = 0; i < 10; ++i) {
+    std::jthread other([&] {
+        for (int i = 0; i < 10; ++i)
             main.async([&] { onDriver += std::this_thread::get_id() == driver; });
-        }
-        EXPECT_EQ(main.sync([&] { return main.isCurrent(); }), true);
+        EXPECT_TRUE(main.sync([&] { return main.isCurrent(); }));
         main.async([&] { stop = true; });
     });
     main.runUntil([&] { return stop; });
     other.join();
     EXPECT_EQ(onDriver.load(), 10);
-
-    int late = 0;
-    {
-        Queue lastly("lastly", Queue::Kind::Manual);
-        lastly.async([&] { ++late; });
-    }
-    EXPECT_EQ(late, 1) << "destroying a manual queue runs what it holds";
-}
-
-TEST(Queue, BlocksOwnMoveOnlyCapturesUntilTheyFinish) {
-    Queue q("owner");
-    auto box = std::make_unique<int>(41);
-    int seen = 0;
-    q.async(
-        [&seen, box = std::move(box), t = ProcessTransaction("queued work")] { seen = *box + 1; });
-    q.sync([] {});
-    EXPECT_EQ(seen, 42);
-    // The block's transaction ended before the next block started.
-    EXPECT_EQ(ProcessTransaction::count(), 0u);
 }
 
 TEST(QueueDeathTest, MisuseStopsTheProcess) {
@@ -325,11 +271,10 @@ TEST(QueueDeathTest, MisuseStopsTheProcess) {
             message);
 }
 
-TEST(ProcessTransaction, CountsOpenTransactionsOnce) {
-    ASSERT_EQ(ProcessTransaction::count(), 0u);
+TEST(ProcessTransaction, CountsOpenTransactionsOnceAndDrainsWithTheWorkOwningThem) {
+    ASSERT_TRUE(ProcessTransaction::waitForDrain(0ms));
     {
-        ProcessTransaction a("a");
-        ProcessTransaction b("b");
+        ProcessTransaction a("a"), b("b");
         EXPECT_EQ(ProcessTransaction::count(), 2u);
         ProcessTransaction moved(std::move(a));
         EXPECT_EQ(ProcessTransaction::count(), 2u) << "moving must not open or end one";
@@ -341,17 +286,16 @@ TEST(ProcessTransaction, CountsOpenTransactionsOnce) {
         EXPECT_EQ(ProcessTransaction::count(), 0u);
     }
     EXPECT_EQ(ProcessTransaction::count(), 0u);
-}
-
-TEST(ProcessTransaction, WaitForDrainAnswersWhetherWorkFinished) {
-    EXPECT_TRUE(ProcessTransaction::waitForDrain(0ms));
-    auto held = std::make_unique<ProcessTransaction>("held");
-    EXPECT_FALSE(ProcessTransaction::waitForDrain(0ms));
+    // A block owns its move-only captures until it finishes.
     Queue background("background");
     Gate finish;
-    background.async([&finish, t = std::move(*held)] { finish.wait(); });
-    held.reset();
-    EXPECT_EQ(ProcessTransaction::count(), 1u);
+    int seen = 0;
+    background.async([&, box = std::make_unique<int>(41), t = ProcessTransaction("held")] {
+        finish.wait();
+        seen = *box + 1;
+    });
+    EXPECT_FALSE(ProcessTransaction::waitForDrain(0ms));
     finish.open();
     EXPECT_TRUE(ProcessTransaction::waitForDrain(30s));
+    EXPECT_EQ(background.sync([&] { return seen; }), 42);
 }
