@@ -15,40 +15,9 @@ namespace quarn::test {
 
 namespace {
 
-constexpr std::string_view kEntitlementPrefix = "com.orvex.private.Quarn.";
-
-enum class Digest { None, OfProgram, Wrong };
-
-struct Definition {
-    std::string_view name;
-    Value entitlements; // none: the entry has no "Entitlements"
-    Digest digest = Digest::None;
-};
-
-std::string entitlement(std::string_view name) {
-    return std::string(kEntitlementPrefix) + std::string(name);
-}
-
 Value granting(std::string_view name, Value value) {
-    return Value(Value::Dictionary{{entitlement(name), std::move(value)}});
-}
-
-std::vector<Definition> definitions() {
-    using P = ClientPrograms;
-    const Value allowed = granting("allowed", true);
-    const Value lookup = Value(
-        Value::Dictionary{{"appData", Value(Value::Array{Value(P::identifierOf(P::kAllowed))})}});
-    return {
-        {P::kAllowed, allowed, Digest::OfProgram},
-        {P::kNone, Value(), Digest::None},
-        {P::kLookup, granting("lookup", lookup), Digest::None},
-        {P::kWipeBool, granting("wipeContainer", true), Digest::None},
-        {P::kWipeArray,
-         granting("wipeContainer", Value(Value::Array{Value(P::identifierOf(P::kWipeArray))})),
-         Digest::None},
-        {P::kTestability, granting("testability", true), Digest::None},
-        {P::kBadDigest, allowed, Digest::Wrong},
-    };
+    return Value(
+        Value::Dictionary{{"com.orvex.private.Quarn." + std::string(name), std::move(value)}});
 }
 
 std::string hexDigestOf(const std::filesystem::path& file) {
@@ -69,10 +38,6 @@ void writeEntry(const std::filesystem::path& registry, std::string_view fileName
     }
 }
 
-std::filesystem::path testBinary() {
-    return std::filesystem::read_symlink("/proc/self/exe");
-}
-
 } // namespace
 
 std::string ClientPrograms::identifierOf(std::string_view name) {
@@ -86,24 +51,36 @@ ClientPrograms::ClientPrograms(const std::filesystem::path& clientProgram,
     [[maybe_unused]] static const int sodiumReady = sodium_init();
     std::filesystem::create_directories(directory_);
     std::filesystem::create_directories(registry);
-    const std::string programDigest = hexDigestOf(clientProgram);
-    for (const Definition& definition : definitions()) {
-        install(clientProgram, definition.name);
-        Value::Dictionary entry{{"Program", pathOf(definition.name).string()},
-                                {"Identifier", identifierOf(definition.name)}};
-        if (!definition.entitlements.isNone()) {
-            entry.emplace("Entitlements", definition.entitlements);
+    const std::string digest = hexDigestOf(clientProgram), wrongDigest(64, '0');
+    const Value allowed = granting("allowed", true);
+    const Value lookup =
+        Value(Value::Dictionary{{"appData", Value::Array{identifierOf(kAllowed)}}});
+    // Name, entitlements (none: no entry) and digest (empty: no entry).
+    const std::tuple<std::string_view, Value, std::string> programs[] = {
+        {kAllowed, allowed, digest},
+        {kNone, Value(), ""},
+        {kLookup, granting("lookup", lookup), ""},
+        {kWipeBool, granting("wipeContainer", true), ""},
+        {kWipeArray, granting("wipeContainer", Value::Array{identifierOf(kWipeArray)}), ""},
+        {kTestability, granting("testability", true), ""},
+        {kBadDigest, allowed, wrongDigest},
+    };
+    for (const auto& [name, entitlements, sha256] : programs) {
+        install(clientProgram, name);
+        Value::Dictionary entry{{"Program", pathOf(name).string()},
+                                {"Identifier", identifierOf(name)}};
+        if (!entitlements.isNone()) {
+            entry.emplace("Entitlements", entitlements);
         }
-        if (definition.digest != Digest::None) {
-            entry.emplace("SHA256", definition.digest == Digest::OfProgram ? programDigest
-                                                                           : std::string(64, '0'));
+        if (!sha256.empty()) {
+            entry.emplace("SHA256", sha256);
         }
-        writeEntry(registry, definition.name, std::move(entry));
+        writeEntry(registry, name, std::move(entry));
     }
     writeEntry(registry, "test-binary",
-               {{"Program", testBinary().string()},
+               {{"Program", std::filesystem::read_symlink("/proc/self/exe").string()},
                 {"Identifier", std::string(kTestBinaryIdentifier)},
-                {"Entitlements", granting("allowed", true)}});
+                {"Entitlements", allowed}});
 }
 
 void ClientPrograms::install(const std::filesystem::path& clientProgram, std::string_view name) {

@@ -19,6 +19,9 @@ using namespace quarn;
 namespace {
 
 using Ids = std::vector<std::string>;
+constexpr std::uint64_t kData = kQRNContainerClassAppData, kGroup = kQRNContainerClassAppGroup,
+                        kSystem = kQRNContainerClassSystemData,
+                        kBundle = kQRNContainerClassAppBundle;
 
 class QRNContainerCacheTest : public quarn::test::TempRootTest {
 protected:
@@ -96,80 +99,76 @@ protected:
 // --- Building an entry from disk -------------------------------------------------------
 
 TEST_F(QRNContainerCacheTest, OnlyUUIDNamesAreContainersExceptWellKnownSystemNames) {
-    auto real = makeContainer(kQRNContainerClassAppData, "com.example.uuid");
-    makeContainer(kQRNContainerClassAppData, "com.example.named", "com.example.named");
-    makeContainer(kQRNContainerClassAppData, "com.orvex.devicesettings",
-                  "com.orvex.devicesettings");
+    auto real = makeContainer(kData, "com.example.uuid");
+    makeContainer(kData, "com.example.named", "com.example.named");
+    makeContainer(kData, "com.orvex.devicesettings", "com.orvex.devicesettings");
     // Links and files under a container's name are never taken for one.
-    std::filesystem::create_directory_symlink(
-        real->url(), classDirectory(kQRNContainerClassAppData) / UUID::random().string());
-    std::ofstream(classDirectory(kQRNContainerClassAppData) / UUID::random().string()) << "file";
-    const auto system = kQRNContainerClassSystemData;
-    makeContainer(system, "com.orvex.devicesettings", "com.orvex.devicesettings");
-    makeContainer(system, "com.orvex.unknown", "com.orvex.unknown");
-    makeContainer(system, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
+    std::filesystem::create_directory_symlink(real->url(),
+                                              classDirectory(kData) / UUID::random().string());
+    std::ofstream(classDirectory(kData) / UUID::random().string()) << "file";
+    makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
+    makeContainer(kSystem, "com.orvex.unknown", "com.orvex.unknown");
+    makeContainer(kSystem, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
     const auto group = kQRNContainerClassSystemGroup;
     makeContainer(group, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
     makeContainer(group, "systemgroup.com.orvex.uuid");
 
-    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.uuid"});
-    EXPECT_EQ(identifiersOf(system), Ids{"com.orvex.devicesettings"});
+    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.uuid"});
+    EXPECT_EQ(identifiersOf(kSystem), Ids{"com.orvex.devicesettings"});
     EXPECT_EQ(identifiersOf(group),
               (Ids{"systemgroup.com.orvex.pairing", "systemgroup.com.orvex.uuid"}));
     EXPECT_FALSE(log_.contains("INCONSISTENT")) << log_.all();
 }
 
 TEST_F(QRNContainerCacheTest, OfTwoContainersWithOneIdentifierTheOneListedLaterWins) {
-    auto first = makeContainer(kQRNContainerClassAppData, "com.example.twice");
-    auto second = makeContainer(kQRNContainerClassAppData, "com.example.twice");
+    auto first = makeContainer(kData, "com.example.twice");
+    auto second = makeContainer(kData, "com.example.twice");
     // An unchanged directory lists in the same order every time.
-    auto listed = QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(
-        classDirectory(kQRNContainerClassAppData));
+    auto listed =
+        QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(classDirectory(kData));
     ASSERT_TRUE(listed && listed->size() == 2u);
     const auto& later = listed->back().url == first->url() ? first : second;
 
-    auto found = cache().containerForContainerIdentity(
-        identity(kQRNContainerClassAppData, "com.example.twice"));
+    auto found = cache().containerForContainerIdentity(identity(kData, "com.example.twice"));
     ASSERT_TRUE(found) << log_.all();
     EXPECT_EQ((*found)->uuid(), later->uuid());
     EXPECT_EQ((*found)->url(), later->url());
 }
 
 TEST_F(QRNContainerCacheTest, ContainersWithoutValidMetadataAreReportedAndLeftOut) {
-    makeContainer(kQRNContainerClassAppData, "com.example.good");
-    const auto empty = classDirectory(kQRNContainerClassAppData) / UUID::random().string();
+    makeContainer(kData, "com.example.good");
+    const auto empty = classDirectory(kData) / UUID::random().string();
     std::filesystem::create_directories(empty);
-    auto corrupt = makeContainer(kQRNContainerClassAppData, "com.example.corrupt");
+    auto corrupt = makeContainer(kData, "com.example.corrupt");
     std::ofstream(corrupt->url() / QRNMetadata::kFileName, std::ios::trunc) << "garbage";
-    makeContainer(kQRNContainerClassAppData, "com.example.group", {}, false,
-                  kQRNContainerClassAppGroup);
+    makeContainer(kData, "com.example.group", {}, false, kGroup);
 
-    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.good"});
+    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.good"});
     EXPECT_EQ(log_.count("Cache: [501]-appData: INCONSISTENT-No Metadata at: "), 3u) << log_.all();
     EXPECT_TRUE(log_.contains(fmt::format("INCONSISTENT-No Metadata at: {} for id: {}, class: 2",
                                           empty.string(), empty.filename().string())));
 }
 
 TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsNothing) {
-    const auto dir = classDirectory(kQRNContainerClassAppData);
+    const auto dir = classDirectory(kData);
     std::filesystem::remove(dir);
     std::ofstream(dir) << "a file where the class directory belongs";
-    auto all = cache().allContainersForUserIdentity(mobile(), kQRNContainerClassAppData, false);
+    auto all = cache().allContainersForUserIdentity(mobile(), kData, false);
     ASSERT_FALSE(all);
     EXPECT_TRUE(all.error().isQRN(kQRNErrorCacheRebuildFailed));
     EXPECT_EQ(all.error().message, "Cache: [501]-appData: Failed to rebuild");
 
     std::filesystem::remove(dir);
-    makeContainer(kQRNContainerClassAppData, "com.example.back");
-    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), Ids{"com.example.back"});
+    makeContainer(kData, "com.example.back");
+    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.back"});
 }
 
 // --- Lookups --------------------------------------------------------------------------------
 
 TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
-    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
-    auto transient = makeContainer(kQRNContainerClassAppData, "com.example.app", {}, true);
-    auto id = identity(kQRNContainerClassAppData, "com.example.app");
+    auto made = makeContainer(kData, "com.example.app");
+    auto transient = makeContainer(kData, "com.example.app", {}, true);
+    auto id = identity(kData, "com.example.app");
     for (int i = 0; i < 2; ++i) {
         auto found = cache().containerForContainerIdentity(id);
         auto foundTransient = cache().containerForContainerIdentity(id, true);
@@ -180,15 +179,14 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
     EXPECT_EQ(rebuilds("[501]-appData"), 1u);
     EXPECT_EQ(rebuilds("[501]-appData(transient)"), 1u);
 
-    auto missing = cache().containerForContainerIdentity(
-        identity(kQRNContainerClassAppData, "com.example.none"), true);
+    auto missing = cache().containerForContainerIdentity(identity(kData, "com.example.none"), true);
     ASSERT_FALSE(missing);
     EXPECT_TRUE(missing.error().isQRN(kQRNErrorContainerNotFound));
     EXPECT_EQ(missing.error().message,
               "Cache: [501]-appData(transient): Container Not Found with ID: com.example.none");
     // A concrete identity names one directory, not any with its identifier.
     auto elsewhere = QRNConcreteContainerIdentity::containerIdentityWithUUID(
-        UUID::random(), mobile(), "com.example.app", kQRNContainerClassAppData);
+        UUID::random(), mobile(), "com.example.app", kData);
     EXPECT_FALSE(cache().containerForContainerIdentity(*elsewhere));
     EXPECT_TRUE(cache().containerForContainerIdentity(made->containerIdentity()));
 
@@ -206,11 +204,10 @@ TEST_F(QRNContainerCacheTest, EachFilesStoredUserIdentityIsChecked) {
     Ids expected;
     for (int i = 0; i < 4; ++i) {
         expected.push_back(fmt::format("com.example.mine{}", i));
-        makeContainer(kQRNContainerClassAppData, expected.back());
-        makeContainer(kQRNContainerClassAppData, fmt::format("com.example.theirs{}", i), {}, false,
-                      0, other);
+        makeContainer(kData, expected.back());
+        makeContainer(kData, fmt::format("com.example.theirs{}", i), {}, false, 0, other);
     }
-    EXPECT_EQ(identifiersOf(kQRNContainerClassAppData), expected);
+    EXPECT_EQ(identifiersOf(kData), expected);
     EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
 }
 
@@ -220,16 +217,16 @@ TEST_F(QRNContainerCacheTest, EachFilesStoredUserIdentityIsChecked) {
 // mapping pushed for the old record still work once only the cache holds it.
 TEST_F(QRNContainerCacheTest, AReplacedRecordKeepsItsSlotConsistent) {
     const std::string id = "com.example.replaced";
-    auto first = makeContainer(kQRNContainerClassAppData, id);
+    auto first = makeContainer(kData, id);
     ASSERT_TRUE(cache().addContainerMetadata(first, first->url(), false, true));
     const auto firstURL = first->url();
     first.reset();
-    auto second = makeContainer(kQRNContainerClassAppData, id);
+    auto second = makeContainer(kData, id);
     ASSERT_TRUE(cache().addContainerMetadata(second, second->url(), false, false));
     const auto secondURL = second->url();
     second.reset();
 
-    auto found = cache().containerForContainerIdentity(identity(kQRNContainerClassAppData, id));
+    auto found = cache().containerForContainerIdentity(identity(kData, id));
     ASSERT_TRUE(found);
     EXPECT_EQ((*found)->url(), secondURL);
     found = {};
@@ -238,8 +235,7 @@ TEST_F(QRNContainerCacheTest, AReplacedRecordKeepsItsSlotConsistent) {
     ASSERT_EQ(items.size(), 1u);
     EXPECT_EQ(items[0].path, firstURL.native());
 
-    ASSERT_TRUE(
-        cache().removeContainerForUserIdentity(mobile(), kQRNContainerClassAppData, id, false));
+    ASSERT_TRUE(cache().removeContainerForUserIdentity(mobile(), kData, id, false));
     EXPECT_TRUE(mapped(501).empty());
     EXPECT_FALSE(log_.contains("Failed to remove container mapping")) << log_.all();
 }
@@ -280,10 +276,10 @@ TEST_F(QRNContainerCacheTest, AddingAndRemovingKeepsTheSandboxMappingInStep) {
 }
 
 TEST_F(QRNContainerCacheTest, OnlyPermanentContainersAreMappedAndAnEntryOnlyOnce) {
-    auto temp = makeContainer(kQRNContainerClassAppData, "com.example.t", {}, true);
+    auto temp = makeContainer(kData, "com.example.t", {}, true);
     ASSERT_TRUE(cache().addContainerMetadata(temp, temp->url(), true, true));
-    makeContainer(kQRNContainerClassAppGroup, "group.example");
-    auto id = identity(kQRNContainerClassAppGroup, "group.example");
+    makeContainer(kGroup, "group.example");
+    auto id = identity(kGroup, "group.example");
     ASSERT_TRUE(cache().containerForContainerIdentity(id));
     EXPECT_TRUE(mapped(501).empty());
 
@@ -296,9 +292,9 @@ TEST_F(QRNContainerCacheTest, OnlyPermanentContainersAreMappedAndAnEntryOnlyOnce
 // A mapping the kernel kept while the daemon restarted answers without a
 // scan when the metadata at its path validates; otherwise the scan decides.
 TEST_F(QRNContainerCacheTest, AKernelMappingIsTrustedOnlyWhenItHoldsTheContainer) {
-    auto made = makeContainer(kQRNContainerClassAppData, "com.example.app");
-    auto impostor = makeContainer(kQRNContainerClassAppData, "com.example.impostor");
-    const auto bare = classDirectory(kQRNContainerClassAppData) / "bare";
+    auto made = makeContainer(kData, "com.example.app");
+    auto impostor = makeContainer(kData, "com.example.impostor");
+    const auto bare = classDirectory(kData) / "bare";
     std::filesystem::create_directories(bare);
     const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
         {made->url(), ""},
@@ -311,11 +307,10 @@ TEST_F(QRNContainerCacheTest, AKernelMappingIsTrustedOnlyWhenItHoldsTheContainer
         {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
                            bare.string())},
     };
-    const auto id = identity(kQRNContainerClassAppData, "com.example.app");
+    const auto id = identity(kData, "com.example.app");
     for (const auto& [path, logged] : cases) {
         SCOPED_TRACE(path);
-        sandbox().setContainerMapping(
-            501, {1, "com.example.app", kQRNContainerClassAppData, 501, path.string()});
+        sandbox().setContainerMapping(501, {1, "com.example.app", kData, 501, path.string()});
         auto found = cache().containerForContainerIdentity(id, false, false, true);
         ASSERT_TRUE(found) << log_.all();
         EXPECT_EQ((*found)->uuid(), made->uuid());
@@ -332,13 +327,11 @@ TEST_F(QRNContainerCacheTest, AKernelMappingIsTrustedOnlyWhenItHoldsTheContainer
 // --- Invalidation ----------------------------------------------------------------------------
 
 TEST_F(QRNContainerCacheTest, InvalidatingOneUserRebuildsOnlyTheGlobalEntriesForAnother) {
-    makeContainer(kQRNContainerClassAppGroup, "group.example");
-    makeContainer(kQRNContainerClassAppBundle, "com.example.bundle");
-    makeContainer(kQRNContainerClassSystemData, "com.orvex.devicesettings",
-                  "com.orvex.devicesettings");
+    makeContainer(kGroup, "group.example");
+    makeContainer(kBundle, "com.example.bundle");
+    makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
     auto lookUpAll = [&] {
-        for (std::uint64_t cls : {kQRNContainerClassAppGroup, kQRNContainerClassAppBundle,
-                                  kQRNContainerClassSystemData}) {
+        for (std::uint64_t cls : {kGroup, kBundle, kSystem}) {
             EXPECT_EQ(identifiersOf(cls).size(), 1u) << cls;
         }
     };
@@ -357,13 +350,12 @@ TEST_F(QRNContainerCacheTest, InvalidatingOneUserRebuildsOnlyTheGlobalEntriesFor
 }
 
 TEST_F(QRNContainerCacheTest, InvalidationRemovesTheUsersAndTheGlobalSandboxMappings) {
-    auto data = makeContainer(kQRNContainerClassAppData, "com.example.app");
-    auto system = makeContainer(kQRNContainerClassSystemData, "com.orvex.devicesettings",
-                                "com.orvex.devicesettings");
+    auto data = makeContainer(kData, "com.example.app");
+    auto system = makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
     for (const auto& made : {data, system}) {
         ASSERT_TRUE(cache().addContainerMetadata(made, made->url(), false, true));
     }
-    const SandboxItem theirs{1, "com.example.theirs", kQRNContainerClassAppData, 502, "/x"};
+    const SandboxItem theirs{1, "com.example.theirs", kData, 502, "/x"};
     sandbox().setContainerMapping(502, theirs);
 
     cache().invalidateUserIdentity(mobile());
@@ -382,10 +374,10 @@ TEST_F(QRNContainerCacheTest, TheUserIdentityCacheTellsTheCacheWhomItDroppedWhil
     {
         QRNContainerCache own(root_.context(),
                               root_.context().sharedInstance<QRNUserIdentityCache>());
-        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kQRNContainerClassAppData, false));
+        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kData, false));
         dropEnterprise();
         EXPECT_EQ(notificationsPosted(), 1u);
-        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kQRNContainerClassAppData, false));
+        ASSERT_TRUE(own.allContainersForUserIdentity(enterprise, kData, false));
         EXPECT_EQ(rebuilds("[persona-1]-appData"), 2u);
     }
     dropEnterprise();

@@ -15,27 +15,22 @@ using quarn::test::LogCapture;
 
 namespace {
 
-class RecordingObserver : public QRNUserIdentityCacheObserver {
-public:
+struct RecordingObserver : QRNUserIdentityCacheObserver {
     void userIdentityCache(QRNUserIdentityCache&, const QRNUserIdentityPtr& identity) override {
         std::lock_guard guard(mutex);
         ++seen[identity->identifier()];
+        ++total;
         changed.notify_all();
     }
     // Waits (bounded, generously) until `count` notifications arrived.
     bool waitFor(std::size_t count) {
         std::unique_lock guard(mutex);
-        return changed.wait_for(guard, std::chrono::seconds(30), [&] {
-            std::size_t n = 0;
-            for (const auto& [id, c] : seen) {
-                n += c;
-            }
-            return n >= count;
-        });
+        return changed.wait_for(guard, std::chrono::seconds(30), [&] { return total >= count; });
     }
-    std::mutex mutex; // guards seen
+    std::mutex mutex; // guards seen and total
     std::condition_variable changed;
     std::map<std::string, int> seen;
+    std::size_t total = 0;
 };
 
 class QRNUserIdentityCacheTest : public quarn::test::TempRootTest {
