@@ -145,9 +145,10 @@ inline void makeDeepTree(const fs::path& top, int depth) {
 }
 
 // A file manager over a fault-injecting Env (no faults until asked) in a
-// throw-away root.
+// throw-away root, with the log it writes.
 class FsTest : public TempRootTest {
 protected:
+    LogCapture log_;
     std::shared_ptr<FaultInjectingEnv> env_ =
         std::make_shared<FaultInjectingEnv>(std::make_shared<LinuxEnv>());
     QRNFileManager manager_{root_.context(), env_};

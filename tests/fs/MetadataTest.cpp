@@ -74,14 +74,13 @@ TEST_F(ACLTest, OrdinaryTreeGetsTheDirectoryListAtItsTopToo) {
 
 TEST_F(ACLTest, MissingGroupFailsWithTheACLCode) {
     root_.writeFile("/etc/group", "wheel:x:0:\n");
-    LogCapture log;
     for (bool wholeTree : {false, true}) {
         auto set = wholeTree ? manager_.standardizeACLsAtURL(container(), true)
                              : manager_.setTopLevelSystemContainerACLAtURL(container());
         ASSERT_FALSE(set) << wholeTree;
         EXPECT_TRUE(set.error().isQRN(kQRNErrorSetACLFailed)) << wholeTree;
     }
-    EXPECT_TRUE(log.contains("group lookup failed"));
+    EXPECT_TRUE(log_.contains("group lookup failed"));
     EXPECT_EQ(aclText(container()), "u::rwx,g::r-x,o::r-x") << "nothing was touched";
 }
 
@@ -90,9 +89,8 @@ TEST_F(ACLTest, AllSystemContainersOfADirectory) {
     fs::create_directories(parent / "C2" / "Library");
     EXPECT_TRUE(manager_.standardizeAllSystemContainerACLsAtURL(parent / "missing"));
 
-    LogCapture log;
     ASSERT_TRUE(manager_.standardizeAllSystemContainerACLsAtURL(parent));
-    EXPECT_TRUE(log.contains("Potential containers requiring ACL migration"));
+    EXPECT_TRUE(log_.contains("Potential containers requiring ACL migration"));
     for (auto c : {container(), parent / "C2"}) {
         EXPECT_EQ(aclText(c), kTopAccess) << c;
         EXPECT_EQ(aclText(c / "Library", ACL_TYPE_DEFAULT), kFullBelowTop) << c;
@@ -100,7 +98,7 @@ TEST_F(ACLTest, AllSystemContainersOfADirectory) {
     // Every container is tried; the call still reports the failure.
     root_.writeFile("/etc/group", "wheel:x:0:\n");
     EXPECT_FALSE(manager_.standardizeAllSystemContainerACLsAtURL(parent));
-    EXPECT_EQ(log.count("Failed to set system container ACL at"), 2u);
+    EXPECT_EQ(log_.count("Failed to set system container ACL at"), 2u);
 }
 
 struct OwnedItem {
@@ -152,19 +150,17 @@ TEST_F(OwnershipTest, OwnerAndModeAreForcedOverTheTreeChowningOnlyWhatDiffers) {
     for (auto p : {metadata(), root_ / "/outside"})
         EXPECT_EQ(describe(p), "600 0:0 -") << p;
 
-    LogCapture log;
     EXPECT_TRUE(failedWith(
         manager_.standardizeOwnershipAtURL(tree() / "missing", kMobileUID, kMobileUID), ENOENT));
-    EXPECT_TRUE(log.contains("Could not stat " + (tree() / "missing").string()));
+    EXPECT_TRUE(log_.contains("Could not stat " + (tree() / "missing").string()));
 }
 
 TEST_F(OwnershipTest, FailuresOfOneEntryDoNotStopTheRest) {
-    LogCapture log;
     env_->failCall(EnvCall::Chown, 2, EIO);
     env_->failCall(EnvCall::Chmod, 3, EIO);
     ASSERT_TRUE(manager_.standardizeOwnershipAtURL(tree(), kMobileUID, kMobileUID));
-    EXPECT_EQ(log.count("Could not chown"), 1u) << log.all();
-    EXPECT_EQ(log.count("Could not chmod"), 1u) << log.all();
+    EXPECT_EQ(log_.count("Could not chown"), 1u) << log_.all();
+    EXPECT_EQ(log_.count("Could not chmod"), 1u) << log_.all();
     int owned = lstatOf(tree() / "sub" / "link").st_uid == kMobileUID;
     for (const auto& item : kOwnedItems)
         owned += lstatOf(tree() / item.name).st_uid == kMobileUID;
@@ -212,19 +208,18 @@ TEST_F(ProtectionTest, ItemsThatCannotHoldAClassAnswerEBADF) {
     socketPath.copy(address.sun_path, socketPath.size());
     ASSERT_EQ(::bind(sock, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
 
-    LogCapture log;
     for (auto item : {dir() / "link", dir() / "fifo", dir() / "sock"}) {
         EXPECT_TRUE(failedWith(manager_.dataProtectionClassOfItemAtURL(item), EBADF)) << item;
         EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(item, 2), EBADF)) << item;
     }
     ::close(sock);
-    EXPECT_TRUE(log.contains("Failed to getclass of file " + (dir() / "link").string()));
-    EXPECT_TRUE(log.contains("Failed to setclass(2) on file " + (dir() / "fifo").string()));
+    EXPECT_TRUE(log_.contains("Failed to getclass of file " + (dir() / "link").string()));
+    EXPECT_TRUE(log_.contains("Failed to setclass(2) on file " + (dir() / "fifo").string()));
     EXPECT_EQ(classOf(file()), 0) << "the link's target was not touched";
 
     EXPECT_TRUE(
         failedWith(manager_.setDataProtectionClassOfItemAtURL(dir() / "missing", 2), ENOENT));
-    EXPECT_TRUE(log.contains("Failed to open " + (dir() / "missing").string() + " : "));
+    EXPECT_TRUE(log_.contains("Failed to open " + (dir() / "missing").string() + " : "));
 }
 
 TEST_F(ProtectionTest, ClassOneItemsCannotChangeWhileLocked) {

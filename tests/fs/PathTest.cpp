@@ -15,8 +15,6 @@ protected:
     std::optional<fs::path> check(const fs::path& p) { return manager_.realPathForURL(p, base()); }
     fs::path real(const fs::path& p) { return fs::canonical(p); }
     void link(const std::string& target, const fs::path& at) { fs::create_symlink(target, at); }
-
-    LogCapture log_;
 };
 
 TEST_F(ContainmentTest, ResolvesInsideTheBaseAndRefusesEverythingElse) {
@@ -163,14 +161,13 @@ TEST_F(CreateDirectoryTest, ExistingDirectoryIsSuccessAndStillGetsClassAndOwner)
 }
 
 TEST_F(CreateDirectoryTest, FailuresCarryTheErrnoAndTheirMessage) {
-    LogCapture log;
     const auto noParent = base() / "no" / "leaf";
     auto missingParent = manager_.createDirectoryAtURL(noParent, false, 0755);
     EXPECT_TRUE(failedWith(missingParent, ENOENT,
                            "mkdir of " + noParent.string() + " failed: No such file or directory"));
     EXPECT_NE(missingParent.error().function.find("createDirectoryAtURL"), std::string::npos);
     EXPECT_GT(missingParent.error().line, 0);
-    EXPECT_TRUE(log.contains("mkdir of " + noParent.string()));
+    EXPECT_TRUE(log_.contains("mkdir of " + noParent.string()));
 
     // A file, or a link to a directory, where a level should be: neither
     // form takes it for a directory, and nothing is given owner or class.
@@ -291,13 +288,12 @@ TEST_F(FsTest, HomeDirectoryIsTheRealPathOfTheAccountsHomeOrMobiles) {
 
     // Unknown users and missing homes fall back to mobile's.
     const auto fallback = root_ / "/private/var/mobile";
-    LogCapture log;
     EXPECT_EQ(QRNFileManager::homeDirectoryURLForPOSIXUID(601), fallback);
-    EXPECT_FALSE(log.contains("Failed to getpwuid"));
-    EXPECT_TRUE(log.contains("Failed to get home dir using getpwuid for uid: 601"));
+    EXPECT_FALSE(log_.contains("Failed to getpwuid"));
+    EXPECT_TRUE(log_.contains("Failed to get home dir using getpwuid for uid: 601"));
     EXPECT_EQ(QRNFileManager::homeDirectoryURLForPOSIXUID(4242), fallback);
-    EXPECT_TRUE(log.contains("Failed to getpwuid for uid: 4242"));
-    EXPECT_TRUE(log.contains("Failed to get home dir using getpwuid for uid: 4242"));
+    EXPECT_TRUE(log_.contains("Failed to getpwuid for uid: 4242"));
+    EXPECT_TRUE(log_.contains("Failed to get home dir using getpwuid for uid: 4242"));
 }
 
 TEST_F(FsTest, ExistenceDoesNotFollowLinks) {

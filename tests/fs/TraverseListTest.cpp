@@ -154,13 +154,12 @@ TEST_F(TraverseListTest, ListingSkipsDotNamesAndMarksDirectoriesButNotLinksToThe
 }
 
 TEST_F(TraverseListTest, ListingFailuresAreLoggedUnlessTheDirectoryIsMissing) {
-    LogCapture log;
     EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_ / "missing"), ENOENT,
                            "_IterateDirectory for " + (top_ / "missing").string() +
                                " returned No such file or directory"));
-    EXPECT_FALSE(log.contains("opendir of"));
+    EXPECT_FALSE(log_.contains("opendir of"));
     EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_ / "f"), ENOTDIR));
-    EXPECT_TRUE(log.contains("opendir of " + (top_ / "f").string() + " failed: Not a directory"));
+    EXPECT_TRUE(log_.contains("opendir of " + (top_ / "f").string() + " failed: Not a directory"));
     env_->failCall(EnvCall::ReadDir, 2, EIO);
     EXPECT_TRUE(failedWith(manager_.urlsForItemsInDirectoryAtURL(top_), EIO));
 }
@@ -171,16 +170,15 @@ TEST_F(TraverseListTest, DirectoryStructureNamesFilesWithoutAnOwnerAccount) {
     for (const auto& entry : fs::recursive_directory_iterator(top_))
         ::lchown(entry.path().c_str(), kMobileUID, kMobileUID);
     ASSERT_EQ(::lchown((top_ / "d1" / "stray").c_str(), 4242, 4242), 0);
-    LogCapture log;
     manager_.printDirectoryStructureAtURL(top_);
-    EXPECT_TRUE(log.contains("\tOrphaned File: " + (top_ / "d1" / "stray").string()));
-    EXPECT_EQ(log.count("Orphaned File:"), 1u) << log.all();
-    EXPECT_TRUE(log.contains("\t    g (uid 501, gid 501, mode 644)")) << log.all();
+    EXPECT_TRUE(log_.contains("\tOrphaned File: " + (top_ / "d1" / "stray").string()));
+    EXPECT_EQ(log_.count("Orphaned File:"), 1u) << log_.all();
+    EXPECT_TRUE(log_.contains("\t    g (uid 501, gid 501, mode 644)")) << log_.all();
 
-    log.clear();
+    log_.clear();
     manager_.printDirectoryStructureAtURL(top_ / "missing");
-    EXPECT_TRUE(log.contains("FTS returned error for " + (top_ / "missing").string() +
-                             " : No such file or directory"));
+    EXPECT_TRUE(log_.contains("FTS returned error for " + (top_ / "missing").string() +
+                              " : No such file or directory"));
 }
 
 class DiskUsageTest : public FsTest {
@@ -221,14 +219,13 @@ TEST_F(DiskUsageTest, AllocatedSizesOfAKnownTree) {
 }
 
 TEST_F(DiskUsageTest, FastSizingTriesDirectoryStatisticsThenWalksAndFailuresAreNegative) {
-    LogCapture log;
     EXPECT_LT(manager_.diskUsageForURL(tree() / "missing"), 0);
-    EXPECT_TRUE(log.contains("Failed to get dirstats on " + (tree() / "missing").string() +
-                             " using fallback: (err 2)"))
-        << log.all();
+    EXPECT_TRUE(log_.contains("Failed to get dirstats on " + (tree() / "missing").string() +
+                              " using fallback: (err 2)"))
+        << log_.all();
     EXPECT_LT(manager_.diskUsageForURL(fs::path()), 0);
     EXPECT_LT(manager_.fastDiskUsageForURL(fs::path()), 0);
-    EXPECT_TRUE(log.contains("Failed to get path to url"));
+    EXPECT_TRUE(log_.contains("Failed to get path to url"));
 
     for (bool on : {false, true}) {
         root_.writeFile("/etc/quarnd/features/quarnd.plist",
@@ -236,14 +233,14 @@ TEST_F(DiskUsageTest, FastSizingTriesDirectoryStatisticsThenWalksAndFailuresAreN
                                     "<dict><key>Enabled</key>") +
                             (on ? "<true/>" : "<false/>") + "</dict></dict></plist>\n");
         EXPECT_EQ(manager_.fastDiskUsageForURL(tree()), madeTree());
-        EXPECT_EQ(log.contains("dirstats on " + tree().string() + ":"), on) << "off: walk only";
+        EXPECT_EQ(log_.contains("dirstats on " + tree().string() + ":"), on) << "off: walk only";
     }
-    EXPECT_TRUE(log.contains("Failed to set maintain-dir-stats on " + tree().string()));
-    EXPECT_TRUE(log.contains("Failed to get dirstats on " + tree().string() + ": (err " +
-                             std::to_string(ENOTSUP) + ")"));
-    EXPECT_TRUE(log.contains("descendants: 5, total size: " + std::to_string(madeTree()) +
-                             ", using fallback"))
-        << log.all();
+    EXPECT_TRUE(log_.contains("Failed to set maintain-dir-stats on " + tree().string()));
+    EXPECT_TRUE(log_.contains("Failed to get dirstats on " + tree().string() + ": (err " +
+                              std::to_string(ENOTSUP) + ")"));
+    EXPECT_TRUE(log_.contains("descendants: 5, total size: " + std::to_string(madeTree()) +
+                              ", using fallback"))
+        << log_.all();
     EXPECT_LT(manager_.fastDiskUsageForURL(tree() / "missing"), 0);
 }
 
