@@ -14,6 +14,7 @@
 
 using namespace quarn;
 namespace fs = std::filesystem;
+using P = ProtectionClassAttribute;
 
 namespace {
 
@@ -25,19 +26,21 @@ protected:
         dir_ = tmpl;
     }
     void TearDown() override {
-        for (int fd : fds_) {
+        for (int fd : fds_)
             close(fd);
-        }
         fs::remove_all(dir_);
     }
-    int open(const fs::path& p, int flags) {
-        int fd = ::open(p.c_str(), flags | O_CLOEXEC);
+    int open(const fs::path& p, int flags = O_RDWR | O_CREAT) {
+        int fd = ::open(p.c_str(), flags | O_CLOEXEC, 0600);
         EXPECT_GE(fd, 0) << p << ": " << std::strerror(errno);
         fds_.push_back(fd);
         return fd;
     }
-    int newFile(const char* name) { return open(dir_ / name, O_RDWR | O_CREAT | O_EXCL); }
-    static int errorOf(const Expected<int, int>& r) { return r ? 0 : r.error(); }
+    // The class, or minus the error.
+    static int classOf(int fd) {
+        auto r = P::getProtectionClass(fd);
+        return r ? *r : -r.error();
+    }
 
     fs::path dir_;
     std::vector<int> fds_;
@@ -47,16 +50,13 @@ protected:
 
 TEST_F(ProtectionClassAttributeTest, RoundTripsOnFilesAndDirectories) {
     ASSERT_EQ(geteuid(), 0u) << "these tests run as root";
-    int file = newFile("f");
     fs::create_directory(dir_ / "d");
-    int directory = open(dir_ / "d", O_RDONLY | O_DIRECTORY);
-    for (int fd : {file, directory}) {
-        EXPECT_EQ(ProtectionClassAttribute::getProtectionClass(fd).value_or(-1),
-                  ProtectionClassAttribute::kNoClass);
-        ASSERT_TRUE(ProtectionClassAttribute::setProtectionClass(fd, 3));
-        EXPECT_EQ(ProtectionClassAttribute::getProtectionClass(fd).value_or(-1), 3);
-        ASSERT_TRUE(ProtectionClassAttribute::setProtectionClass(fd, 14));
-        EXPECT_EQ(ProtectionClassAttribute::getProtectionClass(fd).value_or(-1), 14);
+    for (int fd : {open(dir_ / "f"), open(dir_ / "d", O_RDONLY | O_DIRECTORY)}) {
+        EXPECT_EQ(classOf(fd), P::kNoClass);
+        for (int cls : {3, 14}) {
+            ASSERT_TRUE(P::setProtectionClass(fd, cls));
+            EXPECT_EQ(classOf(fd), cls);
+        }
     }
     // Other tools read the stored form: the decimal text under that name.
     char text[8] = {};
@@ -66,40 +66,34 @@ TEST_F(ProtectionClassAttributeTest, RoundTripsOnFilesAndDirectories) {
 }
 
 TEST_F(ProtectionClassAttributeTest, ItemsThatCannotHoldAClassReportBadDescriptor) {
-    newFile("target");
+    open(dir_ / "target");
     fs::create_symlink(dir_ / "target", dir_ / "link");
-    int link = open(dir_ / "link", O_PATH | O_NOFOLLOW);
     ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0);
-    int fifo = open(dir_ / "fifo", O_RDWR | O_NONBLOCK);
-    int devnull = open("/dev/null", O_RDWR);
-    for (int fd : {link, fifo, devnull}) {
-        EXPECT_EQ(errorOf(ProtectionClassAttribute::getProtectionClass(fd)), EBADF);
-        auto set = ProtectionClassAttribute::setProtectionClass(fd, 4);
+    for (int fd : {open(dir_ / "link", O_PATH | O_NOFOLLOW),
+                   open(dir_ / "fifo", O_RDWR | O_NONBLOCK), open("/dev/null", O_RDWR), -1}) {
+        EXPECT_EQ(classOf(fd), -EBADF);
+        auto set = P::setProtectionClass(fd, 4);
         ASSERT_FALSE(set);
         EXPECT_EQ(set.error(), EBADF);
     }
     // The link's target was left alone.
-    int target = open(dir_ / "target", O_RDONLY);
-    EXPECT_EQ(ProtectionClassAttribute::getProtectionClass(target).value_or(-1), 0);
-    EXPECT_EQ(errorOf(ProtectionClassAttribute::getProtectionClass(-1)), EBADF);
+    EXPECT_EQ(classOf(open(dir_ / "target", O_RDONLY)), P::kNoClass);
 }
 
 TEST_F(ProtectionClassAttributeTest, RejectsBadClassesAndCorruptValues) {
-    int fd = newFile("f");
-    auto negative = ProtectionClassAttribute::setProtectionClass(fd, -1);
+    int fd = open(dir_ / "f");
+    auto negative = P::setProtectionClass(fd, -1);
     ASSERT_FALSE(negative);
     EXPECT_EQ(negative.error(), EINVAL);
-    const char* name = ProtectionClassAttribute::attributeName();
     for (std::string stored : {"", "abc", "-1", "3x", " 3", "99999999999999999999999"}) {
-        ASSERT_EQ(fsetxattr(fd, name, stored.data(), stored.size(), 0), 0);
-        EXPECT_EQ(errorOf(ProtectionClassAttribute::getProtectionClass(fd)), EINVAL)
-            << "stored \"" << stored << "\"";
+        ASSERT_EQ(fsetxattr(fd, P::attributeName(), stored.data(), stored.size(), 0), 0);
+        EXPECT_EQ(classOf(fd), -EINVAL) << "stored \"" << stored << "\"";
     }
 }
 
 TEST_F(ProtectionClassAttributeTest, UnprivilegedProcessesUseTheUserNamespace) {
     ASSERT_EQ(seteuid(65534), 0);
-    std::string name = ProtectionClassAttribute::attributeName();
+    std::string name = P::attributeName();
     ASSERT_EQ(seteuid(0), 0);
     EXPECT_EQ(name, "user.quarn.protection_class");
 }

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <fstream>
 #include <regex>
 #include <string>
@@ -27,32 +28,25 @@ TEST(Signpost, LogsBeginAndEndWithDurationOnce) {
         EXPECT_TRUE(log.contains(id + " begin: first boot"));
         EXPECT_EQ(log.count(id + " end"), 0u);
         s.end("12 nodes");
-        EXPECT_FALSE(s.isActive());
         s.end("again");
     }
     ASSERT_EQ(log.count(id + " end"), 1u) << log.all();
-    std::regex endLine(std::regex_replace(id, std::regex(R"([\[\]])"), R"(\$&)") +
-                       R"( end after \d+\.\d{3} ms: 12 nodes)");
-    bool matched = false;
-    for (const auto& m : log.messages()) {
-        matched = matched || std::regex_search(m, endLine);
-    }
-    EXPECT_TRUE(matched) << log.all();
+    const std::regex duration(R"( end after \d+\.\d{3} ms: 12 nodes)");
+    EXPECT_TRUE(std::ranges::any_of(log.messages(), [&](const std::string& m) {
+        return m.find(id + " end after ") != std::string::npos && std::regex_search(m, duration);
+    })) << log.all();
 }
 
 TEST(Signpost, IntervalsAreToldApartAndMovesEndOnce) {
     LogCapture log;
     Signpost a(LogCategory::Vell, "VellEventProcessing");
     Signpost b(LogCategory::Vell, "VellEventProcessing");
-    EXPECT_NE(a.identifier(), b.identifier());
     std::string aTag = tag(a), bTag = tag(b);
+    EXPECT_NE(aTag, bTag);
     {
         Signpost moved(std::move(a));
-        EXPECT_FALSE(a.isActive());
-        // Assigning over b ends b's own interval first.
-        b = std::move(moved);
+        b = std::move(moved); // ends b's own interval first
         EXPECT_EQ(log.count(bTag + " end"), 1u);
-        EXPECT_EQ(log.count(aTag + " end"), 0u);
     }
     EXPECT_EQ(log.count(aTag + " end"), 0u) << "a moved-from signpost must not end";
     b.end();
@@ -63,10 +57,8 @@ TEST(Signpost, IntervalsAreToldApartAndMovesEndOnce) {
 #if __has_include(<sys/sdt.h>)
 TEST(Signpost, ProbesAreInTheBinary) {
     // USDT probes leave "provider\0name" in the binary's stapsdt notes.
-    std::ifstream exe("/proc/self/exe", std::ios::binary | std::ios::ate);
-    std::string bytes(static_cast<std::size_t>(exe.tellg()), '\0');
-    exe.seekg(0);
-    exe.read(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+    std::ifstream exe("/proc/self/exe", std::ios::binary);
+    std::string bytes(std::istreambuf_iterator<char>(exe), {});
     using namespace std::string_literals;
     EXPECT_NE(bytes.find("quarnd\0signpost_begin\0"s), std::string::npos);
     EXPECT_NE(bytes.find("quarnd\0signpost_end\0"s), std::string::npos);

@@ -13,14 +13,8 @@ using namespace quarn;
 
 TEST(Value, TypedAccessorsAnswerNoneOnWrongType) {
     Value s("text");
-    EXPECT_FALSE(s.asUInt64());
-    EXPECT_FALSE(s.asBool());
-    EXPECT_EQ(s.asDictionary(), nullptr);
-    EXPECT_EQ(s.asArray(), nullptr);
-    EXPECT_EQ(s.get("key"), nullptr);
-    ASSERT_NE(s.asString(), nullptr);
+    EXPECT_FALSE(s.asUInt64() || s.asBool() || s.asDictionary() || s.asArray() || s.get("key"));
     EXPECT_EQ(*s.asString(), "text");
-
     // Integers convert between signedness only where the value fits.
     EXPECT_EQ(Value(-1).asUInt64(), std::nullopt);
     EXPECT_EQ(Value(7).asUInt64(), 7u);
@@ -54,17 +48,14 @@ TEST(Value, EqualityAndHashAgree) {
 }
 
 TEST(Value, CopiesAreIndependent) {
-    Value a = Value::dictionary();
-    a.set("x", 1);
+    Value a = Value::Dictionary{{"x", 1}};
     Value b = a;
     b.set("x", 2);
     b.set("y", Value::Array{});
-    EXPECT_EQ(*a.get("x"), Value(1));
-    EXPECT_EQ(a.get("y"), nullptr);
+    EXPECT_EQ(a, Value(Value::Dictionary{{"x", 1}}));
     EXPECT_EQ(*b.get("x"), Value(2));
     EXPECT_TRUE(b.erase("y"));
     EXPECT_FALSE(b.erase("y"));
-    EXPECT_EQ(a.size(), 1u);
 }
 
 TEST(Value, DescriptionIsDeterministicAndReadable) {
