@@ -105,28 +105,24 @@ TEST(PropertyList, IntegersUseTheFormatsSignedAndUnsignedEncodings) {
 TEST(PropertyList, ReadsXML) {
     auto v = valueFromPropertyListBytes(bytesOf(R"(<?xml version="1.0" encoding="UTF-8"?>
 <!DOCTYPE plist PUBLIC "-//Apple//DTD PLIST 1.0//EN" "http://www.apple.com/DTDs/PropertyList-1.0.dtd">
-<plist version="1.0"><dict>
-  <key>negative</key><integer>-3</integer>
-  <key>big</key><integer>18446744073709551615</integer>
-  <key>real</key><real>2.5</real>
-  <key>yes</key><true/>
-  <key>text</key><string>a &amp; b</string>
-  <key>data</key><data>AAEC</data>
+<plist version="1.0"><dict><key>negative</key><integer>-3</integer>
+  <key>big</key><integer>18446744073709551615</integer><key>real</key><real>2.5</real>
+  <key>yes</key><true/><key>text</key><string>a &amp; b</string><key>data</key><data>AAEC</data>
   <key>date</key><date>2000-06-01T12:00:00Z</date>
   <!-- <array> in a comment is not an element -->
-  <key>list</key><array><integer>1</integer><dict/></array>
-</dict></plist>)"));
+  <key>list</key><array><integer>1</integer><dict/></array></dict></plist>)"));
     ASSERT_TRUE(v) << v.error().message;
     EXPECT_EQ(v->get("negative")->asInt64(), -3);
     EXPECT_EQ(v->get("big")->asUInt64(), UINT64_MAX);
-    EXPECT_EQ(*v, Value(Value::Dictionary{{"negative", -3},
-                                          {"big", UINT64_MAX},
-                                          {"real", 2.5},
-                                          {"yes", true},
-                                          {"text", "a & b"},
-                                          {"data", Value::Data{0, 1, 2}},
-                                          {"date", Date{959860800LL * 1000000}},
-                                          {"list", Value::Array{1u, Value::dictionary()}}}));
+    Value::Dictionary expected = {{"negative", -3},
+                                  {"big", UINT64_MAX},
+                                  {"real", 2.5},
+                                  {"yes", true},
+                                  {"text", "a & b"},
+                                  {"data", Value::Data{0, 1, 2}},
+                                  {"date", Date{959860800LL * 1000000}},
+                                  {"list", Value::Array{1u, Value::dictionary()}}};
+    EXPECT_EQ(*v, Value(expected));
 }
 
 TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
