@@ -1,0 +1,278 @@
+#include "Daemon/model/QRNConcreteContainerIdentity.h"
+#include "Daemon/model/QRNContainerClass.h"
+#include "Daemon/model/QRNContainerIdentity.h"
+#include "Daemon/model/QRNUserIdentitySharedCache.h"
+#include "Daemon/model/QRNWhitelist.h"
+#include "common/LogCapture.h"
+#include "common/TempRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <set>
+#include <string>
+#include <unordered_set>
+
+using namespace quarn;
+
+namespace {
+
+class QRNContainerIdentityTest : public quarn::test::TempRootTest {
+protected:
+    QRNUserIdentityPtr user(std::uint32_t uid, std::uint32_t gid = 501) {
+        return QRNUserIdentity::initWithUID(uid, gid, root_ / "/private/var/mobile", std::nullopt,
+                                            kQRNPersonaTypePersonal, uid);
+    }
+    QRNContainerIdentityPtr identity(const QRNUserIdentityPtr& u, const std::string& id,
+                                     std::uint64_t cls) {
+        return *QRNContainerIdentity::containerIdentityWithUserIdentity(u, id, cls);
+    }
+    QRNContainerIdentityPtr concrete(const UUID& uuid, const QRNUserIdentityPtr& u,
+                                     std::uint64_t cls = 2) {
+        return *QRNConcreteContainerIdentity::containerIdentityWithUUID(uuid, u, "com.example.app",
+                                                                        cls);
+    }
+    quarn::test::LogCapture log_;
+};
+
+} // namespace
+
+// The checks run in a fixed order: the first failing one decides the code
+// and the message. The UUID of a concrete identity is checked last.
+TEST_F(QRNContainerIdentityTest, ChecksInOrderWithCodesAndMessages) {
+    auto u = user(501);
+    const Value str("com.example.app"), number(std::uint64_t{7}), none;
+    const Value uuidString("E621E1F8-C36C-495A-93FC-0C247A3E6E5F"), uuid(UUID::random());
+    struct Case {
+        bool concrete;
+        const Value* uuid;
+        QRNUserIdentityPtr user;
+        const Value* identifier;
+        std::uint64_t cls;
+        std::uint64_t code;
+        const char* logged; // null: "uuid" must not be mentioned
+    };
+    const Case cases[] = {
+        {false, nullptr, nullptr, nullptr, 99, kQRNErrorInvalidArgument,
+         "Invalid object: no user identity"},
+        {false, nullptr, u, nullptr, 99, kQRNErrorMissingIdentifier,
+         "Invalid object: missing identifier"},
+        {false, nullptr, u, &none, 2, kQRNErrorMissingIdentifier,
+         "Invalid object: missing identifier"},
+        {false, nullptr, u, &number, 99, kQRNErrorInvalidArgument,
+         "Invalid object: identifier = [7]"},
+        {false, nullptr, u, &str, 0, kQRNErrorInvalidArgument,
+         "Invalid object: container class = 0"},
+        {false, nullptr, u, &str, 14, kQRNErrorInvalidArgument,
+         "Invalid object: container class = 14"},
+        {false, nullptr, u, &str, ~std::uint64_t{0}, kQRNErrorInvalidArgument,
+         "Invalid object: container class = 18446744073709551615"},
+        {true, &uuidString, u, nullptr, 2, kQRNErrorMissingIdentifier, nullptr},
+        {true, &uuidString, u, &str, 2, kQRNErrorInvalidArgument, "Invalid object: uuid = ["},
+        {true, nullptr, u, &str, 2, kQRNErrorInvalidArgument, "Invalid object: uuid = ["},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.logged ? c.logged : "uuid not checked");
+        log_.clear();
+        const auto failure = [&]() -> std::optional<std::uint64_t> {
+            if (c.concrete) {
+                auto r = QRNConcreteContainerIdentity::containerIdentityWithUUID(
+                    c.uuid, c.user, c.identifier, c.cls);
+                return r ? std::nullopt : std::optional(r.error());
+            }
+            auto r = QRNContainerIdentity::containerIdentityWithUserIdentity(c.user, c.identifier,
+                                                                             c.cls);
+            return r ? std::nullopt : std::optional(r.error());
+        }();
+        EXPECT_EQ(failure, c.code);
+        EXPECT_EQ(log_.messages().size(), 1u) << log_.all();
+        EXPECT_TRUE(c.logged ? log_.contains(c.logged) : !log_.contains("uuid")) << log_.all();
+    }
+    for (std::uint64_t cls = 1; cls <= 13; ++cls) {
+        auto r = QRNContainerIdentity::containerIdentityWithUserIdentity(u, &str, cls);
+        ASSERT_TRUE(r) << cls;
+        EXPECT_EQ((*r)->identifier(), "com.example.app");
+        EXPECT_EQ((*r)->containerClass(), cls);
+        EXPECT_TRUE((*r)->userIdentity()->isEqual(*u));
+    }
+    auto r = QRNConcreteContainerIdentity::containerIdentityWithUUID(&uuid, u, &str, 2);
+    ASSERT_TRUE(r);
+    EXPECT_EQ((*r)->uuid(), *uuid.asUUID());
+
+    EXPECT_EQ(QRNContainerIdentity::init(), nullptr);
+    EXPECT_EQ(QRNConcreteContainerIdentity::init(), nullptr);
+    EXPECT_EQ(log_.count("You cannot init this class directly."), 2u);
+}
+
+// Only bundle and system classes may do without a caller-given user; they
+// get the default identity.
+TEST_F(QRNContainerIdentityTest, IdentifierOnlyNeedsAClassWithoutUser) {
+    for (std::uint64_t cls = 0; cls <= 15; ++cls) {
+        SCOPED_TRACE(cls);
+        auto r = QRNContainerIdentity::containerIdentityWithIdentifier("com.example.x", cls);
+        const bool allowed = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls == 12 || cls == 13;
+        ASSERT_EQ(r.has_value(), allowed);
+        if (allowed) {
+            EXPECT_TRUE(
+                (*r)->userIdentity()->isEqual(*QRNUserIdentitySharedCache::defaultUserIdentity()));
+        } else {
+            EXPECT_EQ(r.error(), kQRNErrorInvalidArgument);
+        }
+    }
+    EXPECT_TRUE(log_.contains("Attempt to create a container identity without a user identity "
+                              "when one is required; identifier = [com.example.x], class = 2"));
+}
+
+TEST_F(QRNContainerIdentityTest, EqualityFromBothSides) {
+    auto u501 = user(501, 501);
+    auto u501b = user(501, 20); // same identifier "501"
+    auto a = identity(u501, "com.example.app", 2);
+    const UUID uuid = UUID::random();
+    auto c = concrete(uuid, u501b), c2 = concrete(uuid, u501),
+         cOther = concrete(UUID::random(), u501);
+
+    EXPECT_TRUE(a->isEqual(*identity(u501b, "com.example.app", 2)));
+    EXPECT_FALSE(a->isEqual(*identity(u501, "com.example.app", 7)));
+    EXPECT_FALSE(a->isEqual(*identity(user(502), "com.example.app", 2)));
+    EXPECT_FALSE(a->isEqual(*identity(u501, "com.example.App", 2)));
+
+    // The base side ignores the UUID; the concrete side needs a concrete
+    // identity with the same UUID.
+    EXPECT_TRUE(a->isEqual(*c) && a->isEqual(*cOther));
+    EXPECT_FALSE(c->isEqual(*a));
+    EXPECT_TRUE(c->isEqual(*c2) && c2->isEqual(*c));
+    EXPECT_FALSE(c->isEqual(*cOther));
+
+    // Equal identities hash alike, so they work as set members.
+    EXPECT_EQ(c->hash(), c2->hash());
+    std::unordered_set<QRNContainerIdentityPtr, QRNContainerIdentity::Hash,
+                       QRNContainerIdentity::Equal>
+        set{a, identity(u501, "com.example.app", 4), c, cOther};
+    EXPECT_EQ(set.count(identity(u501, "com.example.app", 4)), 1u);
+    EXPECT_EQ(set.count(concrete(uuid, u501)), 1u);
+}
+
+// Each predicate over 0..15 (and a few large numbers) against the class sets
+// the rest of the daemon relies on.
+TEST(QRNContainerClass, PredicatesAndTransientBasesMatchTheClassSets) {
+    using Set = std::set<std::uint64_t>;
+    using TB = QRNContainerClass::TransientBase;
+    const Set bundle{1, 3, 5, 8}, system{12, 13}, group{7, 13}, perUser{2, 4, 6, 7, 9, 10, 11},
+        transient{2, 4, 6, 7, 12, 13};
+    for (std::uint64_t c = 0; c <= 15; ++c) {
+        SCOPED_TRACE(c);
+        const bool isBundle = bundle.count(c), isSystem = system.count(c);
+        EXPECT_EQ(QRNContainerClass::isValid(c), c >= 1 && c <= 13);
+        EXPECT_EQ(QRNContainerClass::isBundle(c), isBundle);
+        EXPECT_EQ(QRNContainerClass::isSystem(c), isSystem);
+        EXPECT_EQ(QRNContainerClass::isGlobal(c), isBundle || isSystem);
+        EXPECT_EQ(QRNContainerClass::isGroup(c), group.count(c) != 0);
+        EXPECT_EQ(QRNContainerClass::usesPerUserStaging(c), perUser.count(c) != 0);
+        EXPECT_EQ(QRNContainerClass::isPerUser(c), perUser.count(c) != 0);
+        // Required for everything that is not bundle or system, invalid
+        // numbers included: those are refused later by the range check.
+        EXPECT_EQ(QRNContainerClass::isUserIdentityRequired(c), !isBundle && !isSystem);
+        EXPECT_EQ(QRNUserIdentity::isUserIdentityRequiredForContainerClass(c),
+                  !isBundle && !isSystem);
+        EXPECT_EQ(QRNContainerClass::baseDirectoryOwner(c), isBundle ? 33u : 0u);
+        EXPECT_EQ(QRNContainerClass::transientBase(c), isBundle             ? TB::TransientBundle
+                                                       : transient.count(c) ? TB::Transient
+                                                                            : TB::None);
+    }
+    for (std::uint64_t c : {std::uint64_t{64}, std::uint64_t{0x12a}, ~std::uint64_t{0}}) {
+        SCOPED_TRACE(c);
+        EXPECT_FALSE(QRNContainerClass::isValid(c) || QRNContainerClass::isBundle(c) ||
+                     QRNContainerClass::isSystem(c) || QRNContainerClass::usesPerUserStaging(c));
+        EXPECT_TRUE(QRNContainerClass::isUserIdentityRequired(c));
+    }
+}
+
+// Every valid class has its own two-component directory (the layout appends
+// it to a base) whose first part says what kind of class it is; nothing past
+// the end marker has one.
+TEST(QRNContainerClass, EachClassHasItsOwnDirectoryAndName) {
+    EXPECT_EQ(QRNContainerClass::relativeDirectory(15), "");
+    EXPECT_EQ(QRNContainerClass::shortName(14), "");
+    std::set<std::string> seenDirs, seenNames;
+    for (std::uint64_t c = 1; c <= 13; ++c) {
+        SCOPED_TRACE(c);
+        std::filesystem::path dir(QRNContainerClass::relativeDirectory(c));
+        EXPECT_EQ(std::distance(dir.begin(), dir.end()), 2);
+        EXPECT_TRUE(seenDirs.insert(dir.string()).second);
+        EXPECT_TRUE(seenNames.insert(std::string(QRNContainerClass::shortName(c))).second);
+        EXPECT_EQ(dir.begin()->string(), QRNContainerClass::isBundle(c)  ? "Bundle"
+                                         : QRNContainerClass::isGroup(c) ? "Shared"
+                                                                         : "Data");
+    }
+}
+
+TEST(QRNWhitelist, WellknownContainersAreNamedByIdentifierInTheirOwnClassOnly) {
+    test::TempRoot root;
+    const QRNWhitelist& whitelist = QRNWhitelist::sharedWhitelist();
+    EXPECT_EQ(&whitelist, &root.context().instance<QRNWhitelist>());
+    EXPECT_EQ(whitelist.wellknownSystemContainers(),
+              (std::vector<std::string>{"com.orvex.accountsd", "com.orvex.devicesettings"}));
+    auto groups = whitelist.wellknownSystemGroupContainers();
+    ASSERT_EQ(groups.size(), 8u);
+    for (const auto& group : groups) {
+        EXPECT_EQ(whitelist.wellknownContainerForId(group, 13), group);
+        EXPECT_FALSE(whitelist.containerIdIsWellknown(group, 12)) << group;
+    }
+    EXPECT_EQ(whitelist.wellknownContainerForId("com.orvex.accountsd", 12), "com.orvex.accountsd");
+    EXPECT_TRUE(whitelist.systemContainerIdIsWellknown("com.orvex.devicesettings"));
+    EXPECT_TRUE(whitelist.systemGroupContainerIdIsWellknown("systemgroup.com.orvex.pairing"));
+    // Other classes, near misses and empty names.
+    EXPECT_FALSE(whitelist.containerIdIsWellknown("com.orvex.accountsd", 13));
+    EXPECT_FALSE(whitelist.containerIdIsWellknown("com.orvex.accountsd", 2));
+    EXPECT_FALSE(whitelist.systemContainerIdIsWellknown("com.orvex.accountsd2"));
+    EXPECT_FALSE(whitelist.systemGroupContainerIdIsWellknown(""));
+    EXPECT_EQ(whitelist.wellknownSystemGroupContainerForId("com.orvex.devicesettings"),
+              std::nullopt);
+}
+
+TEST(QRNWhitelist, LookupExceptionsFollowNullMarkersSetsAndOpenSets) {
+    struct Case {
+        const char* client;
+        std::uint64_t cls;
+        const char* container;
+        bool allowed;
+    };
+    const Case cases[] = {
+        // Null marker for the whole client: every class below the end marker.
+        {"com.orvex.backupd", 0, "any", true},
+        {"com.orvex.backupd", 11, "any", true},
+        {"com.orvex.backupd", 13, "any", true},
+        {"com.orvex.backupd", 14, "any", false},
+        {"com.orvex.backupd", 99, "any", false},
+        // Null marker per class: only the listed classes.
+        {"com.orvex.settings", 7, "any", true},
+        {"com.orvex.settings", 12, "any", false},
+        {"com.orvex.diagnosticsd", 12, "any", true},
+        {"com.orvex.diagnosticsd", 2, "any", false},
+        {"com.orvex.homescreen", 10, "any", true},
+        {"com.orvex.homescreen", 9, "any", false},
+        // Identifier sets: members only, in their class only.
+        {"com.orvex.searchd", 2, "com.orvex.mail", true},
+        {"com.orvex.searchd", 2, "com.orvex.photos", false},
+        {"com.orvex.searchd", 4, "com.orvex.notes", false},
+        {"com.orvex.accountsd", 12, "com.orvex.accountsd", true},
+        {"com.orvex.accountsd", 12, "com.orvex.devicesettings", false},
+        {"com.orvex.filesd", 7, "any", true},
+        {"com.orvex.filesd", 13, "systemgroup.com.orvex.mediaindex", true},
+        {"com.orvex.filesd", 13, "systemgroup.com.orvex.pairing", false},
+        {"com.orvex.pairingd", 12, "systemgroup.com.orvex.pairing", false},
+        // The open set comes first, so it holds for clients with or without entries.
+        {"", 13, "systemgroup.com.orvex.diagnostics", true},
+        {"com.unknown.app", 13, "systemgroup.com.orvex.diagnostics", true},
+        {"com.orvex.pairingd", 13, "systemgroup.com.orvex.diagnostics", true},
+        {"com.unknown.app", 12, "systemgroup.com.orvex.diagnostics", false},
+        {"com.unknown.app", 13, "systemgroup.com.orvex.telemetry", false},
+        {"com.unknown.app", 2, "com.orvex.notes", false},
+    };
+    QRNWhitelist whitelist;
+    for (const auto& c : cases) {
+        EXPECT_EQ(whitelist.isLookupWhitelistedFromCodeSignIdentifier(c.client, c.cls, c.container),
+                  c.allowed)
+            << c.client << " class " << c.cls << " " << c.container;
+    }
+}
