@@ -72,7 +72,13 @@ TEST_F(ACLTest, OrdinaryTreeGetsTheDirectoryListAtItsTopToo) {
     EXPECT_EQ(lstatOf(container()).st_uid, 65534u);
 }
 
-TEST_F(ACLTest, MissingGroupFailsWithTheACLCode) {
+TEST_F(ACLTest, AllSystemContainersOfADirectoryAndAMissingGroup) {
+    auto parent = container().parent_path();
+    fs::create_directories(parent / "C2" / "Library");
+    EXPECT_TRUE(manager_.standardizeAllSystemContainerACLsAtURL(parent / "missing"));
+
+    // Without the group nothing is touched, and every container is still tried.
+    const auto groups = readFile(root_ / "/etc/group");
     root_.writeFile("/etc/group", "wheel:x:0:\n");
     for (bool wholeTree : {false, true}) {
         auto set = wholeTree ? manager_.standardizeACLsAtURL(container(), true)
@@ -81,24 +87,17 @@ TEST_F(ACLTest, MissingGroupFailsWithTheACLCode) {
         EXPECT_TRUE(set.error().isQRN(kQRNErrorSetACLFailed)) << wholeTree;
     }
     EXPECT_TRUE(log_.contains("group lookup failed"));
-    EXPECT_EQ(aclText(container()), "u::rwx,g::r-x,o::r-x") << "nothing was touched";
-}
+    EXPECT_FALSE(manager_.standardizeAllSystemContainerACLsAtURL(parent));
+    EXPECT_EQ(log_.count("Failed to set system container ACL at"), 2u);
+    EXPECT_EQ(aclText(container()), "u::rwx,g::r-x,o::r-x");
 
-TEST_F(ACLTest, AllSystemContainersOfADirectory) {
-    auto parent = container().parent_path();
-    fs::create_directories(parent / "C2" / "Library");
-    EXPECT_TRUE(manager_.standardizeAllSystemContainerACLsAtURL(parent / "missing"));
-
+    root_.writeFile("/etc/group", groups);
     ASSERT_TRUE(manager_.standardizeAllSystemContainerACLsAtURL(parent));
     EXPECT_TRUE(log_.contains("Potential containers requiring ACL migration"));
     for (auto c : {container(), parent / "C2"}) {
         EXPECT_EQ(aclText(c), kTopAccess) << c;
         EXPECT_EQ(aclText(c / "Library", ACL_TYPE_DEFAULT), kFullBelowTop) << c;
     }
-    // Every container is tried; the call still reports the failure.
-    root_.writeFile("/etc/group", "wheel:x:0:\n");
-    EXPECT_FALSE(manager_.standardizeAllSystemContainerACLsAtURL(parent));
-    EXPECT_EQ(log_.count("Failed to set system container ACL at"), 2u);
 }
 
 struct OwnedItem {

@@ -48,37 +48,10 @@ protected:
 };
 
 TEST_F(TraverseListTest, DirectoriesComeBeforeAndAfterTheirContentsAndLinksAreNotEntered) {
-    auto visits = walk(top_);
-    // 4 directories twice, 5 files/links once.
-    ASSERT_EQ(visits.size(), 13u);
-    EXPECT_EQ(visits.front().kind, Kind::DirectoryPreOrder);
-    EXPECT_EQ(visits.back().kind, Kind::DirectoryPostOrder);
-    for (const auto& d : {top_, top_ / "d1", top_ / "d1" / "d2", top_ / "e"}) {
-        auto pre = indexOf(visits, d, Kind::DirectoryPreOrder);
-        auto post = indexOf(visits, d, Kind::DirectoryPostOrder);
-        ASSERT_GE(pre, 0) << d;
-        ASSERT_GT(post, pre) << d;
-        for (std::ptrdiff_t i = 0; i < static_cast<std::ptrdiff_t>(visits.size()); ++i) {
-            if (visits[i].path.string().rfind(d.string() + "/", 0) == 0) {
-                EXPECT_TRUE(i > pre && i < post) << visits[i].path << " outside of " << d;
-            }
-        }
-    }
-    EXPECT_EQ(indexOf(visits, top_, Kind::DirectoryPreOrder), 0);
-    auto link = indexOf(visits, top_ / "d1" / "out", Kind::Symlink);
-    ASSERT_GE(link, 0);
-    EXPECT_EQ(visits[link].level, 2);
-    EXPECT_EQ(indexOf(visits, top_ / "d1" / "out" / "inner", Kind::DirectoryPreOrder), -1);
-    EXPECT_GE(indexOf(visits, top_ / ".hidden", Kind::File), 0) << "walks see dot-files";
-    EXPECT_EQ(visits[indexOf(visits, top_ / "d1" / "d2" / "h", Kind::File)].level, 3);
-
-    auto single = walk(top_ / "f");
-    ASSERT_EQ(single.size(), 1u);
-    EXPECT_EQ(single[0].kind, Kind::File);
-}
-
-TEST_F(TraverseListTest, EntriesCanBeChangedThroughTheirParentDescriptor) {
-    auto walked = manager_._traverseDirectory(top_, [&](const auto& entry) -> Status {
+    // Each entry is changed through its parent's descriptor as it is met.
+    std::vector<Visit> visits;
+    ASSERT_TRUE(manager_._traverseDirectory(top_, [&](const auto& entry) -> Status {
+        visits.push_back({entry.kind, entry.path, entry.level});
         if (entry.kind != Kind::DirectoryPostOrder && entry.level > 0) {
             EXPECT_EQ(::fchownat(entry.parentFd, entry.name.c_str(), kMobileUID, kMobileUID,
                                  AT_SYMLINK_NOFOLLOW),
@@ -86,11 +59,28 @@ TEST_F(TraverseListTest, EntriesCanBeChangedThroughTheirParentDescriptor) {
                 << entry.path;
         }
         return {};
-    });
-    ASSERT_TRUE(walked);
+    }));
+    // 4 directories twice, 5 files/links once, each between its parent's two visits.
+    ASSERT_EQ(visits.size(), 13u);
+    EXPECT_EQ(indexOf(visits, top_, Kind::DirectoryPreOrder), 0);
+    EXPECT_EQ(indexOf(visits, top_, Kind::DirectoryPostOrder), 12);
+    for (std::ptrdiff_t i = 1; i < 12; ++i) {
+        const auto& v = visits[i];
+        auto pre = indexOf(visits, v.path.parent_path(), Kind::DirectoryPreOrder);
+        auto post = indexOf(visits, v.path.parent_path(), Kind::DirectoryPostOrder);
+        EXPECT_TRUE(pre >= 0 && pre < i && i < post) << v.path;
+        auto relative = v.path.lexically_relative(top_);
+        EXPECT_EQ(v.level, std::distance(relative.begin(), relative.end())) << v.path;
+    }
+    EXPECT_GE(indexOf(visits, top_ / "d1" / "out", Kind::Symlink), 0);
+    EXPECT_GE(indexOf(visits, top_ / ".hidden", Kind::File), 0) << "walks see dot-files";
     EXPECT_EQ(lstatOf(top_ / "d1" / "d2" / "h").st_uid, kMobileUID);
     EXPECT_EQ(lstatOf(top_ / "d1" / "out").st_uid, kMobileUID);
     EXPECT_EQ(lstatOf(root_ / "/outside").st_uid, 0u) << "the link's target is not touched";
+
+    auto single = walk(top_ / "f");
+    ASSERT_EQ(single.size(), 1u);
+    EXPECT_EQ(single[0].kind, Kind::File);
 }
 
 TEST_F(TraverseListTest, BlockErrorStopsTheWalkAndIsReturned) {
