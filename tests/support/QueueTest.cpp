@@ -224,38 +224,21 @@ TEST(Queue, ManualQueueRunsOnTheDrivingThread) {
 
 TEST(QueueDeathTest, MisuseStopsTheProcess) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
-    const std::pair<std::function<void()>, const char*> misuses[] = {
-        {[] {
-             Queue q("self");
-             q.sync([&] { q.sync([] {}); });
-         },
-         "sync onto a queue the caller is already running on"},
-        {[] {
-             Queue a("a"), b("b");
-             a.sync([&] { b.sync([&] { a.sync([] {}); }); });
-         },
-         "already running on"},
-        {[] {
-             Queue q("unbalanced");
-             q.suspend();
-             q.resume();
-             q.resume();
-         },
-         "not suspended"},
-        {[] {
-             Queue q("elsewhere");
-             QRN_ASSERT_ON_QUEUE(q);
-         },
-         "must run on queue elsewhere"},
+    auto misuse = [](int which) {
+        Log::addStderr(); // the fault line is the last word before the abort
+        Queue a("a"), b("b");
+        if (which == 0)
+            a.sync([&] { a.sync([] {}); });
+        if (which == 1)
+            a.sync([&] { b.sync([&] { a.sync([] {}); }); });
+        if (which == 2)
+            a.suspend(), a.resume(), a.resume();
+        QRN_ASSERT_ON_QUEUE(a);
     };
-    // The fault line is the last word before the abort: show it on stderr.
-    for (const auto& [misuse, message] : misuses)
-        EXPECT_DEATH(
-            {
-                Log::addStderr();
-                misuse();
-            },
-            message);
+    const char* faults[] = {"sync onto a queue the caller is already running on",
+                            "already running on", "not suspended", "must run on queue a"};
+    for (int which = 0; which < 4; ++which)
+        EXPECT_DEATH(misuse(which), faults[which]);
 }
 
 TEST(ProcessTransaction, CountsOpenTransactionsOnceAndDrainsWithTheWorkOwningThem) {

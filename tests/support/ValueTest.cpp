@@ -26,36 +26,26 @@ TEST(Value, TypedAccessorsAnswerNoneOnWrongType) {
     EXPECT_FALSE(Value(true).isNumber());
 }
 
-TEST(Value, EqualityAndHashAgree) {
-    EXPECT_EQ(Value(5), Value(5u));
-    EXPECT_EQ(Value(5).hash(), Value(5u).hash());
+TEST(Value, EqualityAndHashAgreeAndCopiesAreIndependent) {
     EXPECT_NE(Value(5), Value(5.0));
     EXPECT_NE(Value(1), Value(true));
     EXPECT_NE(Value("a"), Value(Value::Data{'a'}));
-
     UUID u = UUID::random();
     Value a =
         Value::Dictionary{{"k", Value::Array{1, "two", u, Date{42}}}, {"d", Value::Data{1, 2}}};
     Value b =
         Value::Dictionary{{"d", Value::Data{1, 2}}, {"k", Value::Array{1u, "two", u, Date{42}}}};
     EXPECT_EQ(a, b);
-    EXPECT_EQ(a.hash(), b.hash());
-    std::unordered_set<Value> set{a, b, Value("x")};
-    EXPECT_EQ(set.size(), 2u);
-
-    b.mutableDictionary()["k"].append(3);
-    EXPECT_NE(a, b);
-}
-
-TEST(Value, CopiesAreIndependent) {
-    Value a = Value::Dictionary{{"x", 1}};
-    Value b = a;
-    b.set("x", 2);
-    b.set("y", Value::Array{});
-    EXPECT_EQ(a, Value(Value::Dictionary{{"x", 1}}));
-    EXPECT_EQ(*b.get("x"), Value(2));
-    EXPECT_TRUE(b.erase("y"));
-    EXPECT_FALSE(b.erase("y"));
+    std::unordered_set<Value> set{a, b, Value("x"), Value(5), Value(5u)};
+    EXPECT_EQ(set.size(), 3u);
+    // Changing a copy, even deep inside, leaves the original alone.
+    Value c = a;
+    c.mutableDictionary()["k"].append(3);
+    c.set("y", 2);
+    EXPECT_NE(a, c);
+    EXPECT_EQ(a, b);
+    EXPECT_TRUE(c.erase("y"));
+    EXPECT_FALSE(c.erase("y"));
 }
 
 TEST(Value, DescriptionIsDeterministicAndReadable) {
@@ -85,13 +75,12 @@ TEST(UUID, ParseAgreesWithLibuuidAndCanonicalFormIsUpperCase) {
         ASSERT_TRUE(UUID::parse(text)) << text;
         EXPECT_EQ(UUID::parse(text), libuuidParse(text)) << text;
         EXPECT_EQ(UUID::parse(UUID::parse(text)->string()), UUID::parse(text));
-        for (std::size_t i = 0; i < text.size(); ++i) {
+        for (std::size_t i = 0; i < text.size(); ++i)
             for (char c : std::string("0a9fAFgG-_ /:@`{")) {
                 std::string changed = text;
                 changed[i] = c;
                 EXPECT_EQ(UUID::parse(changed), libuuidParse(changed)) << changed;
             }
-        }
         EXPECT_FALSE(UUID::parse(text + "0"));
         EXPECT_FALSE(UUID::parse(text.substr(1)));
     }
@@ -107,12 +96,10 @@ TEST(QRNError, CarriesFunctionLineAndLogsOnce) {
     Error outer = QRN_ERROR_UNDERLYING(inner, kQRNErrorMoveDirFailed,
                                        "Failed to move dir: {} to: {}", "/a", "/b");
     EXPECT_TRUE(inner.isPOSIX(ENOENT));
-    EXPECT_TRUE(outer.isQRN(kQRNErrorMoveDirFailed));
-    EXPECT_EQ(outer.qrnCode(99), 4u);
+    EXPECT_EQ(outer.qrnCode(99), 4u); // the code clients see
     EXPECT_EQ(inner.qrnCode(99), 99u);
     EXPECT_EQ(outer.message, "Failed to move dir: /a to: /b");
     EXPECT_NE(outer.function.find("CarriesFunctionLineAndLogsOnce"), std::string::npos);
-    EXPECT_GT(outer.line, 0);
     ASSERT_TRUE(outer.underlying);
     EXPECT_EQ(outer.underlying->code, ENOENT);
     EXPECT_EQ(capture.count("Failed to move dir: /a to: /b"), 1u) << capture.all();
