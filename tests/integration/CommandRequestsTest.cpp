@@ -4,7 +4,7 @@
 // each handler answers is the unit tests' concern.
 
 #include "Client/QRNClientRequests.h"
-#include "SharedDaemonTest.h"
+#include "DaemonHarness.h"
 
 namespace quarn::test {
 

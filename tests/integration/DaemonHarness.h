@@ -13,10 +13,13 @@
 #include "common/shared/RequestValues.h"
 #include "common/shared/ScratchRoot.h"
 
+#include <gtest/gtest.h>
+
 #include <chrono>
 #include <cstddef>
 #include <filesystem>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -86,5 +89,28 @@ private:
 // Polls `condition` until it holds or `limit` has passed; answers its last value.
 bool waitUntil(const std::function<bool()>& condition,
                std::chrono::milliseconds limit = DaemonHarness::kWaitLimit);
+
+// A test suite sharing one daemon: started before the suite's first test,
+// stopped after its last, when it must exit with status 0. Each test fails
+// when the daemon is gone at its end, and shows the daemon's log of that
+// test when it failed.
+class SharedDaemonTest : public ::testing::Test {
+protected:
+    static void SetUpTestSuite();
+    static void TearDownTestSuite();
+    void SetUp() override;
+    void TearDown() override;
+
+    static DaemonHarness& daemon() { return *harness_; }
+
+private:
+    static std::unique_ptr<DaemonHarness> harness_;
+    std::size_t logStart_ = 0;
+};
+
+// Prints the daemon's log from `from` on, under a header, for a failed test.
+void dumpLog(const DaemonHarness& harness, std::size_t from);
+// Stops the daemon and fails the calling test unless it exits with status 0.
+void expectCleanStop(DaemonHarness& harness);
 
 } // namespace quarn::test

@@ -5,7 +5,7 @@
 #include "Daemon/platform/CborCodec.h"
 #include "Daemon/platform/IpcFrame.h"
 #include "Daemon/support/Descriptor.h"
-#include "SharedDaemonTest.h"
+#include "DaemonHarness.h"
 #include "common/shared/FrameSocket.h"
 
 #include <fmt/format.h>

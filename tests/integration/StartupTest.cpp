@@ -3,13 +3,15 @@
 
 #include "Client/QRNClientRequests.h"
 #include "Daemon/platform/FirstBootMarker.h"
-#include "SharedDaemonTest.h"
+#include "DaemonHarness.h"
 
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <algorithm>
 #include <cstring>
 #include <fstream>
+#include <iterator>
 
 namespace quarn::test {
 
@@ -33,15 +35,12 @@ protected:
     // Lines of "<run>/notifications/<name>": one per posting.
     std::size_t postings(const char* name) const {
         std::ifstream in(harness_.runDirectory() / "notifications" / name);
-        std::size_t count = 0;
-        for (std::string line; std::getline(in, line);) {
-            ++count;
-        }
-        return count;
+        return static_cast<std::size_t>(
+            std::count(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>(), '\n'));
     }
-
-    // Position of `text` in the current run's log; npos when absent.
-    std::size_t logPosition(std::string_view text) const { return harness_.log().find(text); }
+    bool logged(std::string_view text) const {
+        return harness_.log().find(text) != std::string::npos;
+    }
 
     DaemonHarness harness_;
 };
@@ -61,11 +60,9 @@ public:
     // Whether READY=1 is among the messages received so far.
     bool readyReceived() {
         char message[4096];
-        ssize_t n;
-        while ((n = ::recv(fd_.get(), message, sizeof message, 0)) > 0) {
-            ready_ =
-                ready_ || std::string_view(message, static_cast<std::size_t>(n)).find("READY=1") !=
-                              std::string_view::npos;
+        for (ssize_t n; (n = ::recv(fd_.get(), message, sizeof message, 0)) > 0;) {
+            ready_ |= std::string_view(message, static_cast<std::size_t>(n)).find("READY=1") !=
+                      std::string_view::npos;
         }
         return ready_;
     }
@@ -85,14 +82,14 @@ TEST_F(Startup, FirstBootWorkRunsOnlyWhileTheMarkerIsAbsent) {
     ASSERT_TRUE(waitUntil(
         [&] { return postings(kRebootCleanupComplete) == 1 && postings(kCleanupComplete) == 1; }));
     EXPECT_TRUE(marker.exists());
-    EXPECT_NE(logPosition("quarnd performing first boot initialization"), std::string::npos);
+    EXPECT_TRUE(logged("quarnd performing first boot initialization"));
     expectCleanStop(harness_);
 
     // Started again in the same boot: the marker is there, so only the boot work runs.
     ASSERT_TRUE(harness_.start());
     ASSERT_TRUE(waitUntil([&] { return postings(kCleanupComplete) == 2; }));
     EXPECT_EQ(postings(kRebootCleanupComplete), 1u);
-    EXPECT_EQ(logPosition("first boot"), std::string::npos);
+    EXPECT_FALSE(logged("first boot"));
 }
 
 TEST_F(Startup, ClientConnectingDuringInitialisationIsServedAfterIt) {
