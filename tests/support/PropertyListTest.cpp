@@ -151,14 +151,13 @@ TEST(PropertyList, TruncatedOrCorruptBytesGiveErrorsNotCrashes) {
                        "<string>x</string><date>2001-01-01T00:00:00Z</date><data>AA==</data>"
                        "</array></dict></plist>");
     std::mt19937 random(1234);
-    for (const Bytes& base : {good, xml}) {
+    for (const Bytes& base : {good, xml})
         for (int i = 0; i < 3000; ++i) {
             Bytes b = base;
             for (int j = 0; j < 1 + static_cast<int>(random() % 4); ++j)
                 b[random() % b.size()] = static_cast<std::uint8_t>(random());
             (void)valueFromPropertyListBytes(b);
         }
-    }
 }
 
 TEST(PropertyList, RefusesHostileBytesWithTheReason) {
@@ -310,20 +309,15 @@ TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
             write(dir_ / name, *text);
         auto value = QRN_dictionaryWithContentsOfURL(dir_ / name);
         auto tree = QRN_dictionaryNodeWithContentsOfFile((dir_ / name).native());
-        ASSERT_FALSE(value);
-        ASSERT_FALSE(tree);
-        EXPECT_EQ(value.error().domain, domain);
-        EXPECT_EQ(value.error().code, code) << value.error().message;
-        EXPECT_EQ(tree.error().domain, domain);
-        EXPECT_EQ(tree.error().code, code);
+        ASSERT_FALSE(value || tree);
+        EXPECT_TRUE(value.error().domain == domain && value.error().code == code)
+            << value.error().message;
+        EXPECT_TRUE(tree.error().domain == domain && tree.error().code == code);
         EXPECT_EQ(tree.error().message, value.error().message);
     }
-    write(dir_ / "xml", "<plist><dict><key>Class</key><integer>2</integer>"
-                        "<key>QRNMetadataVersion</key><string>2</string></dict></plist>");
     write(dir_ / "dated", "<plist><dict><key>When</key><date>2020-01-01T00:00:00Z</date>"
                           "</dict></plist>");
-    EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / "xml").value_or(Value()), dict_);
-    for (const char* name : {"real", "xml", "dated"}) {
+    for (const char* name : {"real", "dated"}) {
         SCOPED_TRACE(name);
         auto value = QRN_dictionaryWithContentsOfURL(dir_ / name);
         auto tree = QRN_dictionaryNodeWithContentsOfFile((dir_ / name).native());

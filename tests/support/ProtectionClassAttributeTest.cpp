@@ -48,7 +48,7 @@ protected:
 
 } // namespace
 
-TEST_F(ProtectionClassAttributeTest, RoundTripsOnFilesAndDirectories) {
+TEST_F(ProtectionClassAttributeTest, RoundTripsOnFilesAndDirectoriesInTheRightNamespace) {
     ASSERT_EQ(geteuid(), 0u) << "these tests run as root";
     fs::create_directory(dir_ / "d");
     for (int fd : {open(dir_ / "f"), open(dir_ / "d", O_RDONLY | O_DIRECTORY)}) {
@@ -63,6 +63,11 @@ TEST_F(ProtectionClassAttributeTest, RoundTripsOnFilesAndDirectories) {
     ASSERT_EQ(getxattr((dir_ / "f").c_str(), "trusted.quarn.protection_class", text, sizeof text),
               2);
     EXPECT_STREQ(text, "14");
+    // Unprivileged processes use the user namespace.
+    ASSERT_EQ(seteuid(65534), 0);
+    std::string name = P::attributeName();
+    ASSERT_EQ(seteuid(0), 0);
+    EXPECT_EQ(name, "user.quarn.protection_class");
 }
 
 TEST_F(ProtectionClassAttributeTest, ItemsThatCannotHoldAClassReportBadDescriptor) {
@@ -89,11 +94,4 @@ TEST_F(ProtectionClassAttributeTest, RejectsBadClassesAndCorruptValues) {
         ASSERT_EQ(fsetxattr(fd, P::attributeName(), stored.data(), stored.size(), 0), 0);
         EXPECT_EQ(classOf(fd), -EINVAL) << "stored \"" << stored << "\"";
     }
-}
-
-TEST_F(ProtectionClassAttributeTest, UnprivilegedProcessesUseTheUserNamespace) {
-    ASSERT_EQ(seteuid(65534), 0);
-    std::string name = P::attributeName();
-    ASSERT_EQ(seteuid(0), 0);
-    EXPECT_EQ(name, "user.quarn.protection_class");
 }

@@ -4,14 +4,11 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <functional>
 #include <future>
 #include <latch>
 #include <memory>
-#include <mutex>
 #include <stdexcept>
 #include <thread>
 #include <vector>
@@ -28,20 +25,6 @@ struct Gate {
     std::shared_future<void> future = promise.get_future().share();
     void open() { promise.set_value(); }
     bool wait() const { return future.wait_for(30s) == std::future_status::ready; }
-};
-
-// Counts concurrently running blocks and remembers the peak.
-struct Occupancy {
-    std::mutex mutex;
-    int now = 0, peak = 0;
-    void enter() {
-        std::lock_guard guard(mutex);
-        peak = std::max(peak, ++now);
-    }
-    void leave() {
-        std::lock_guard guard(mutex);
-        --now;
-    }
 };
 
 } // namespace
@@ -99,18 +82,21 @@ TEST(Queue, RunsUpToItsWidthAtOnce) {
     EXPECT_GE(Queue("default", Queue::Kind::Concurrent).width(), 2u);
     for (auto [kind, width] : {std::pair{Queue::Kind::Serial, 1}, {Queue::Kind::Concurrent, 3}}) {
         Queue q("wide", kind, width);
-        Occupancy occupancy;
         std::latch together(width);
+        std::atomic<int> now{0}, over{0}, full{0};
         for (int i = 0; i < 10 * width; ++i)
             q.async([&, i] {
-                occupancy.enter();
+                int n = ++now;
+                over += n > width;
+                full += n == width;
                 if (i < width)
                     together.arrive_and_wait();
                 std::this_thread::yield();
-                occupancy.leave();
+                --now;
             });
         q.barrierSync([] {});
-        EXPECT_EQ(occupancy.peak, width);
+        EXPECT_EQ(over.load(), 0);
+        EXPECT_GT(full.load(), 0);
     }
 }
 
@@ -152,7 +138,6 @@ TEST(Queue, SuspendHoldsWorkQueuedBeforeAndAfterAndNests) {
     EXPECT_EQ(q.runPending(), 0u);
     q.resume();
     EXPECT_EQ(q.runPending(), 0u) << "one resume of two suspensions must not release";
-    EXPECT_TRUE(order.empty());
     q.resume();
     EXPECT_EQ(q.runPending(), 2u);
     EXPECT_EQ(order, (std::vector<int>{1, 2}));
