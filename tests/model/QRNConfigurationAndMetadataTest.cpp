@@ -20,21 +20,6 @@ using quarn::test::TempRoot;
 
 namespace {
 
-struct Stat {
-    bool exists = false;
-    mode_t mode = 0;
-    uid_t uid = 0;
-    gid_t gid = 0;
-};
-
-Stat statOf(const std::filesystem::path& p) {
-    struct stat st {};
-    if (lstat(p.c_str(), &st) != 0) {
-        return {};
-    }
-    return {S_ISDIR(st.st_mode), st.st_mode & 07777, st.st_uid, st.st_gid};
-}
-
 std::string protectionClassOf(const std::filesystem::path& p) {
     char buf[32] = {};
     ssize_t n = getxattr(p.c_str(), "trusted.quarn.protection_class", buf, sizeof(buf) - 1);
@@ -43,12 +28,12 @@ std::string protectionClassOf(const std::filesystem::path& p) {
 
 // A directory made by the configuration: mode 0755 and the owner given.
 void expectDirectory(const std::filesystem::path& p, uid_t owner) {
-    SCOPED_TRACE(p.string());
-    Stat s = statOf(p);
-    ASSERT_TRUE(s.exists);
-    EXPECT_EQ(s.mode, 0755u);
-    EXPECT_EQ(s.uid, owner);
-    EXPECT_EQ(s.gid, owner);
+    struct stat st {};
+    ASSERT_EQ(lstat(p.c_str(), &st), 0) << p;
+    EXPECT_TRUE(S_ISDIR(st.st_mode)) << p;
+    EXPECT_EQ(st.st_mode & 07777, 0755u) << p;
+    EXPECT_EQ(st.st_uid, owner) << p;
+    EXPECT_EQ(st.st_gid, owner) << p;
 }
 
 std::vector<char> bytesOf(const std::filesystem::path& p) {
@@ -315,23 +300,19 @@ TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
         << log.all();
     EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), false));
 
-    // Transient containers sit in the class's transient directory.
-    const UUID transientUUID = UUID::random();
-    auto transientDir =
-        *config().containerDirectoryURLForUserIdentity(mobile(), 2, true) / transientUUID.string();
-    std::filesystem::create_directories(transientDir);
-    ASSERT_TRUE(record(mobile(), 2, transientUUID, transientDir)
-                    .writeMetadataToFileURL(transientDir / QRNMetadata::kFileName));
-    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(transientDir / QRNMetadata::kFileName,
-                                                              mobile(), true));
-
-    // Global classes are checked against the shared containers directory.
-    const UUID bundleUUID = UUID::random();
-    auto bundleDir = containerDir(mobile(), 1, bundleUUID);
-    ASSERT_TRUE(record(mobile(), 1, bundleUUID, bundleDir)
-                    .writeMetadataToFileURL(bundleDir / QRNMetadata::kFileName));
-    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(bundleDir / QRNMetadata::kFileName,
-                                                              mobile(), true));
+    // Transient containers sit in the class's transient directory; global
+    // classes are checked against the shared containers directory.
+    for (const auto& [cls, transient] : {std::pair<std::uint64_t, bool>{2, true}, {1, false}}) {
+        const UUID id = UUID::random();
+        const auto at =
+            *config().containerDirectoryURLForUserIdentity(mobile(), cls, transient) / id.string();
+        std::filesystem::create_directories(at);
+        ASSERT_TRUE(
+            record(mobile(), cls, id, at).writeMetadataToFileURL(at / QRNMetadata::kFileName));
+        EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(at / QRNMetadata::kFileName,
+                                                                  mobile(), true))
+            << cls;
+    }
 }
 
 TEST_F(QRNGlobalConfigurationTest, GlobalDirectoriesPathsModesOwners) {
@@ -363,7 +344,7 @@ TEST_F(QRNGlobalConfigurationTest, GlobalDirectoriesPathsModesOwners) {
     }
     EXPECT_EQ(config().legacyTransientBundleDirectory(),
               root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd");
-    EXPECT_FALSE(statOf(config().legacyTransientBundleDirectory()).exists);
+    EXPECT_FALSE(std::filesystem::exists(config().legacyTransientBundleDirectory()));
 }
 
 TEST_F(QRNGlobalConfigurationTest, PerUserDirectoriesBelongToTheUser) {
@@ -387,7 +368,7 @@ TEST_F(QRNGlobalConfigurationTest, PerUserDirectoriesBelongToTheUser) {
         if (created) {
             expectDirectory(home() / path, 501);
         } else {
-            EXPECT_FALSE(statOf(home() / path).exists) << path;
+            EXPECT_FALSE(std::filesystem::exists(home() / path)) << path;
         }
     }
 }
