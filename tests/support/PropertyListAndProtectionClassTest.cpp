@@ -5,8 +5,11 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -16,6 +19,7 @@
 
 using namespace quarn;
 namespace fs = std::filesystem;
+using P = ProtectionClassAttribute;
 
 namespace {
 
@@ -201,15 +205,30 @@ TEST(PropertyList, RefusesHostileBytesWithTheReason) {
 
 namespace {
 
-class PropertyListFileTest : public ::testing::Test {
+// A scratch directory, and the descriptors a test opened in it.
+class FileTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        std::string tmpl = (fs::temp_directory_path() / "quarn-plist.XXXXXX").string();
+        std::string tmpl = (fs::temp_directory_path() / "quarn-support.XXXXXX").string();
         ASSERT_NE(mkdtemp(tmpl.data()), nullptr);
         dir_ = tmpl;
     }
-    void TearDown() override { fs::remove_all(dir_); }
-
+    void TearDown() override {
+        for (int fd : fds_)
+            close(fd);
+        fs::remove_all(dir_);
+    }
+    int open(const fs::path& p, int flags = O_RDWR | O_CREAT) {
+        int fd = ::open(p.c_str(), flags | O_CLOEXEC, 0600);
+        EXPECT_GE(fd, 0) << p << ": " << std::strerror(errno);
+        fds_.push_back(fd);
+        return fd;
+    }
+    // The class, or minus the error.
+    static int classOf(int fd) {
+        auto r = P::getProtectionClass(fd);
+        return r ? *r : -r.error();
+    }
     std::set<std::string> entries() const {
         std::set<std::string> names;
         for (const auto& e : fs::directory_iterator(dir_))
@@ -223,22 +242,16 @@ protected:
     void write(const fs::path& p, std::string_view text) const {
         std::ofstream(p, std::ios::binary) << text;
     }
-    static int protectionClassOf(const fs::path& p) {
-        int fd = open(p.c_str(), O_RDONLY | O_CLOEXEC);
-        int cls = ProtectionClassAttribute::getProtectionClass(fd).value_or(-1);
-        close(fd);
-        return cls;
-    }
 
     fs::path dir_;
+    std::vector<int> fds_;
     Value dict_ = Value::Dictionary{{"QRNMetadataVersion", "2"}, {"Class", 2u}};
 };
 
 } // namespace
 
-TEST_F(PropertyListFileTest, WritesReplaceTheFileAndLeaveNothingBehind) {
+TEST_F(FileTest, PropertyListWritesReplaceTheFileAndLeaveNothingBehind) {
     // Each over an older, longer file (in place: truncated); a class only when asked.
-    using P = ProtectionClassAttribute;
     const std::tuple<const char*, WriteOptions, int> writes[] = {
         {"atomic", {.atomic = true, .lowestProtection = true, .fsync = true}, P::kLowestClass},
         {"inPlace", {.lowestProtection = true}, P::kLowestClass},
@@ -248,13 +261,13 @@ TEST_F(PropertyListFileTest, WritesReplaceTheFileAndLeaveNothingBehind) {
         write(dir_ / name, std::string(10000, 'x'));
         ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / name, options));
         EXPECT_EQ(contents(dir_ / name).substr(0, 8), "bplist00");
-        EXPECT_EQ(protectionClassOf(dir_ / name), protectionClass);
+        EXPECT_EQ(classOf(open(dir_ / name, O_RDONLY)), protectionClass);
         EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / name).value_or(Value()), dict_);
     }
     EXPECT_EQ(entries(), (std::set<std::string>{"atomic", "inPlace", "plain"}));
 }
 
-TEST_F(PropertyListFileTest, FailedWritesLeaveTheOldFileAlone) {
+TEST_F(FileTest, PropertyListFailedWritesLeaveTheOldFileAlone) {
     fs::path file = dir_ / "keep.plist";
     write(file, "old");
     Value unwritable = Value::Dictionary{{"bad", std::string("a\0b", 3)}};
@@ -279,7 +292,7 @@ TEST_F(PropertyListFileTest, FailedWritesLeaveTheOldFileAlone) {
 
 // The Value reader and the tree reader refuse the same files with the same
 // error, and read the others to the same dictionary.
-TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
+TEST_F(FileTest, PropertyListReadingReportsWhatIsWrong) {
     ASSERT_TRUE(QRN_writeToURL(dict_, dir_ / "real"));
     fs::create_symlink(dir_ / "real", dir_ / "link");
     ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0); // must not block
@@ -324,6 +337,54 @@ TEST_F(PropertyListFileTest, ReadingReportsWhatIsWrong) {
         ASSERT_TRUE(value && tree);
         EXPECT_TRUE(checkPropertyList(tree->get()));
         EXPECT_EQ(valueFromPropertyList(tree->get()).value_or(Value()), *value);
+    }
+}
+
+TEST_F(FileTest, ProtectionClassRoundTripsOnFilesAndDirectoriesInTheRightNamespace) {
+    ASSERT_EQ(geteuid(), 0u) << "these tests run as root";
+    fs::create_directory(dir_ / "d");
+    for (int fd : {open(dir_ / "f"), open(dir_ / "d", O_RDONLY | O_DIRECTORY)}) {
+        EXPECT_EQ(classOf(fd), P::kNoClass);
+        for (int cls : {3, 14}) {
+            ASSERT_TRUE(P::setProtectionClass(fd, cls));
+            EXPECT_EQ(classOf(fd), cls);
+        }
+    }
+    // Other tools read the stored form: the decimal text under that name.
+    char text[8] = {};
+    ASSERT_EQ(getxattr((dir_ / "f").c_str(), "trusted.quarn.protection_class", text, sizeof text),
+              2);
+    EXPECT_STREQ(text, "14");
+    // Unprivileged processes use the user namespace.
+    ASSERT_EQ(seteuid(65534), 0);
+    std::string name = P::attributeName();
+    ASSERT_EQ(seteuid(0), 0);
+    EXPECT_EQ(name, "user.quarn.protection_class");
+}
+
+TEST_F(FileTest, ProtectionClassItemsThatCannotHoldAClassReportBadDescriptor) {
+    open(dir_ / "target");
+    fs::create_symlink(dir_ / "target", dir_ / "link");
+    ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0);
+    for (int fd : {open(dir_ / "link", O_PATH | O_NOFOLLOW),
+                   open(dir_ / "fifo", O_RDWR | O_NONBLOCK), open("/dev/null", O_RDWR), -1}) {
+        EXPECT_EQ(classOf(fd), -EBADF);
+        auto set = P::setProtectionClass(fd, 4);
+        ASSERT_FALSE(set);
+        EXPECT_EQ(set.error(), EBADF);
+    }
+    // The link's target was left alone.
+    EXPECT_EQ(classOf(open(dir_ / "target", O_RDONLY)), P::kNoClass);
+}
+
+TEST_F(FileTest, ProtectionClassRejectsBadClassesAndCorruptValues) {
+    int fd = open(dir_ / "f");
+    auto negative = P::setProtectionClass(fd, -1);
+    ASSERT_FALSE(negative);
+    EXPECT_EQ(negative.error(), EINVAL);
+    for (std::string stored : {"", "abc", "-1", "3x", " 3", "99999999999999999999999"}) {
+        ASSERT_EQ(fsetxattr(fd, P::attributeName(), stored.data(), stored.size(), 0), 0);
+        EXPECT_EQ(classOf(fd), -EINVAL) << "stored \"" << stored << "\"";
     }
 }
 
