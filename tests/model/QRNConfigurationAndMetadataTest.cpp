@@ -467,6 +467,8 @@ TEST(QRNGlobalConfigurationMobile, MobileIdsAreReadOrZeroWithoutTheAccount) {
         EXPECT_TRUE(log.contains(withMobileUser ? "Current mobile user ID is 501, group ID is 501"
                                                 : "Failed to get mobile uid. This is bad"));
         // Role uids never get an identity, so the default falls back to 501.
-        EXPECT_EQ(QRNUserIdentitySharedCache::defaultUserIdentity()->posixUID(), 501u);
+        auto def = QRNUserIdentitySharedCache::defaultUserIdentity();
+        ASSERT_NE(def, nullptr);
+        EXPECT_EQ(def->posixUID(), 501u);
     }
 }

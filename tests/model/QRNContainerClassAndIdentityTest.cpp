@@ -140,7 +140,7 @@ TEST_F(QRNContainerIdentityTest, EqualityFromBothSides) {
     // identity with the same UUID.
     EXPECT_TRUE(a->isEqual(*c) && a->isEqual(*cOther));
     EXPECT_FALSE(c->isEqual(*a));
-    EXPECT_TRUE(c->isEqual(*c2) && c2->isEqual(*c));
+    EXPECT_TRUE(c->isEqual(*c) && c->isEqual(*c2) && c2->isEqual(*c));
     EXPECT_FALSE(c->isEqual(*cOther));
 
     // Equal identities hash alike, so they work as set members.
