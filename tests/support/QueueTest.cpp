@@ -128,19 +128,34 @@ TEST(Queue, BarrierWaitsForEarlierRunsAloneAndHoldsLater) {
     EXPECT_EQ(laterStarted.load(), 3);
 }
 
-TEST(Queue, SuspendHoldsWorkQueuedBeforeAndAfterAndNests) {
-    Queue q("main", Queue::Kind::Manual);
+// A manual queue holds its blocks while suspended (as often as suspended) and
+// runs them on the thread that drives it.
+TEST(Queue, ManualQueueRunsOnTheDrivingThreadUnlessSuspended) {
+    Queue main("main", Queue::Kind::Manual);
     std::vector<int> order;
-    q.async([&] { order.push_back(1); });
-    q.suspend();
-    q.async([&] { order.push_back(2); });
-    q.suspend();
-    EXPECT_EQ(q.runPending(), 0u);
-    q.resume();
-    EXPECT_EQ(q.runPending(), 0u) << "one resume of two suspensions must not release";
-    q.resume();
-    EXPECT_EQ(q.runPending(), 2u);
+    main.async([&] { order.push_back(1); });
+    main.suspend();
+    main.async([&] { order.push_back(2); });
+    main.suspend();
+    EXPECT_EQ(main.runPending(), 0u);
+    main.resume();
+    EXPECT_EQ(main.runPending(), 0u) << "one resume of two suspensions must not release";
+    main.resume();
+    EXPECT_EQ(main.runPending(), 2u);
     EXPECT_EQ(order, (std::vector<int>{1, 2}));
+
+    auto driver = std::this_thread::get_id();
+    bool stop = false;
+    std::atomic<int> onDriver{0};
+    std::jthread other([&] {
+        for (int i = 0; i < 10; ++i)
+            main.async([&] { onDriver += std::this_thread::get_id() == driver; });
+        EXPECT_TRUE(main.sync([&] { return main.isCurrent(); }));
+        main.async([&] { stop = true; });
+    });
+    main.runUntil([&] { return stop; });
+    other.join();
+    EXPECT_EQ(onDriver.load(), 10);
 }
 
 TEST(Queue, SuspendFromInsideLetsTheRunningBlockFinish) {
@@ -189,22 +204,6 @@ TEST(Queue, DestructionRunsQueuedWorkUnlessSuspended) {
             EXPECT_EQ(ran.load(), suspended ? 0 : 102);
             EXPECT_EQ(owned.use_count(), 1);
         }
-}
-
-TEST(Queue, ManualQueueRunsOnTheDrivingThread) {
-    Queue main("main", Queue::Kind::Manual);
-    auto driver = std::this_thread::get_id();
-    bool stop = false;
-    std::atomic<int> onDriver{0};
-    std::jthread other([&] {
-        for (int i = 0; i < 10; ++i)
-            main.async([&] { onDriver += std::this_thread::get_id() == driver; });
-        EXPECT_TRUE(main.sync([&] { return main.isCurrent(); }));
-        main.async([&] { stop = true; });
-    });
-    main.runUntil([&] { return stop; });
-    other.join();
-    EXPECT_EQ(onDriver.load(), 10);
 }
 
 TEST(QueueDeathTest, MisuseStopsTheProcess) {
