@@ -33,24 +33,23 @@ protected:
     }
 };
 
-TEST_F(HandlerGroupsTest, GroupIdentifiersOfTheClientFromItsRecord) {
+TEST_F(HandlerGroupsTest, GroupsOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingBadOnes) {
+    const Value identifiers = groupRequest(14, "ignored");
     setClient(kVellClient, allowed());
-    const Value request = groupRequest(14, "ignored");
-    EXPECT_EQ(*send(request).get("ReplyGroupIdentifiersArray"), Value::array());
+    EXPECT_EQ(*send(identifiers).get("ReplyGroupIdentifiersArray"), Value::array());
     mapping_->appGroups[kVellClient] = arrayOf({Value("group.a"), Value(3u), Value("group.b")});
-    EXPECT_EQ(*send(request).get("ReplyGroupIdentifiersArray"),
+    EXPECT_EQ(*send(identifiers).get("ReplyGroupIdentifiersArray"),
               arrayOf({Value("group.a"), Value("group.b")}));
     mapping_->appGroups[kVellClient] = Value("group.a");
-    EXPECT_EQ(codeOf(request), 11u);
+    EXPECT_EQ(codeOf(identifiers), 11u);
     EXPECT_EQ(QRNGroupManager::defaultManager()
                   .groupContainerIdentifiersForOwnerIdentifier("", 7)
                   .error(),
               11u);
-}
 
-TEST_F(HandlerGroupsTest, GroupContainersOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingBadOnes) {
     // Its lookups take no lock of their own, so two requests that reach the
     // same new group at once would each create one.
+    setClient(kVellClient, Value::dictionary());
     mapping_->appGroups[kVellClient] = arrayOf({Value("group.a"), Value(""), Value("group.b")});
     std::vector<std::int32_t> states;
     mapping_->onQuery = [&states] {
@@ -64,9 +63,9 @@ TEST_F(HandlerGroupsTest, GroupContainersOfAnOwnerAreMadeUnderTheGlobalWriteLock
     EXPECT_TRUE(std::filesystem::is_directory(pathIn(reply, "ReplyGroupContainerDict", "group.a")));
     EXPECT_TRUE(cached("group.b", kQRNContainerClassAppGroup));
     EXPECT_EQ(reply.get("ReplySandboxTokenDict"), nullptr);
-}
+    mapping_->onQuery = nullptr;
 
-TEST_F(HandlerGroupsTest, AnotherOwnersGroupsNeedALookupGrant) {
+    // Another owner's groups need a lookup grant.
     mapping_->appGroups["com.example.owner"] = arrayOf({Value("group.o")});
     EXPECT_EQ(codeOf(groupRequest(13, "com.example.owner")), 55u);
     EXPECT_FALSE(cached("group.o", kQRNContainerClassAppGroup));
@@ -74,36 +73,27 @@ TEST_F(HandlerGroupsTest, AnotherOwnersGroupsNeedALookupGrant) {
         kVellClient,
         dictionaryOf({{"com.orvex.private.Quarn.lookup",
                        dictionaryOf({{"appGroup", arrayOf({Value("com.example.owner")})}})}}));
-    Value reply = send(groupRequest(13, "com.example.owner"));
+    reply = send(groupRequest(13, "com.example.owner"));
     EXPECT_FALSE(pathIn(reply, "ReplyGroupContainerDict", "group.o").empty())
         << reply.description();
 }
 
-TEST_F(HandlerGroupsTest, SystemGroupsOfAnOwner) {
+TEST_F(HandlerGroupsTest, SystemGroupsOfAnOwnerAndOneByEntitlementOrWhenOpenToAll) {
     mapping_->systemGroups[kVellClient] = arrayOf({Value("systemgroup.com.example.one")});
-    Value reply = send(groupRequest(16, kVellClient));
+    Value owned = send(groupRequest(16, kVellClient));
     std::filesystem::path path =
-        pathIn(reply, "ReplyGroupContainerDict", "systemgroup.com.example.one");
-    EXPECT_EQ(path.parent_path().parent_path().filename(), "Shared") << reply.description();
-}
+        pathIn(owned, "ReplyGroupContainerDict", "systemgroup.com.example.one");
+    EXPECT_EQ(path.parent_path().parent_path().filename(), "Shared") << owned.description();
 
-TEST_F(HandlerGroupsTest, OneSystemGroupByEntitlementOrWhenOpenToAll) {
     auto one = [](const char* group) { return groupRequest(17, group, "GroupIdentifier"); };
     Value logging = send(one("systemgroup.com.orvex.sharedpclogging"));
     EXPECT_EQ(replyError(logging), 1u) << logging.description();
     EXPECT_TRUE(std::filesystem::is_directory(*logging.get("ReplyPath")->asString()));
-
     Value wellknown = send(one("systemgroup.com.orvex.pairing"));
     ASSERT_EQ(replyError(wellknown), 1u);
     EXPECT_EQ(std::filesystem::path(*wellknown.get("ReplyPath")->asString()).filename(),
               "systemgroup.com.orvex.pairing");
-
-    LogCapture log;
     EXPECT_EQ(codeOf(one("systemgroup.com.example.secret")), 55u);
-    EXPECT_TRUE(log.contains("com.example.vellclient is not entitled for system group identifier: "
-                             "systemgroup.com.example.secret.  Only entitled for: []"))
-        << log.all();
-
     mapping_->systemGroups[kVellClient] = arrayOf({Value("systemgroup.com.example.secret")});
     Value entitled = send(one("systemgroup.com.example.secret"));
     EXPECT_EQ(replyError(entitled), 1u);
@@ -145,7 +135,6 @@ protected:
 };
 
 TEST_F(SandboxTokenTest, OnlySandboxedEnterpriseClientsGetTokens) {
-    LogCapture log;
     auto sandboxed = client(enterprise(), true);
     Value data = createIn(2, *sandboxed);
     const std::string path = *data.get("ReplyPath")->asString();
@@ -160,17 +149,12 @@ TEST_F(SandboxTokenTest, OnlySandboxedEnterpriseClientsGetTokens) {
     // A class without an extension class, the same persona unsandboxed, and
     // a sandboxed client of the personal persona get none.
     EXPECT_EQ(createIn(9, *sandboxed).get("ReplySandboxToken"), nullptr);
-    EXPECT_TRUE(log.contains("is sandboxed and container (type: 9) is enterprise: 1. NOT issuing"));
     EXPECT_EQ(createIn(2, *client(enterprise(), false)).get("ReplySandboxToken"), nullptr);
     EXPECT_EQ(createIn(2, *client(user(), true)).get("ReplySandboxToken"), nullptr);
     EXPECT_EQ(extensions_->tokens.size(), 1u);
 
     extensions_->failing = true;
     EXPECT_EQ(createIn(2, *sandboxed).get("ReplySandboxToken"), nullptr);
-    EXPECT_TRUE(
-        log.contains("issuing a sandbox extension failed for com.example.vellclient at path " +
-                     devicePath + ": 1"))
-        << log.all();
 }
 
 TEST_F(SandboxTokenTest, GroupRepliesCarryTokenAndPersonaDictionariesOnlyWhenNotEmpty) {
