@@ -108,23 +108,23 @@ void stop(pid_t child) {
 
 } // namespace
 
-TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
-    Value plist = entry(self_, "com.orvex.tests");
-    plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
-    plist.set("Sandboxed", true);
+// One entry for this test process, rewritten, removed and made again.
+TEST_F(CodeSigningRegistryTest, FollowsTheEntriesOfTheRunningProcessAndChecksItsDigest) {
+    EXPECT_EQ(identifierOf(), "") << "no directory yet";
+    const Value plist =
+        with(with(entry(self_, "com.orvex.tests"), "Sandboxed", true), "Entitlements",
+             Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
     write("self.plist", plist);
     auto info = registry_.infoForAuditToken(tokenOf(::getpid()));
-    ASSERT_TRUE(info);
+    ASSERT_TRUE(info && info->entitlements);
     EXPECT_EQ(info->identifier, "com.orvex.tests");
     EXPECT_TRUE(info->sandboxed);
-    ASSERT_TRUE(info->entitlements);
-    EXPECT_EQ(*info->entitlements->get("com.orvex.private.Quarn.allowed"), Value(true));
+    EXPECT_EQ(*info->entitlements, *plist.get("Entitlements"));
 
     std::ifstream exe("/proc/self/exe", std::ios::binary);
     write("self.plist",
           with(plist, "SHA256", sha256Hex({std::istreambuf_iterator<char>(exe), {}})));
     EXPECT_EQ(identifierOf(), "com.orvex.tests");
-
     quarn::test::LogCapture log;
     write("self.plist", with(plist, "SHA256", std::string(64, 'a')));
     EXPECT_EQ(identifierOf(), "");
@@ -139,6 +139,35 @@ TEST_F(CodeSigningRegistryTest, MatchesTheRunningProcessAndChecksItsDigest) {
     EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "");
     fields.pid = 0;
     EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "");
+
+    std::filesystem::remove(directory_ / "self.plist");
+    EXPECT_EQ(identifierOf(), "");
+    write("again.plist", entry(self_, "com.orvex.second"));
+    EXPECT_EQ(identifierOf(), "com.orvex.second");
+    std::filesystem::remove_all(directory_);
+    EXPECT_EQ(identifierOf(), "");
+
+    // Lookups during rewrites see one of the versions.
+    write("self.plist", entry(self_, "com.orvex.v0"));
+    std::atomic<bool> done{false};
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> readers;
+    for (int i = 0; i < 4; ++i) {
+        readers.emplace_back([&] {
+            while (!done.load()) {
+                wrong += identifierOf().rfind("com.orvex.v", 0) != 0;
+            }
+        });
+    }
+    for (int version = 1; version <= 50; ++version) {
+        write("self.plist", entry(self_, "com.orvex.v" + std::to_string(version)));
+    }
+    done.store(true);
+    for (auto& reader : readers) {
+        reader.join();
+    }
+    EXPECT_EQ(wrong.load(), 0);
+    EXPECT_EQ(identifierOf(), "com.orvex.v50");
 }
 
 TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotTheProgram) {
@@ -165,21 +194,6 @@ TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotT
     EXPECT_EQ(identifierOf(tokenOf(covered)), "");
     EXPECT_TRUE(log.contains("is not the file")) << log.all();
     stop(covered);
-}
-
-TEST_F(CodeSigningRegistryTest, FollowsTheDirectoryAppearingAndEntriesComingAndGoing) {
-    EXPECT_EQ(identifierOf(), "") << "no directory yet";
-    write("self.plist", entry(self_, "com.orvex.first"));
-    EXPECT_EQ(identifierOf(), "com.orvex.first");
-    std::filesystem::remove(directory_ / "self.plist");
-    EXPECT_EQ(identifierOf(), "");
-    write("again.plist", entry(self_, "com.orvex.second"));
-    EXPECT_EQ(identifierOf(), "com.orvex.second");
-    // The whole directory removed and made again.
-    std::filesystem::remove_all(directory_);
-    EXPECT_EQ(identifierOf(), "");
-    write("third.plist", entry(self_, "com.orvex.third"));
-    EXPECT_EQ(identifierOf(), "com.orvex.third");
 }
 
 TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
@@ -213,30 +227,6 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     EXPECT_TRUE(log.contains("good-2.plist replaces good-1.plist")) << log.all();
     // Not as root, ownership and mode do not matter.
     EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
-}
-
-TEST_F(CodeSigningRegistryTest, ConcurrentLookupsSeeOneOfTheVersions) {
-    write("self.plist", entry(self_, "com.orvex.v0"));
-    const IpcPeer::AuditToken token = tokenOf(::getpid());
-    std::atomic<bool> done{false};
-    std::atomic<int> wrong{0};
-    std::vector<std::thread> readers;
-    for (int i = 0; i < 4; ++i) {
-        readers.emplace_back([&] {
-            while (!done.load()) {
-                wrong += identifierOf(token).rfind("com.orvex.v", 0) != 0;
-            }
-        });
-    }
-    for (int version = 1; version <= 50; ++version) {
-        write("self.plist", entry(self_, "com.orvex.v" + std::to_string(version)));
-    }
-    done.store(true);
-    for (auto& reader : readers) {
-        reader.join();
-    }
-    EXPECT_EQ(wrong.load(), 0);
-    EXPECT_EQ(identifierOf(token), "com.orvex.v50");
 }
 
 TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {

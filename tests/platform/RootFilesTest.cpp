@@ -1,47 +1,56 @@
-// What the platform reads from the root's files: feature switches, host
-// flags, the OS release, the first-boot marker; and the container layout.
+// What the platform reads from and writes to the root's files: feature
+// switches, host flags, the OS release, the first-boot marker, accounts, the
+// lock state and notifications; and the container layout.
 
 #include "Daemon/platform/ContainerLibrary.h"
 #include "Daemon/platform/FirstBootMarker.h"
+#include "Daemon/platform/LinuxAccounts.h"
 #include "Daemon/platform/LinuxFeatures.h"
 #include "Daemon/platform/LinuxHostConfig.h"
+#include "Daemon/platform/LinuxLockState.h"
+#include "Daemon/platform/LinuxNotifications.h"
 #include "Daemon/platform/LinuxOsVariant.h"
+#include "Daemon/support/Descriptor.h"
 
 #include "common/TempRoot.h"
 
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <condition_variable>
+#include <cstring>
+#include <fstream>
+#include <mutex>
 #include <regex>
+#include <string>
+#include <vector>
 
 using namespace quarn;
 
 namespace {
 
 std::string plist(const std::string& body) {
-    return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-           "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-           "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
-           "<plist version=\"1.0\">" +
-           body + "</plist>\n";
+    return "<plist version=\"1.0\">" + body + "</plist>\n";
 }
 // Feature `f` whose dictionary holds `body`.
 std::string feature(const std::string& body) {
     return plist("<dict><key>f</key>" + body + "</dict>");
 }
 
-class FeaturesTest : public quarn::test::TempRootTest {
-protected:
-    bool isEnabled(std::string_view domain) {
-        return root_.context().instance<Features>().isEnabled(domain, "f");
-    }
-    void writeDomain(const std::string& domain, const std::string& contents) {
-        root_.writeFile("/etc/quarnd/features/" + domain + ".plist", contents);
-    }
-};
+using RootFilesTest = quarn::test::TempRootTest;
 
 } // namespace
 
-TEST_F(FeaturesTest, OnlyAnExplicitTrueInAReadableFileSwitchesAFeatureOn) {
+TEST_F(RootFilesTest, OnlyAnExplicitTrueInAFeatureFileOfItsDirectorySwitchesAFeatureOn) {
+    const auto isEnabled = [&](std::string_view domain) {
+        return root_.context().instance<Features>().isEnabled(domain, "f");
+    };
+    const auto writeDomain = [&](const std::string& domain, const std::string& contents) {
+        root_.writeFile("/etc/quarnd/features/" + domain + ".plist", contents);
+    };
     EXPECT_FALSE(isEnabled("quarnd")); // no file
     const std::string on = "<dict><key>Enabled</key><true/></dict>";
     // In this order: the file is read on each question, so switching off takes effect at once.
@@ -69,13 +78,11 @@ TEST_F(FeaturesTest, OnlyAnExplicitTrueInAReadableFileSwitchesAFeatureOn) {
     std::filesystem::remove(root_ / "/etc/quarnd/features/quarnd.plist");
     std::filesystem::create_directory(root_ / "/etc/quarnd/features/quarnd.plist");
     EXPECT_FALSE(isEnabled("quarnd"));
-}
 
-TEST_F(FeaturesTest, DomainsCannotReachOutsideTheFeaturesDirectory) {
-    const std::string on = feature("<dict><key>Enabled</key><true/></dict>");
-    root_.writeFile("/etc/quarnd/escaped.plist", on);
-    writeDomain(".hidden", on);
-    writeDomain("ok", on);
+    // Domains cannot reach outside the features directory.
+    root_.writeFile("/etc/quarnd/escaped.plist", feature(on));
+    writeDomain(".hidden", feature(on));
+    writeDomain("ok", feature(on));
     EXPECT_TRUE(isEnabled("ok"));
     for (std::string_view domain : {"other", "../escaped", ".hidden", ""}) {
         EXPECT_FALSE(isEnabled(domain)) << domain;
@@ -156,55 +163,46 @@ TEST(OsReleaseParsing, ShellQuotingAndLayoutNoiseAreUnderstoodAndMalformedLinesS
     }
 }
 
-namespace {
+TEST_F(RootFilesTest, OsVariantFollowsOsReleaseFallsBackToTheVendorFileAndIgnoresNonFiles) {
+    auto& variant = root_.context().instance<OsVariant>();
+    const auto internal = [&] { return variant.hasInternalContent("com.orvex.quarnd"); };
+    EXPECT_FALSE(internal());
+    EXPECT_EQ(variant.versionDictionary(), Value::dictionary());
+    EXPECT_FALSE(variant.buildVersion());
 
-class OsVariantOnRoot : public quarn::test::TempRootTest {
-protected:
-    OsVariant& variant() { return root_.context().instance<OsVariant>(); }
-    bool internal() { return variant().hasInternalContent("com.orvex.quarnd"); }
-};
-
-} // namespace
-
-TEST_F(OsVariantOnRoot, VersionDictionaryAndInternalFlagComeFromOsRelease) {
     root_.writeFile("/etc/os-release", "NAME=\"Orvex OS\"\nVERSION_ID=\"4.2\"\n"
                                        "BUILD_ID='21A5248v'\nVARIANT_ID=internal\n");
     EXPECT_TRUE(internal());
-    EXPECT_TRUE(variant().hasInternalContent("anything.else"));
-    EXPECT_EQ(variant().versionDictionary(),
+    EXPECT_TRUE(variant.hasInternalContent("anything.else"));
+    EXPECT_EQ(variant.versionDictionary(),
               Value(Value::Dictionary{
                   {"BuildID", "21A5248v"}, {"VersionID", "4.2"}, {"VariantID", "internal"}}));
-    EXPECT_EQ(variant().buildVersion(), "21A5248v");
+    EXPECT_EQ(variant.buildVersion(), "21A5248v");
 
     // Changes are seen without a restart of the daemon's platform.
     root_.writeFile("/etc/os-release", "VARIANT_ID=\"internal-debug\"\nVERSION_ID=5\n");
     EXPECT_FALSE(internal());
-    EXPECT_EQ(variant().versionDictionary(),
+    EXPECT_EQ(variant.versionDictionary(),
               Value(Value::Dictionary{{"VersionID", "5"}, {"VariantID", "internal-debug"}}));
-    EXPECT_FALSE(variant().buildVersion());
+    EXPECT_FALSE(variant.buildVersion());
     root_.writeFile("/etc/os-release", "VARIANT_ID=\"internal\"\n");
     EXPECT_TRUE(internal());
     root_.writeFile("/etc/os-release", "VARIANT_ID=Internal\n");
     EXPECT_FALSE(internal());
-}
 
-TEST_F(OsVariantOnRoot, FallsBackToTheVendorFileFollowsTheUsualLinkAndIgnoresNonFiles) {
-    EXPECT_FALSE(internal());
-    EXPECT_EQ(variant().versionDictionary(), Value::dictionary());
-    EXPECT_FALSE(variant().buildVersion());
-
+    std::filesystem::remove(root_ / "/etc/os-release");
     root_.writeFile("/usr/lib/os-release", "BUILD_ID=vendor\nVARIANT_ID=internal\n");
-    EXPECT_EQ(variant().buildVersion(), "vendor");
+    EXPECT_EQ(variant.buildVersion(), "vendor");
     std::filesystem::create_symlink("../usr/lib/os-release", root_ / "/etc/os-release");
     root_.writeFile("/usr/lib/os-release", "BUILD_ID=linked\n");
-    EXPECT_EQ(variant().buildVersion(), "linked");
+    EXPECT_EQ(variant.buildVersion(), "linked");
 
     // Something other than a file counts as no answer, without falling back.
     std::filesystem::remove(root_ / "/etc/os-release");
     std::filesystem::create_directories(root_ / "/etc/os-release");
     root_.writeFile("/usr/lib/os-release", "BUILD_ID=vendor\nVARIANT_ID=internal\n");
     EXPECT_FALSE(internal());
-    EXPECT_FALSE(variant().buildVersion());
+    EXPECT_FALSE(variant.buildVersion());
 }
 
 TEST(FirstBootMarkerTest, MarkersOfTwoRootsAreIndependent) {
@@ -242,4 +240,325 @@ TEST(ContainerLibrary, SubdirectoriesPerClassParentsFirst) {
         ASSERT_FALSE(r) << cls;
         EXPECT_EQ(r.error(), kQRNErrorUnexpectedContainerType);
     }
+}
+
+// The accounts are read again on each question.
+TEST_F(RootFilesTest, AccountsAreTheRootsOwnWithHomesBelowItMalformedLinesSkipped) {
+    auto& installed = root_.context().instance<Accounts>();
+    auto mobile = installed.userByName("mobile");
+    ASSERT_TRUE(mobile);
+    EXPECT_EQ(std::tie(mobile->uid, mobile->gid), std::make_tuple(501u, 501u));
+    EXPECT_EQ(mobile->homeDirectory, root_.path() / "private/var/mobile");
+    EXPECT_EQ(installed.userByUID(501)->name, "mobile");
+    // uid 0 of the temp root, not of the host.
+    EXPECT_EQ(installed.userByUID(0)->homeDirectory, root_.path() / "private/var/root");
+    EXPECT_EQ(installed.userByName("_installd")->uid, 33u);
+    EXPECT_FALSE(installed.userByUID(4242));
+    for (std::string_view name : std::initializer_list<std::string_view>{
+             "nobody-here", "", "mobil", std::string_view("mobile\0x", 8)}) {
+        EXPECT_FALSE(installed.userByName(name)) << name;
+    }
+
+    auto group = installed.groupByName("systemusers");
+    ASSERT_TRUE(group);
+    EXPECT_EQ(group->gid, quarn::test::kSystemUsersGID);
+    EXPECT_EQ(group->members, std::vector<std::string>{"mobile"});
+    EXPECT_EQ(installed.groupByGID(quarn::test::kSystemUsersGID)->name, "systemusers");
+    EXPECT_TRUE(installed.groupByGID(0)->members.empty());
+    EXPECT_FALSE(installed.groupByName("staff"));
+    EXPECT_FALSE(installed.groupByGID(7777));
+    EXPECT_FALSE(installed.groupByName(""));
+
+    root_.writeFile("/etc/passwd", "garbage without colons\n"
+                                   "\n"
+                                   "nouid:x::5:x:/h:/bin/sh\n"
+                                   "alpha:x:12a:5:x:/h:/bin/sh\n"
+                                   "huge:x:99999999999:5:x:/h:/bin/sh\n"
+                                   "short:x:7\n"
+                                   ":x:9:9::/empty-name:/bin/sh\n"
+                                   "+compat:x:10:10::/p:/bin/sh\n"
+                                   "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n"
+                                   "twin:x:501:20::/second:/bin/sh\n"
+                                   "escape:x:600:600::/private/../../../etc:/bin/sh\n"
+                                   "nohome:x:601:601\n"
+                                   "emptyhome:x:602:602:::\n"
+                                   "relative:x:603:603::var/rel:/bin/sh\n");
+    root_.writeFile("/etc/group", "bad\n"
+                                  "nogid:x::a,b\n"
+                                  ":x:1501:ghost\n"
+                                  "systemusers:x:1501:mobile,,other,\n");
+    LinuxAccounts a{Paths(root_.path())};
+    EXPECT_EQ(a.userByName("mobile")->uid, 501u);
+    EXPECT_EQ(a.userByUID(501)->name, "mobile"); // the first entry of a uid wins
+    EXPECT_EQ(a.userByName("twin")->gid, 20u);
+    for (const char* name : {"nouid", "alpha", "huge", "short", "+compat", "compat", "garbage"}) {
+        EXPECT_FALSE(a.userByName(name)) << name;
+    }
+    for (uid_t uid : {9, 10, 12}) { // nameless, compat marker, bad uid
+        EXPECT_FALSE(a.userByUID(uid)) << uid;
+    }
+    EXPECT_EQ(a.groupByGID(1501)->name, "systemusers");
+    EXPECT_EQ(a.groupByGID(1501)->members, (std::vector<std::string>{"mobile", "other"}));
+    EXPECT_FALSE(a.groupByName("nogid"));
+
+    // Homes that leave the root or are missing are empty.
+    for (const char* name : {"escape", "nohome", "emptyhome"}) {
+        ASSERT_TRUE(a.userByName(name)) << name;
+        EXPECT_TRUE(a.userByName(name)->homeDirectory.empty()) << name;
+    }
+    EXPECT_EQ(a.userByName("relative")->homeDirectory, root_.path() / "var/rel");
+
+    // Entries longer than the first buffer are read whole.
+    std::vector<std::string> many; // ~80 KiB on one line
+    std::string line = "crowd:x:11:";
+    for (int i = 0; i < 3000; ++i) {
+        many.push_back("member-with-a-long-name-" + std::to_string(i));
+        line += (i ? "," : "") + many.back();
+    }
+    root_.writeFile("/etc/group", "before:x:10:a\n" + line + "\nafter:x:12:b\n");
+    const std::string longHome = "/private/var/" + std::string(5000, 'h');
+    root_.writeFile("/etc/passwd",
+                    "long:x:700:700::" + longHome + ":/bin/sh\nnext:x:701:701::/n:\n");
+    EXPECT_EQ(a.groupByName("crowd")->members, many);
+    EXPECT_EQ(a.groupByGID(12)->name, "after"); // the reader did not lose its place
+    EXPECT_EQ(a.userByUID(700)->homeDirectory, root_ / longHome);
+    EXPECT_EQ(a.userByName("next")->uid, 701u);
+
+    // Missing or unreadable files answer nothing.
+    std::filesystem::remove(root_ / "/etc/passwd");
+    std::filesystem::remove(root_ / "/etc/group");
+    EXPECT_FALSE(a.userByName("mobile"));
+    EXPECT_FALSE(a.userByUID(0));
+    EXPECT_FALSE(a.groupByName("systemusers"));
+    EXPECT_FALSE(a.groupByGID(0));
+    std::filesystem::create_directory(root_ / "/etc/passwd");
+    EXPECT_FALSE(a.userByName("mobile"));
+}
+
+TEST(AccountsOnSystemRoot, AsksTheNameServiceAndLeavesHomesAlone) {
+    LinuxAccounts a{Paths("/")};
+    auto root = a.userByUID(0);
+    ASSERT_TRUE(root);
+    EXPECT_EQ(std::tie(root->name, root->gid), std::make_tuple("root", 0u));
+    EXPECT_EQ(root->homeDirectory.string().substr(0, 1), "/");
+    EXPECT_EQ(a.userByName("root")->uid, 0u);
+    auto wheel = a.groupByGID(0);
+    ASSERT_TRUE(wheel);
+    EXPECT_EQ(a.groupByName(wheel->name)->gid, 0u);
+    EXPECT_FALSE(a.userByName("no-such-user-quarn"));
+    EXPECT_FALSE(a.groupByName("no-such-group-quarn"));
+}
+
+namespace {
+
+using V = std::vector<std::int32_t>;
+
+// Collects the states a watch reports, for tests to wait on.
+class Reports {
+public:
+    LockState::Callback callback() {
+        return [this](std::int32_t state) {
+            std::lock_guard guard(mutex_);
+            states_.push_back(state);
+            changed_.notify_all();
+        };
+    }
+    // Waits (generously) until `count` states arrived; 0 answers at once.
+    V waitFor(std::size_t count = 0) {
+        std::unique_lock lock(mutex_);
+        changed_.wait_for(lock, std::chrono::seconds(20), [&] { return states_.size() >= count; });
+        return states_;
+    }
+
+private:
+    std::mutex mutex_; // guards states_
+    std::condition_variable changed_;
+    V states_;
+};
+
+class LockStateTest : public quarn::test::TempRootTest {
+protected:
+    std::filesystem::path runDirectory() const { return Paths(root_.path()).runDirectory(); }
+    std::filesystem::path file() const { return runDirectory() / "lockstate"; }
+
+    void writeInPlace(const std::string& text) const {
+        std::filesystem::create_directories(runDirectory());
+        std::ofstream(file(), std::ios::trunc) << text;
+    }
+    void writeByRename(const std::string& text) const {
+        std::ofstream(runDirectory() / "lockstate.new", std::ios::trunc) << text;
+        std::filesystem::rename(runDirectory() / "lockstate.new", file());
+    }
+    LinuxLockState lock_{Paths(root_.path())};
+};
+
+} // namespace
+
+TEST(LockStateParsing, DecimalStatesOnly) {
+    const std::pair<const char*, std::optional<std::int32_t>> cases[] = {
+        {"0", 0},   {"1\n", 1}, {"  3 \r\n", 3}, {"-2", -2},  {"", {}},    {"\n", {}},
+        {"1x", {}}, {"+1", {}}, {"locked", {}},  {"0x1", {}}, {"1 0", {}}, {"2147483648", {}},
+    };
+    for (const auto& [text, expected] : cases) {
+        EXPECT_EQ(LinuxLockState::parseState(text), expected) << '"' << text << '"';
+    }
+}
+
+TEST_F(LockStateTest, StateFollowsTheFile) {
+    auto& lock = root_.context().instance<LockState>();
+    EXPECT_EQ(lock.state(), LockState::kUnlocked); // no file, no run directory
+    for (const auto& [text, state] : {std::pair<const char*, std::int32_t>{"1\n", 1},
+                                      {"2", 2},
+                                      {"garbage", LinuxLockState::kUnreadable}}) {
+        writeInPlace(text);
+        EXPECT_EQ(lock.state(), state) << text;
+    }
+    // A link planted in place of the file is not believed.
+    std::filesystem::remove(file());
+    root_.writeFile("/elsewhere", "1");
+    std::filesystem::create_symlink(root_ / "/elsewhere", file());
+    EXPECT_EQ(lock.state(), LinuxLockState::kUnreadable);
+}
+
+TEST_F(LockStateTest, WatchSeesWritesRenamesAndRemoval) {
+    Reports reports;
+    ASSERT_TRUE(lock_.startWatching(reports.callback())); // makes the run directory
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(1), V{1});
+    writeInPlace("1"); // no change: not reported
+    root_.writeFile("/private/var/run/quarnd/unrelated", "0");
+    writeByRename("0");
+    EXPECT_EQ(reports.waitFor(2), (V{1, 0}));
+    writeByRename("2");
+    EXPECT_EQ(reports.waitFor(3), (V{1, 0, 2}));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(4), (V{1, 0, 2, 1}));
+    std::filesystem::remove(file());
+    EXPECT_EQ(reports.waitFor(5), (V{1, 0, 2, 1, 0}));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(6), (V{1, 0, 2, 1, 0, 1}));
+    std::filesystem::rename(file(), runDirectory() / "moved-away");
+    EXPECT_EQ(reports.waitFor(7), (V{1, 0, 2, 1, 0, 1, 0}));
+}
+
+TEST_F(LockStateTest, StoppedWatchesAreSilentRestartsWorkAndALostRunDirectoryIsUnlocked) {
+    writeInPlace("1");
+    Reports first, second, third;
+    ASSERT_TRUE(lock_.startWatching(first.callback()));
+    writeInPlace("0"); // the state at the start (1) is not reported, the change is
+    EXPECT_EQ(first.waitFor(1), V{0});
+    ASSERT_TRUE(lock_.startWatching(second.callback())); // replaces the first watch
+    writeInPlace("1");
+    EXPECT_EQ(second.waitFor(1), V{1});
+    lock_.stopWatching();
+    lock_.stopWatching(); // twice is harmless
+    ASSERT_TRUE(lock_.startWatching(third.callback()));
+    std::filesystem::remove_all(runDirectory());
+    EXPECT_EQ(third.waitFor(1), V{0});
+    EXPECT_EQ(lock_.state(), LockState::kUnlocked);
+    // The earlier watches were joined before their replacement started.
+    EXPECT_EQ(first.waitFor(), V{0});
+    EXPECT_EQ(second.waitFor(), V{1});
+}
+
+TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
+    auto lock = std::make_unique<LinuxLockState>(Paths(root_.path()));
+    Reports reports;
+    ASSERT_TRUE(lock->startWatching([&, record = reports.callback()](std::int32_t state) {
+        lock->stopWatching(); // must neither deadlock nor crash
+        record(state);
+    }));
+    writeInPlace("1");
+    EXPECT_EQ(reports.waitFor(1), V{1});
+
+    ASSERT_TRUE(lock->startWatching(reports.callback()));
+    lock.reset(); // with a live watch: the thread must be gone before the object
+    writeInPlace("0");
+    EXPECT_EQ(reports.waitFor(), V{1});
+}
+
+namespace {
+
+std::vector<std::string> linesOf(const std::filesystem::path& file) {
+    std::ifstream in(file);
+    std::vector<std::string> lines;
+    for (std::string line; std::getline(in, line);) {
+        lines.push_back(line);
+    }
+    return lines;
+}
+
+} // namespace
+
+// Each post appends a line to a file named after the notification and,
+// under a service manager, becomes the status line.
+TEST_F(RootFilesTest, NotificationsArePostedAsLinesAndStatusAndBadNamesAndLinksRefused) {
+    LinuxNotifications notifications{Paths(root_.path())};
+    const auto fileFor = [&](std::string_view name) { return notifications.directory() / name; };
+    const auto name = Notifications::kUserInvalidated;
+    ASSERT_FALSE(std::filesystem::exists(Paths(root_.path()).runDirectory()));
+    ASSERT_TRUE(notifications.post(name));
+    ASSERT_TRUE(notifications.post(name));
+    // The platform installs this poster.
+    ASSERT_TRUE(root_.context().instance<Notifications>().post(Notifications::kCleanupComplete));
+
+    EXPECT_EQ(notifications.directory(), root_ / "/private/var/run/quarnd/notifications");
+    const auto lines = linesOf(fileFor(name));
+    ASSERT_EQ(lines.size(), 2u);
+    const std::regex format(
+        R"(\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{6}Z com\.orvex\.quarnd\.user-invalidated)");
+    for (const auto& line : lines) {
+        EXPECT_TRUE(std::regex_match(line, format)) << line;
+    }
+    EXPECT_EQ(linesOf(fileFor(Notifications::kCleanupComplete)).size(), 1u);
+
+    // Stands in for the service manager: a datagram socket named by NOTIFY_SOCKET.
+    const auto path = root_.path() / "notify";
+    const Descriptor fd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    sockaddr_un addr{.sun_family = AF_UNIX, .sun_path = {}};
+    ASSERT_LT(path.native().size(), sizeof addr.sun_path);
+    std::strcpy(addr.sun_path, path.c_str());
+    ASSERT_EQ(::bind(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    ::setenv("NOTIFY_SOCKET", path.c_str(), 1);
+    auto received = [&] {
+        char buffer[512];
+        const ssize_t n = ::recv(fd.get(), buffer, sizeof buffer, MSG_DONTWAIT);
+        return n > 0 ? std::string(buffer, static_cast<std::size_t>(n)) : std::string();
+    };
+
+    const bool posted = bool(notifications.post(Notifications::kUserInvalidated));
+    const std::string status = received();
+    // A refused post tells the manager nothing.
+    const bool refused = !notifications.post("a/b");
+    const std::string afterRefused = received();
+    ::unsetenv("NOTIFY_SOCKET");
+    EXPECT_TRUE(posted);
+    EXPECT_EQ(status, "STATUS=Posted com.orvex.quarnd.user-invalidated");
+    EXPECT_TRUE(refused);
+    EXPECT_EQ(afterRefused, "");
+
+    // Names that are no file names, and planted links.
+    for (std::string_view bad : {"", ".hidden", "..", "../../etc/passwd", "new\nline"}) {
+        auto posted = notifications.post(bad);
+        ASSERT_FALSE(posted) << bad;
+        EXPECT_TRUE(posted.error().isPOSIX(EINVAL)) << bad;
+    }
+    EXPECT_FALSE(notifications.post(std::string(Notifications::kMaxNameLength + 1, 'a')));
+
+    // The directory is a link.
+    const auto elsewhere = root_ / "/elsewhere";
+    std::filesystem::create_directories(elsewhere);
+    std::filesystem::remove_all(notifications.directory());
+    std::filesystem::create_directory_symlink(elsewhere, notifications.directory());
+    EXPECT_FALSE(notifications.post(Notifications::kCleanupComplete));
+    EXPECT_TRUE(std::filesystem::is_empty(elsewhere));
+    // The file is a link to a file the daemon must not append to.
+    std::filesystem::remove(notifications.directory());
+    std::filesystem::create_directories(notifications.directory());
+    root_.writeFile("/elsewhere/victim", "untouched\n");
+    std::filesystem::create_symlink(elsewhere / "victim", fileFor(Notifications::kCleanupComplete));
+    auto throughLink = notifications.post(Notifications::kCleanupComplete);
+    ASSERT_FALSE(throughLink);
+    EXPECT_TRUE(throughLink.error().isPOSIX(ELOOP));
+    EXPECT_EQ(linesOf(elsewhere / "victim"), std::vector<std::string>{"untouched"});
 }

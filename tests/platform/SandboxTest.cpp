@@ -116,31 +116,30 @@ TEST(SandboxExtensionTokenTest, RefusesFieldsThatCannotBeWrittenGarbageAndSecond
     }
 }
 
-namespace {
-
-class SandboxExtensionsTest : public quarn::test::TempRootTest {
-protected:
-    std::filesystem::path keyFile() const {
-        return Paths(root_.path()).runDirectory() / LinuxSandboxExtensions::kKeyFileName;
-    }
-    Token::Key keyFromFile() const {
+// The issuer's key: made in a file of its own (mode 0600) that other
+// issuers share, kept in memory once read, replaced when unusable.
+TEST(SandboxExtensionsTest, IssuesTokensUnderTheKeyOfItsFileAndRefusesEmptyPathAndPidZero) {
+    quarn::test::TempRoot root;
+    const Paths paths(root.path());
+    const auto keyFile = paths.runDirectory() / LinuxSandboxExtensions::kKeyFileName;
+    const auto keyFromFile = [&] {
         struct stat st {};
-        EXPECT_EQ(::stat(keyFile().c_str(), &st), 0);
+        EXPECT_EQ(::stat(keyFile.c_str(), &st), 0);
         EXPECT_EQ(st.st_mode & 07777, 0600u);
-        std::ifstream in(keyFile(), std::ios::binary);
+        std::ifstream in(keyFile, std::ios::binary);
         const std::string bytes{std::istreambuf_iterator<char>(in), {}};
         Token::Key key{};
         EXPECT_EQ(bytes.size(), key.size());
         std::copy_n(bytes.begin(), std::min(bytes.size(), key.size()), key.begin());
         return key;
-    }
-    Paths paths() const { return Paths(root_.path()); }
-};
+    };
+    const auto keyNow = [](LinuxSandboxExtensions& extensions) {
+        auto key = extensions.key();
+        EXPECT_TRUE(key);
+        return key ? *key : Token::Key{};
+    };
 
-} // namespace
-
-TEST_F(SandboxExtensionsTest, IssuesTokensTheKeyFileVerifiesAndRefusesEmptyPathAndPidZero) {
-    LinuxSandboxExtensions extensions(paths());
+    LinuxSandboxExtensions extensions(paths);
     auto peer = IpcPeer::fromPID(::getpid());
     ASSERT_TRUE(peer);
     auto issued = extensions.issueFileExtension(
@@ -151,7 +150,6 @@ TEST_F(SandboxExtensionsTest, IssuesTokensTheKeyFileVerifiesAndRefusesEmptyPathA
     ASSERT_TRUE(fields);
     EXPECT_EQ(fields->pid, static_cast<std::uint32_t>(::getpid()));
     EXPECT_EQ(fields->startTime, IpcPeer::fieldsOfAuditToken(peer->auditToken()).startTime);
-
     IpcPeer::TokenFields kernel = IpcPeer::fieldsOfAuditToken(peer->auditToken());
     kernel.pid = 0;
     for (const auto& [path, token] :
@@ -161,31 +159,21 @@ TEST_F(SandboxExtensionsTest, IssuesTokensTheKeyFileVerifiesAndRefusesEmptyPathA
         ASSERT_FALSE(refused) << path;
         EXPECT_EQ(refused.error().domain, Error::Domain::POSIX) << path;
     }
-}
 
-TEST_F(SandboxExtensionsTest, KeyIsSharedThroughTheFileKeptInMemoryAndReplacedWhenUnusable) {
-    auto keyNow = [](LinuxSandboxExtensions& extensions) {
-        auto key = extensions.key();
-        EXPECT_TRUE(key);
-        return key ? *key : Token::Key{};
-    };
-    LinuxSandboxExtensions first(paths());
-    LinuxSandboxExtensions second(paths());
-    const Token::Key firstKey = keyNow(first);
-    EXPECT_EQ(keyNow(second), firstKey);
-    // Once read, the key no longer depends on the file.
-    std::filesystem::remove(keyFile());
-    EXPECT_EQ(keyNow(first), firstKey);
-
+    const Token::Key key = keyNow(extensions);
+    LinuxSandboxExtensions second(paths);
+    EXPECT_EQ(keyNow(second), key);
+    std::filesystem::remove(keyFile);
+    EXPECT_EQ(keyNow(extensions), key);
     for (const auto& [contents, mode] :
          {std::pair<std::string, mode_t>{"short", 0600},
           std::pair<std::string, mode_t>{std::string(32, 'k'), 0644}}) {
-        std::ofstream(keyFile(), std::ios::binary | std::ios::trunc) << contents;
-        ::chmod(keyFile().c_str(), mode);
-        LinuxSandboxExtensions fresh(paths());
-        const Token::Key key = keyNow(fresh);
-        EXPECT_EQ(keyFromFile(), key);
-        EXPECT_NE(std::string(key.begin(), key.end()), contents);
+        std::ofstream(keyFile, std::ios::binary | std::ios::trunc) << contents;
+        ::chmod(keyFile.c_str(), mode);
+        LinuxSandboxExtensions fresh(paths);
+        const Token::Key freshKey = keyNow(fresh);
+        EXPECT_EQ(keyFromFile(), freshKey);
+        EXPECT_NE(std::string(freshKey.begin(), freshKey.end()), contents);
     }
 }
 
