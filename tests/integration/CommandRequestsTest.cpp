@@ -104,12 +104,16 @@ TEST_F(CommandRequests, EntitlementsFromTheRegistryAdmitClientsToCommands) {
         {P::kLookup, command(6, {{"ContainerClass", 2u}, {"Key", "k"}}), kQRNErrorNotEntitled},
         {P::kWipeBool, wipeOwn, kQRNErrorNotEntitled},
         {P::kWipeArray, wipeOwn, kQRNErrorInvalidCommand},
+        // A program that does not match its digest has no identity at all.
+        {P::kBadDigest, command(0, {{"ContainerClass", 2u}}), kQRNErrorMissingIdentifier},
+        {P::kBadDigest, Requests::containersOfClass(2, false), kQRNErrorNotEntitled},
     };
     for (const Case& c : cases) {
         const Value reply = repliesOf(c.program, {c.request})[0];
         EXPECT_EQ(replyError(reply), c.expected)
             << c.program << " " << c.request.description() << " -> " << reply.description();
     }
+    EXPECT_NE(daemon().log().find("does not match the digest"), std::string::npos);
 }
 
 TEST_F(CommandRequests, UnentitledClientStaysWithinItsOwnIdentity) {
@@ -156,14 +160,6 @@ TEST_F(CommandRequests, CommandsReplyingFromTheirCompletionReplyOnce) {
     const std::filesystem::path deathRow =
         daemon() / "/private/var/root/Library/Caches/com.orvex.quarnd/Dead";
     EXPECT_TRUE(std::filesystem::is_empty(deathRow));
-}
-
-TEST_F(CommandRequests, ProgramNotMatchingItsDigestHasNoIdentity) {
-    const auto replies = repliesOf(P::kBadDigest, {command(0, {{"ContainerClass", 2u}}),
-                                                   Requests::containersOfClass(2, false)});
-    EXPECT_EQ(replyError(replies[0]), kQRNErrorMissingIdentifier);
-    EXPECT_EQ(replyError(replies[1]), kQRNErrorNotEntitled);
-    EXPECT_NE(daemon().log().find("does not match the digest"), std::string::npos);
 }
 
 } // namespace quarn::test
