@@ -394,7 +394,7 @@ protected:
 
 } // namespace
 
-TEST(LockStateParsing, DecimalStatesOnly) {
+TEST_F(LockStateTest, StateFollowsTheFileHoldingOneDecimalState) {
     const std::pair<const char*, std::optional<std::int32_t>> cases[] = {
         {"0", 0},   {"1\n", 1}, {"  3 \r\n", 3}, {"-2", -2},  {"", {}},    {"\n", {}},
         {"1x", {}}, {"+1", {}}, {"locked", {}},  {"0x1", {}}, {"1 0", {}}, {"2147483648", {}},
@@ -402,9 +402,6 @@ TEST(LockStateParsing, DecimalStatesOnly) {
     for (const auto& [text, expected] : cases) {
         EXPECT_EQ(LinuxLockState::parseState(text), expected) << '"' << text << '"';
     }
-}
-
-TEST_F(LockStateTest, StateFollowsTheFile) {
     auto& lock = root_.context().instance<LockState>();
     EXPECT_EQ(lock.state(), LockState::kUnlocked); // no file, no run directory
     for (const auto& [text, state] : {std::pair<const char*, std::int32_t>{"1\n", 1},
@@ -459,9 +456,8 @@ TEST_F(LockStateTest, StoppedWatchesAreSilentRestartsWorkAndALostRunDirectoryIsU
     // The earlier watches were joined before their replacement started.
     EXPECT_EQ(first.waitFor(), V{0});
     EXPECT_EQ(second.waitFor(), V{1});
-}
 
-TEST_F(LockStateTest, CallbackMayStopItsOwnWatchAndDestructionJoins) {
+    // A callback may stop its own watch; destruction joins.
     auto lock = std::make_unique<LinuxLockState>(Paths(root_.path()));
     Reports reports;
     ASSERT_TRUE(lock->startWatching([&, record = reports.callback()](std::int32_t state) {
