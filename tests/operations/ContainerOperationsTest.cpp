@@ -117,32 +117,20 @@ TEST_F(ContainerOperationsTest, InfoValuesAreWrittenReadAndRemovedAndAFailedWrit
 
     // A none value removes the key, from the cache and from the file.
     ASSERT_TRUE(connection_->setInfoValue(Value(), &key, id, true));
-    LogCapture log;
     EXPECT_EQ(connection_->infoValueForKey(&key, id, true).error(), kQRNErrorInfoValueNotFound);
-    EXPECT_TRUE(log.contains("Didn't find info value for key: color")) << log.all();
     EXPECT_EQ(infoOnDisk(made).get("color"), nullptr);
-}
 
-TEST_F(ContainerOperationsTest, InfoOperationsRefuseBadKeysAndMissingContainers) {
-    auto made = create(kClientBundle, kClass);
-    ASSERT_TRUE(made);
     const Value numberKey(7);
-    for (const Value* key : {static_cast<const Value*>(nullptr), &numberKey}) {
-        EXPECT_EQ(
-            connection_->setInfoValue(Value("x"), key, made->containerIdentity(), true).error(),
-            kQRNErrorBadRequestArgument);
-        EXPECT_EQ(connection_->infoValueForKey(key, made->containerIdentity(), true).error(),
+    for (const Value* bad : {static_cast<const Value*>(nullptr), &numberKey}) {
+        EXPECT_EQ(connection_->setInfoValue(Value("x"), bad, id, true).error(),
                   kQRNErrorBadRequestArgument);
+        EXPECT_EQ(connection_->infoValueForKey(bad, id, true).error(), kQRNErrorBadRequestArgument);
     }
-    const Value key("color");
-    LogCapture log;
-    EXPECT_EQ(
-        connection_->setInfoValue(Value("x"), &key, identity("com.absent", kClass), true).error(),
-        kQRNErrorContainerNotFound);
-    EXPECT_TRUE(log.contains("No Container with identity: ")) << log.all();
-    EXPECT_EQ(connection_->metadataWithContainerIdentity(identity("com.absent", kClass)).error(),
+    const auto absent = identity("com.absent", kClass);
+    EXPECT_EQ(connection_->setInfoValue(Value("x"), &key, absent, true).error(),
               kQRNErrorContainerNotFound);
-    EXPECT_TRUE(log.contains("No Container with user identity: ")) << log.all();
+    EXPECT_EQ(connection_->metadataWithContainerIdentity(absent).error(),
+              kQRNErrorContainerNotFound);
 }
 
 TEST_F(ContainerOperationsTest, RecreatedStructureUsesTheRecordedProtectionClass) {
@@ -176,26 +164,20 @@ TEST_F(ContainerOperationsTest, ContainersOfAClassAreListedForTheClientsUser) {
     }
     EXPECT_EQ(identifiers, (std::set<std::string>{"com.example.one", "com.example.two"}));
 
-    LogCapture log;
     for (std::uint64_t invalid : {0ull, 14ull}) {
         EXPECT_EQ(connection_->containersWithClass(invalid, false).error(),
                   kQRNErrorInvalidArgument);
     }
-    EXPECT_TRUE(log.contains("Can't act on an invalid container class: 14")) << log.all();
 }
 
-TEST_F(ContainerOperationsTest, EmptyQueueIsExhaustedAndCompletionKeepsTheHandlersCode) {
+TEST_F(ContainerOperationsTest, CommandsInsertedWhileRunningAreAllRunInOrder) {
     std::uint64_t error = kQRNErrorNone;
-    EXPECT_TRUE(queue_->executeAllUntilExhaustedOrError(error));
-    EXPECT_EQ(error, kQRNErrorNone);
     EXPECT_FALSE(queue_->executeNextCommandWithError(error));
     EXPECT_EQ(error, kQRNErrorCommandQueueExhausted);
     std::uint64_t handlerError = kQRNErrorContainerNotFound;
     EXPECT_TRUE(withQueue(queue_)->completeWithError(handlerError));
     EXPECT_EQ(handlerError, kQRNErrorContainerNotFound) << "a failed request stays failed";
-}
 
-TEST_F(ContainerOperationsTest, CommandsInsertedWhileRunningAreAllRunInOrder) {
     queue_->insertCommand(std::make_shared<ScriptedCommand>(
         "a", ran_, [this](const std::weak_ptr<QRNCommandQueue>& queue, std::uint64_t&) {
             auto self = queue.lock();
@@ -213,7 +195,7 @@ TEST_F(ContainerOperationsTest, CommandsInsertedWhileRunningAreAllRunInOrder) {
             }).join();
             return true;
         }));
-    std::uint64_t error = kQRNErrorNone;
+    error = kQRNErrorNone;
     EXPECT_TRUE(queue_->executeAllUntilExhaustedOrError(error));
     EXPECT_EQ(error, kQRNErrorNone);
     EXPECT_EQ(ran_, (std::vector<std::string>{"a", "b", "c", "d", "e"}));
@@ -233,13 +215,9 @@ TEST_F(ContainerOperationsTest, DeletionHappensWhenTheRequestCompletes) {
     EXPECT_FALSE(fs::exists(made->url()));
     EXPECT_EQ(connection_->metadataWithContainerIdentity(identity(kClientBundle, kClass)).error(),
               kQRNErrorContainerNotFound);
-
-    LogCapture log;
     EXPECT_EQ(request->deleteContainerWithContainerIdentity(identity(kClientBundle, kClass), false)
                   .error(),
               kQRNErrorContainerNotFound);
-    EXPECT_TRUE(log.contains("Failed to lookup existing container to delete-identity: "))
-        << log.all();
 }
 
 TEST_F(ContainerOperationsTest, StagedContainersGoToDeathRowAndLeaveTheCacheVanishedAreSkipped) {
@@ -255,6 +233,24 @@ TEST_F(ContainerOperationsTest, StagedContainersGoToDeathRowAndLeaveTheCacheVani
         EXPECT_TRUE(fs::exists(deathRow() / gone->url().filename() / QRNMetadata::kFileName));
         EXPECT_FALSE(cached(identity(gone->identifier(), kClass)));
     }
+
+    // A failed move to death row removes in place; a failed removal is
+    // logged, not reported, and the container is forgotten all the same.
+    QRNMetadataPtr c = create("com.example.c", kClass);
+    QRNMetadataPtr d = create("com.example.d", kClass);
+    ASSERT_TRUE(c && d);
+    env_->failCall(EnvCall::Rename, 1, EACCES);
+    EXPECT_EQ(stage({identity("com.example.c", kClass)}), kQRNErrorNone);
+    EXPECT_FALSE(fs::exists(c->url()));
+    EXPECT_FALSE(fs::exists(deathRow() / c->url().filename()));
+    LogCapture log;
+    env_->failCall(EnvCall::Rename, 1, EIO);
+    env_->failCallsFrom(EnvCall::Unlink, 1, EBUSY);
+    EXPECT_EQ(stage({identity("com.example.d", kClass)}), kQRNErrorNone);
+    env_->clearFailures();
+    EXPECT_TRUE(log.contains("Failed to delete container at")) << log.all();
+    EXPECT_TRUE(fs::exists(d->url())) << "nothing could be removed";
+    EXPECT_FALSE(cached(identity("com.example.d", kClass)));
 }
 
 TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIdentities) {
@@ -275,25 +271,6 @@ TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIde
     EXPECT_FALSE(cached(identity("com.example.a", kClass)));
     EXPECT_TRUE(cached(identity("com.example.c", kClass)));
     EXPECT_TRUE(fs::exists(c->url() / QRNMetadata::kFileName)) << "later identities untouched";
-}
-
-TEST_F(ContainerOperationsTest, FailedMoveRemovesInPlaceAndAFailedRemovalIsNotReported) {
-    QRNMetadataPtr a = create("com.example.a", kClass);
-    QRNMetadataPtr b = create("com.example.b", kClass);
-    ASSERT_TRUE(a && b);
-    env_->failCall(EnvCall::Rename, 1, EACCES);
-    EXPECT_EQ(stage({identity("com.example.a", kClass)}), kQRNErrorNone);
-    EXPECT_FALSE(fs::exists(a->url()));
-    EXPECT_FALSE(fs::exists(deathRow() / a->url().filename()));
-
-    LogCapture log;
-    env_->failCall(EnvCall::Rename, 1, EIO);
-    env_->failCallsFrom(EnvCall::Unlink, 1, EBUSY);
-    EXPECT_EQ(stage({identity("com.example.b", kClass)}), kQRNErrorNone);
-    env_->clearFailures();
-    EXPECT_TRUE(log.contains("Failed to delete container at")) << log.all();
-    EXPECT_TRUE(fs::exists(b->url())) << "nothing could be removed";
-    EXPECT_FALSE(cached(identity("com.example.b", kClass))) << "but the container is forgotten";
 }
 
 TEST_F(ContainerOperationsTest, TransientBundleKeepsCodeSigningRecordsWhileAPermanentOneExists) {

@@ -49,11 +49,9 @@ protected:
 };
 
 TEST_F(CreateOrLookupTest, LooksUpNothingThenCreatesOnceAndThenFindsWithoutTouchingTheDisk) {
+    entitlementsAskForComplete();
     auto connection = connectionFor(kClientBundle);
-    LogCapture log;
     EXPECT_EQ(codeOf(*connection, kClientBundle, kClass), kQRNErrorContainerNotFound);
-    EXPECT_TRUE(log.contains("Container with identifier: \"com.example.client\" Not Found"))
-        << log.all();
     EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
 
     bool existed = true;
@@ -84,13 +82,7 @@ TEST_F(CreateOrLookupTest, LooksUpNothingThenCreatesOnceAndThenFindsWithoutTouch
     }
     EXPECT_EQ(env_->count(EnvCall::Mkdir) + env_->count(EnvCall::Rename), callsBefore);
     EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
-}
 
-TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtectionClass) {
-    entitlementsAskForComplete();
-    auto made = create(kClientBundle, kClass);
-    ASSERT_TRUE(made);
-    const std::filesystem::path url = made->url();
     EXPECT_EQ(lstatOf(url).st_uid, kMobileUID);
     EXPECT_EQ(lstatOf(url).st_mode & 07777, 0755u);
     EXPECT_EQ(protectionClassOf(url), 0);
@@ -105,15 +97,12 @@ TEST_F(CreateOrLookupTest, DataContainerSubdirectoriesHaveOwnerModeAndProtection
         // The daemon's own item stays readable whatever the lock state.
         EXPECT_EQ(protectionClassOf(url / name), std::string_view(name) == "SystemData" ? 0 : 1);
     }
-}
 
-TEST_F(CreateOrLookupTest, RecreatedStructureIsNeverMadeThroughALinkInTheContainer) {
-    auto made = create(kClientBundle, kClass);
-    ASSERT_TRUE(made);
+    // The default structure is never made again through a link in the container.
     const std::filesystem::path outside = root_.path() / "outside";
     std::filesystem::create_directories(outside);
-    std::filesystem::remove_all(made->url() / "Library");
-    std::filesystem::create_directory_symlink(outside, made->url() / "Library");
+    std::filesystem::remove_all(url / "Library");
+    std::filesystem::create_directory_symlink(outside, url / "Library");
 
     auto recreated = privileged()->recreateDefaultStructureWithContainerIdentity(
         identity(kClientBundle, kClass));
@@ -222,13 +211,8 @@ TEST_F(CreateOrLookupTest, FastSizingSwitchSizesTheNewContainer) {
 TEST_F(CreateOrLookupTest, AnotherIdentifierWithoutRightsIsRefusedBeforeAnyDiskAccess) {
     auto connection = connectionFor(kClientBundle);
     const std::uint64_t before = totalCalls();
-    LogCapture log;
     EXPECT_EQ(codeOf(*connection, "com.other.app", kClass, true), kQRNErrorNotEntitled);
     EXPECT_EQ(totalCalls(), before);
-    EXPECT_TRUE(log.contains(
-        "com.example.client not entitled to retrieve container class 2 with identifier "
-        "com.other.app"))
-        << log.all();
 }
 
 TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
@@ -239,9 +223,12 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
     groups->setAllowGroupIdLookup(true);
     auto widened = connectionFor(kClientBundle);
     widened->setAllowOtherIdLookup(true);
-    auto listed = lookingUp(kClientBundle, "appData", arrayOf({Value("com.other.app")}));
+    // Elements that are not strings are skipped, not the whole list.
+    auto listed = lookingUp(kClientBundle, "appData",
+                            arrayOf({Value(7), Value("com.other.app"), dictionaryOf({})}));
     auto search = connectionFor("com.orvex.searchd");
     auto daemon = connectionFor("com.example.daemon");
+    auto accounts = connectionFor("com.orvex.accountsd");
     const std::uint64_t found = kQRNErrorContainerNotFound, refused = kQRNErrorNotEntitled;
     const struct {
         const char* what;
@@ -273,29 +260,19 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
         {"open to everyone", connectionFor(kClientBundle), "systemgroup.com.orvex.diagnostics",
          kQRNContainerClassSystemGroup, found},
         {"own identifier, other class", daemon, "com.example.daemon", kClass, found},
+        {"own system container, undeclared", daemon, "com.example.daemon",
+         kQRNContainerClassSystemData, refused},
         {"own system container, declared",
          lookingUp("com.example.daemon", "systemData", arrayOf({Value("com.example.daemon")})),
          "com.example.daemon", kQRNContainerClassSystemData, found},
+        {"well-known system client, its own", accounts, "com.orvex.accountsd",
+         kQRNContainerClassSystemData, found},
+        {"well-known system client, another's", accounts, "com.orvex.devicesettings",
+         kQRNContainerClassSystemData, refused},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(codeOf(*c.connection, c.identifier, c.cls), c.code) << c.what;
     }
-
-    LogCapture log;
-    EXPECT_EQ(codeOf(*daemon, "com.example.daemon", kQRNContainerClassSystemData), refused);
-    EXPECT_TRUE(log.contains(
-        "com.example.daemon not entitled for system container with identifier com.example.daemon"))
-        << log.all();
-}
-
-TEST_F(CreateOrLookupTest, WellKnownSystemClientGetsItsSystemContainerOnly) {
-    auto accounts = connectionFor("com.orvex.accountsd");
-    auto made = accounts->createOrLookupContainerWithContainerIdentity(
-        identity("com.orvex.accountsd", kQRNContainerClassSystemData), true, false, true);
-    ASSERT_TRUE(made.has_value()) << made.error();
-    EXPECT_EQ((*made)->url().filename(), "com.orvex.accountsd");
-    EXPECT_EQ(codeOf(*accounts, "com.orvex.devicesettings", kQRNContainerClassSystemData),
-              kQRNErrorNotEntitled);
 }
 
 // Failures: a creation that fails at any step reports that step's code,
@@ -320,33 +297,26 @@ protected:
     }
 };
 
-TEST_F(CreateFailureTest, MissingIdentityIsABadRequest) {
-    LogCapture log;
-    auto made =
-        privileged()->createOrLookupContainerWithContainerIdentity(nullptr, true, false, true);
-    ASSERT_FALSE(made.has_value());
-    EXPECT_EQ(made.error(), kQRNErrorBadRequestArgument);
-    EXPECT_TRUE(log.contains("Cannot lookup a nil container identity.")) << log.all();
-}
-
 TEST_F(CreateFailureTest, EachStepFailsWithItsCodeAndParksTheStagingDirectory) {
+    EXPECT_EQ(privileged()
+                  ->createOrLookupContainerWithContainerIdentity(nullptr, true, false, true)
+                  .error(),
+              kQRNErrorBadRequestArgument);
     const struct {
         const char* what;
         EnvCall call;
         std::uint64_t nth; // renames: the metadata file, then the container into place
         bool throws;
+        bool onwards; // every later call fails too
         std::uint64_t code;
-        const char* message;
     } cases[] = {
-        {"staging", EnvCall::Mkdir, 1, false, kQRNErrorCreateStagingFailed,
-         "Failed to create staging dir at"},
-        {"metadata", EnvCall::Rename, 1, false, kQRNErrorWriteStateFileFailed,
-         "Failed to move metadata from staging"},
-        {"subdirectory", EnvCall::Mkdir, 2, false, kQRNErrorCreateDirFailed,
-         "Failed to create sub-dir for"},
-        {"move into place", EnvCall::Rename, 2, false, kQRNErrorMoveStagingToLiveFailed,
-         "Failed to move staging dir:"},
-        {"exception", EnvCall::Mkdir, 2, true, kQRNErrorException, "Got exception: "},
+        {"staging", EnvCall::Mkdir, 1, false, false, kQRNErrorCreateStagingFailed},
+        {"metadata", EnvCall::Rename, 1, false, false, kQRNErrorWriteStateFileFailed},
+        {"subdirectory", EnvCall::Mkdir, 2, false, false, kQRNErrorCreateDirFailed},
+        {"move into place", EnvCall::Rename, 2, false, false, kQRNErrorMoveStagingToLiveFailed},
+        {"exception", EnvCall::Mkdir, 2, true, false, kQRNErrorException},
+        // The move into place and the move to death row both fail.
+        {"staging cannot be parked", EnvCall::Rename, 2, false, true, kQRNErrorRemoveStagingFailed},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.what);
@@ -357,39 +327,30 @@ TEST_F(CreateFailureTest, EachStepFailsWithItsCodeAndParksTheStagingDirectory) {
                     throw std::runtime_error("injected");
                 }
             });
+        } else if (c.onwards) {
+            env_->failCallsFrom(c.call, c.nth, EIO);
         } else {
             env_->failCall(c.call, c.nth, EIO);
         }
-        LogCapture log;
+        const bool unparked = c.code == kQRNErrorRemoveStagingFailed;
         EXPECT_EQ(createCode(), c.code);
-        EXPECT_TRUE(log.contains(c.message)) << log.all();
-        EXPECT_TRUE(!c.throws || log.contains("injected")) << log.all();
         EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
-        EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
+        EXPECT_EQ(namesIn(stagingDirectory(kClass)).size(), unparked ? 1u : 0u);
         // The staging directory is parked on death row once it was made.
         const auto parked = namesOnDeathRow();
-        ASSERT_EQ(parked.size(), c.code == kQRNErrorCreateStagingFailed ? 0u : 1u);
+        ASSERT_EQ(parked.size(), c.code == kQRNErrorCreateStagingFailed || unparked ? 0u : 1u);
         EXPECT_TRUE(parked.empty() || UUID::parse(parked[0]).has_value()) << parked[0];
         expectGlobalLockFree();
         env_->setHook(nullptr);
         env_->clearFailures();
-        for (const std::string& unique : namesIn(deathRow())) {
-            std::filesystem::remove_all(deathRow() / unique);
+        for (const Path& directory : {deathRow(), stagingDirectory(kClass)}) {
+            for (const std::string& name : namesIn(directory)) {
+                std::filesystem::remove_all(directory / name);
+            }
         }
     }
     // Nothing of the failures stands in the way of the next creation.
     EXPECT_EQ(createCode(), kQRNErrorNone);
-}
-
-TEST_F(CreateFailureTest, StagingThatCannotBeParkedIsReported) {
-    // The move into place and the move to death row both fail.
-    env_->failCallsFrom(EnvCall::Rename, 2, EIO);
-    LogCapture log;
-    EXPECT_EQ(createCode(), kQRNErrorRemoveStagingFailed);
-    EXPECT_TRUE(log.contains("Failed to remove staging dir:")) << log.all();
-    EXPECT_TRUE(namesIn(classDirectory(kClass)).empty());
-    EXPECT_EQ(namesIn(stagingDirectory(kClass)).size(), 1u);
-    expectGlobalLockFree();
 }
 
 TEST_F(CreateFailureTest, OldTransientContainerThatCannotBeRemovedStopsTheCreation) {
@@ -397,9 +358,7 @@ TEST_F(CreateFailureTest, OldTransientContainerThatCannotBeRemovedStopsTheCreati
     const auto before = namesIn(classDirectory(kClass, true));
     ASSERT_EQ(before.size(), 1u);
     env_->failCallsFrom(EnvCall::Rename, 1, EIO);
-    LogCapture log;
     EXPECT_EQ(createCode(true), kQRNErrorRemoveTransientFailed);
-    EXPECT_TRUE(log.contains("Failed to remove transient container at")) << log.all();
     EXPECT_EQ(namesIn(classDirectory(kClass, true)), before);
     EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
     expectGlobalLockFree();
@@ -415,9 +374,7 @@ TEST_F(CreateFailureTest, CacheThatRefusesTheNewContainerLeavesItInPlace) {
             env_->failCallsFrom(EnvCall::OpenDir, 1, EIO);
         }
     });
-    LogCapture log;
     EXPECT_EQ(createCode(), kQRNErrorCacheAddFailed);
-    EXPECT_TRUE(log.contains("Failed to add to cache : ")) << log.all();
     EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
     EXPECT_TRUE(namesOnDeathRow().empty());
     expectGlobalLockFree();

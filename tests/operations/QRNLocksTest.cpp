@@ -276,15 +276,12 @@ protected:
     void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
 
-TEST_F(QRNLocksDeathTest, WrongArgumentTypesStopTheProcess) {
+TEST_F(QRNLocksDeathTest, WrongArgumentTypesAndBrokenBookkeepingStopTheProcess) {
     EXPECT_DEATH(locks.read_lock_identifier(Value(std::uint64_t{5})), "Unknown parameter type!");
     EXPECT_DEATH(locks.write_lock_identifier(Value::dictionary()), "Unknown parameter type!");
     EXPECT_DEATH(locks.unlock_identifier(Value()), "Unknown parameter type!");
     EXPECT_DEATH(locks.write_lock_identifier(Value(Value::Array{"a", 7})),
                  "Unknown parameter type!");
-}
-
-TEST_F(QRNLocksDeathTest, BrokenBookkeepingStopsTheProcess) {
     EXPECT_DEATH(locks.unlock_identifier("x"),
                  "gQRNLocks\\.identifierToLockMap\\), function unlock_one_lock, file "
                  "Daemon/QRNLocks");
