@@ -9,13 +9,11 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <limits>
 #include <optional>
 #include <random>
-#include <set>
 
 using namespace quarn;
 namespace fs = std::filesystem;
@@ -55,6 +53,15 @@ Bytes arrayOf(std::vector<std::uint16_t> refs) {
     for (auto r : refs)
         o.insert(o.end(), {static_cast<std::uint8_t>(r >> 8), static_cast<std::uint8_t>(r)});
     return o;
+}
+
+// Levels of arrays, each referring `fanOut` times to the next, down to an integer.
+Bytes nested(std::uint16_t levels, std::size_t fanOut = 1) {
+    std::vector<Bytes> objects;
+    for (std::uint16_t i = 1; i < levels; ++i)
+        objects.push_back(arrayOf(std::vector<std::uint16_t>(fanOut, i)));
+    objects.push_back({0x10, 0x05});
+    return binaryFrom(objects);
 }
 
 } // namespace
@@ -132,9 +139,9 @@ TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
                              Value(Date{k2001 + 70LL * 365 * 86400 * 1000000}),
                              Value(Date{std::numeric_limits<std::int64_t>::min()}), deep}) {
         auto r = binaryPropertyList(Value::Array{bad});
-        ASSERT_FALSE(r) << bad.description();
-        EXPECT_EQ(r.error().domain, Error::Domain::General);
-        EXPECT_EQ(r.error().code, kGeneralErrorPropertyListWriteInvalid);
+        EXPECT_TRUE(!r && r.error().domain == Error::Domain::General &&
+                    r.error().code == kGeneralErrorPropertyListWriteInvalid)
+            << bad.description();
     }
 }
 
@@ -158,26 +165,14 @@ TEST(PropertyList, TruncatedOrCorruptBytesGiveErrorsNotCrashes) {
 }
 
 TEST(PropertyList, RefusesHostileBytesWithTheReason) {
-    auto chain = [](std::uint16_t levels) {
-        std::vector<Bytes> objects;
-        for (std::uint16_t i = 1; i < levels; ++i)
-            objects.push_back(arrayOf({i}));
-        objects.push_back({0x10, 0x05});
-        return binaryFrom(objects);
-    };
-    EXPECT_TRUE(valueFromPropertyListBytes(chain(100)));
-    // Each level refers twice to the next: 2^40 nodes once expanded.
-    std::vector<Bytes> laughs;
-    for (std::uint16_t i = 1; i <= 40; ++i)
-        laughs.push_back(arrayOf({i, i}));
-    laughs.push_back({0x10, 0x01});
+    EXPECT_TRUE(valueFromPropertyListBytes(nested(100)));
     std::string deepXML = "<plist>";
     for (int i = 0; i < 100000; ++i)
         deepXML += "<array>";
     const std::pair<Bytes, const char*> refusals[] = {
         {bytesOf(deepXML), "nested too deeply"},
-        {chain(5000), "nested too deeply"},
-        {binaryFrom(laughs), "too many objects"},
+        {nested(5000), "nested too deeply"},
+        {nested(41, 2), "too many objects"}, // 2^40 nodes once expanded
         {binaryFrom({arrayOf({0})}), "cycle"},
         {binaryFrom({arrayOf({7})}), "outside"},
         // A keyed-archive UID means nothing outside its archive.
@@ -213,7 +208,7 @@ protected:
     }
     int open(const fs::path& p, int flags = O_RDWR | O_CREAT) {
         int fd = ::open(p.c_str(), flags | O_CLOEXEC, 0600);
-        EXPECT_GE(fd, 0) << p << ": " << std::strerror(errno);
+        EXPECT_GE(fd, 0) << p;
         fds_.push_back(fd);
         return fd;
     }
@@ -222,11 +217,8 @@ protected:
         auto r = P::getProtectionClass(fd);
         return r ? *r : -r.error();
     }
-    std::set<std::string> entries() const {
-        std::set<std::string> names;
-        for (const auto& e : fs::directory_iterator(dir_))
-            names.insert(e.path().filename().string());
-        return names;
+    std::ptrdiff_t entryCount() const {
+        return std::distance(fs::directory_iterator(dir_), fs::directory_iterator());
     }
     std::string contents(const fs::path& p) const {
         std::ifstream in(p, std::ios::binary);
@@ -257,7 +249,7 @@ TEST_F(FileTest, PropertyListWritesReplaceTheFileAndLeaveNothingBehind) {
         EXPECT_EQ(classOf(open(dir_ / name, O_RDONLY)), protectionClass);
         EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / name).value_or(Value()), dict_);
     }
-    EXPECT_EQ(entries(), (std::set<std::string>{"atomic", "inPlace", "plain"}));
+    EXPECT_EQ(entryCount(), 3) << "a staging file was left";
 }
 
 TEST_F(FileTest, PropertyListFailedWritesLeaveTheOldFileAlone) {
@@ -280,7 +272,7 @@ TEST_F(FileTest, PropertyListFailedWritesLeaveTheOldFileAlone) {
     auto r = QRN_writeToURL(dict_, dir_ / "occupied", {.atomic = true});
     ASSERT_FALSE(r);
     EXPECT_EQ(r.error().domain, Error::Domain::POSIX);
-    EXPECT_EQ(entries(), (std::set<std::string>{"keep.plist", "occupied"}));
+    EXPECT_EQ(entryCount(), 2) << "a staging file was left";
 }
 
 // The Value reader and the tree reader refuse the same files with the same
