@@ -4,12 +4,9 @@
 
 #include "CreateFixture.h"
 
-#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNContainerClass.h"
-#include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/platform/SandboxKernel.h"
 #include "Daemon/support/ProcessTransaction.h"
-#include "Daemon/support/Queue.h"
 #include "Daemon/support/UUID.h"
 
 #include <fcntl.h>
@@ -19,7 +16,6 @@
 
 #include <atomic>
 #include <cstring>
-#include <fstream>
 #include <future>
 #include <map>
 #include <set>
@@ -219,35 +215,34 @@ TEST_F(DeathRowTest, SystemContainersGetNewDirectoriesExceptWellKnownAndAnalytic
 
 using BootCleanupTest = DeathRowTest;
 
-TEST_F(BootCleanupTest, StagingLeftoversAreDestroyedAndTheCompletionRunsOnceAfterThem) {
-    const fs::path global = makeTree(configuration().stagingDirectory() / "global-leftover");
-    const fs::path perUser = makeTree(stagingDirectory(kQRNContainerClassAppData) / "leftover");
-    const int calls = runCleanup(false, [&] {
-        EXPECT_FALSE(fs::exists(global)) << "completion ran before the moves";
-        EXPECT_TRUE(namesOnDeathRow().empty()) << "completion ran before the deletion pass";
-    });
-    EXPECT_EQ(calls, 1);
-    EXPECT_FALSE(fs::exists(global) || fs::exists(perUser));
-}
-
-TEST_F(BootCleanupTest, MissingStagingIsSilentAndAnUnreadableOneDoesNotStopTheOthers) {
+TEST_F(BootCleanupTest, StagingLeftoversAreDestroyedBeforeTheCompletionWhateverTheGlobalOneIs) {
     const fs::path global = configuration().stagingDirectory();
+    const fs::path leftover = makeTree(global / "global-leftover");
     const fs::path perUser = stagingDirectory(kQRNContainerClassAppData) / "leftover";
-    fs::remove_all(global);
-    for (bool unreadable : {false, true}) {
-        SCOPED_TRACE(unreadable ? "a file where the directory should be" : "missing");
+    for (const std::string state : {"holding leftovers", "missing", "a file"}) {
+        SCOPED_TRACE(state);
+        const bool unreadable = state == "a file";
         if (unreadable) {
             std::ofstream(global) << "not a directory";
         }
         makeTree(perUser);
         LogCapture log;
-        EXPECT_EQ(runCleanup(false), 1);
+        EXPECT_EQ(runCleanup(false,
+                             [&] {
+                                 EXPECT_FALSE(fs::exists(leftover)) << "completion before moves";
+                                 EXPECT_TRUE(namesOnDeathRow().empty())
+                                     << "completion ran before the deletion pass";
+                             }),
+                  1);
+        EXPECT_FALSE(fs::exists(perUser)) << "the per-user staging was not cleaned";
         EXPECT_EQ(log.contains(unreadable
                                    ? "Failed to get items at global staging URL: " + global.string()
                                    : std::string("staging URL")),
                   unreadable)
             << log.all();
-        EXPECT_FALSE(fs::exists(perUser)) << "the per-user staging was not cleaned";
+        if (!unreadable) {
+            fs::remove_all(global);
+        }
     }
     EXPECT_TRUE(fs::exists(global)) << "the unreadable item itself is left alone";
 }

@@ -8,7 +8,6 @@
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNConcreteContainerIdentity.h"
 #include "Daemon/model/QRNContainerClass.h"
-#include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/operations/QRNCommandQueue.h"
 #include "Daemon/operations/QRNCommandStageForDelete.h"
 

@@ -5,7 +5,6 @@
 #include "CreateFixture.h"
 
 #include "Daemon/fs/QRNFileManager.h"
-#include "Daemon/model/QRNContainerCache.h"
 #include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/operations/QRNLocks.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"

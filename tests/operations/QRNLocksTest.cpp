@@ -1,7 +1,6 @@
 #include "Daemon/operations/QRNLocks.h"
 
 #include "common/LogCapture.h"
-#include "common/TempRoot.h"
 
 #include <gtest/gtest.h>
 
@@ -118,7 +117,15 @@ TEST_F(QRNLocksTest, DuplicatesAreLockedAndReleasedOnce) {
 
     locks.read_lock_identifier(ids({"x", "y", "x"}));
     EXPECT_EQ(locks.snapshot().records["x"].lockState, 1);
+    locks.read_lock_identifier("x");
+    EXPECT_EQ(locks.snapshot().records["x"].lockState, 2);
     locks.unlock_identifier(ids({"y", "x", "x"}));
+    EXPECT_EQ(locks.lockRecordCount(), 1u) << "x is still held once";
+    locks.unlock_identifier("x");
+    EXPECT_EQ(locks.lockRecordCount(), 0u);
+    locks.write_lock_identifier("x"); // a fresh record, not a stale one
+    EXPECT_EQ(locks.snapshot().records["x"].users, 1u);
+    locks.unlock_identifier("x");
     locks.read_lock_identifier(Value::array());
 }
 
@@ -132,23 +139,6 @@ TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrder) {
     locks.unlock_identifier("b");
     waitUntil("array locker gets both", [&] { return h.acquired(); });
     h.release();
-}
-
-TEST(QRNLocksIdentifiers, RecordLivesExactlyWhileUsed) {
-    test::TempRoot root;
-    QRNLocks& locks = QRNLocks::shared();
-    EXPECT_EQ(&locks, &root.context().instance<QRNLocks>());
-    read_lock_identifier("x");
-    read_lock_identifier("x");
-    EXPECT_EQ(locks.snapshot().records["x"].lockState, 2);
-    unlock_identifier("x");
-    EXPECT_EQ(locks.lockRecordCount(), 1u);
-    unlock_identifier("x");
-    EXPECT_EQ(locks.lockRecordCount(), 0u);
-    write_lock_identifier("x"); // a fresh record, not a stale one
-    EXPECT_EQ(locks.snapshot().records["x"].users, 1u);
-    unlock_identifier("x");
-    expectIdle(locks);
 }
 
 TEST_F(QRNLocksTest, HoldsAreMarkedFromLockToUnlock) {
