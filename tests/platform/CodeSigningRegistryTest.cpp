@@ -5,16 +5,13 @@
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
+#include "common/shared/ChildProcess.h"
 
 #include <gtest/gtest.h>
 #include <sodium.h>
 
 #include <fcntl.h>
-#include <sched.h>
-#include <signal.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -72,38 +69,15 @@ protected:
     }
 };
 
-// Runs `program` in a child, after binding `cover` over it in a mount
-// namespace of the child's own when `cover` is given; answers the child's
-// pid once it runs `program`, or -1 when that cannot be set up.
-pid_t runCovered(const std::string& program, const std::string& cover) {
-    int ready[2];
-    if (::pipe2(ready, O_CLOEXEC) != 0) {
-        return -1;
+// Whether the child `pid` runs `program`, by the kernel's account, within a
+// few seconds.
+bool runs(pid_t pid, const std::filesystem::path& program) {
+    const auto exe = "/proc/" + std::to_string(pid) + "/exe";
+    std::error_code error;
+    for (int i = 0; i < 5000 && std::filesystem::read_symlink(exe, error) != program; ++i) {
+        ::usleep(1000);
     }
-    const pid_t child = ::fork();
-    if (child == 0) {
-        if (!cover.empty() &&
-            (::unshare(CLONE_NEWNS) != 0 ||
-             ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-             ::mount(cover.c_str(), program.c_str(), nullptr, MS_BIND, nullptr) != 0)) {
-            ::_exit(1);
-        }
-        // The pipe closes on exec: the parent then knows the child runs it.
-        ::execl(program.c_str(), program.c_str(), "60", static_cast<char*>(nullptr));
-        ::_exit(1);
-    }
-    ::close(ready[1]);
-    char byte = 0;
-    while (::read(ready[0], &byte, 1) < 0 && errno == EINTR) {
-    }
-    ::close(ready[0]);
-    int status = 0;
-    return child < 0 || ::waitpid(child, &status, WNOHANG) != 0 ? -1 : child;
-}
-
-void stop(pid_t child) {
-    ::kill(child, SIGKILL);
-    ::waitpid(child, nullptr, 0);
+    return std::filesystem::read_symlink(exe, error) == program;
 }
 
 } // namespace
@@ -172,28 +146,29 @@ TEST_F(CodeSigningRegistryTest, FollowsTheEntriesOfTheRunningProcessAndChecksIts
 
 TEST_F(CodeSigningRegistryTest, AFileBoundOverTheProgramInAnotherNamespaceIsNotTheProgram) {
     // Copies, so that each is a file of its own.
-    const std::filesystem::path program = root_.path() / "registered";
-    const std::filesystem::path impostor = root_.path() / "impostor";
+    const auto program = root_.path() / "registered", impostor = root_.path() / "impostor";
     std::filesystem::copy_file("/bin/sleep", program);
     std::filesystem::copy_file("/bin/sleep", impostor);
     write("registered.plist", entry(program.string(), "com.orvex.registered"));
+    auto genuine = quarn::test::ChildProcess::spawn({program, {"60"}, {}, {}, {}});
+    ASSERT_TRUE(genuine && runs(genuine->pid(), program));
+    EXPECT_EQ(identifierOf(tokenOf(genuine->pid())), "com.orvex.registered");
 
-    const pid_t genuine = runCovered(program.string(), "");
-    ASSERT_GT(genuine, 0);
-    EXPECT_EQ(identifierOf(tokenOf(genuine)), "com.orvex.registered");
-    stop(genuine);
-
-    const pid_t covered = runCovered(program.string(), impostor.string());
-    if (covered < 0) {
+    // The kernel names the registered path for the impostor, as an unprivileged
+    // user in a user and mount namespace of its own could arrange.
+    auto covered = quarn::test::ChildProcess::spawn(
+        {"/usr/bin/unshare",
+         {"--mount", "--propagation", "private", "/bin/sh", "-c",
+          "mount --bind \"$0\" \"$1\" && exec \"$1\" 60", impostor.string(), program.string()},
+         {},
+         {},
+         {}});
+    if (!covered || !runs(covered->pid(), program)) {
         GTEST_SKIP() << "no mount namespace for the test";
     }
-    // The kernel names the registered path for it, as an unprivileged user
-    // in a user and mount namespace of its own could arrange.
-    EXPECT_EQ(std::filesystem::read_symlink("/proc/" + std::to_string(covered) + "/exe"), program);
     quarn::test::LogCapture log;
-    EXPECT_EQ(identifierOf(tokenOf(covered)), "");
+    EXPECT_EQ(identifierOf(tokenOf(covered->pid())), "");
     EXPECT_TRUE(log.contains("is not the file")) << log.all();
-    stop(covered);
 }
 
 TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {

@@ -9,9 +9,12 @@
 
 #include <gtest/gtest.h>
 
+#include <fmt/format.h>
+
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <fstream>
 #include <iterator>
 #include <sstream>
@@ -39,19 +42,10 @@ Parts partsOf(const std::string& token) {
     return parts;
 }
 
-std::string joined(const Parts& parts, std::size_t index = 0,
-                   std::optional<std::string> value = {}) {
-    std::string token;
-    for (std::size_t i = 0; i < parts.size(); ++i) {
-        token += (i ? ";" : "") + (i == index && value ? *value : parts[i]);
-    }
-    return token;
-}
-
-// The last hex digit flipped (0 <-> 1 keeps it lower-case hex).
-std::string flipped(std::string field) {
-    field.back() = field.back() == '0' ? '1' : '0';
-    return field;
+// The token of `parts` with the one at `index` replaced by `value`.
+std::string with(Parts parts, std::size_t index, std::string value) {
+    parts[index] = std::move(value);
+    return fmt::format("{}", fmt::join(parts, ";"));
 }
 
 const std::string kClass = "com.orvex.sandbox.container";
@@ -59,7 +53,7 @@ const std::string kPath = "/private/var/mobile/Containers/Data/Application/X;Y";
 
 } // namespace
 
-TEST(SandboxExtensionTokenTest, VerifiesOnlyUnderItsKeyWithEveryFieldUnchanged) {
+TEST(SandboxExtensionTokenTest, VerifiesOnlyUnderItsKeyWithEveryFieldInItsOnlySpelling) {
     const auto token = Token::make(keyOf(7), kClass, kPath, 4242, 123456789);
     ASSERT_TRUE(token);
     const auto fields = Token::parse(*token);
@@ -69,50 +63,46 @@ TEST(SandboxExtensionTokenTest, VerifiesOnlyUnderItsKeyWithEveryFieldUnchanged) 
     EXPECT_TRUE(Token::verify(*token, keyOf(7)));
     EXPECT_FALSE(Token::verify(*token, keyOf(8)));
 
+    // Forged fields parse but do not verify; the last hex digit flipped
+    // (0 <-> 1) keeps a field lower-case hex.
     const Parts parts = partsOf(*token);
     ASSERT_EQ(parts.size(), 6u);
+    const auto flipped = [&](std::size_t i) {
+        return with(parts, i,
+                    parts[i].substr(0, parts[i].size() - 1) + (parts[i].back() == '0' ? '1' : '0'));
+    };
     for (const auto& forged :
-         {joined(parts, 1, "com.orvex.sandbox.application-group"), joined(parts, 2, "4243"),
-          joined(parts, 3, "123456788"), joined(parts, 4, flipped(parts[4])),
-          joined(parts, 5, flipped(parts[5]))}) {
+         {with(parts, 1, "com.orvex.sandbox.application-group"), with(parts, 2, "4243"),
+          with(parts, 3, "123456788"), flipped(4), flipped(5)}) {
         EXPECT_TRUE(Token::parse(forged)) << forged;
         EXPECT_FALSE(Token::verify(forged, keyOf(7))) << forged;
     }
-
     // Class "a.b" with path "/c" and class "a" with path ".b/c" concatenate
     // alike; the MAC of one must not carry over to the other.
     const auto first = Token::make(keyOf(3), "a.b", "/c", 1, 2);
     const auto second = Token::make(keyOf(3), "a", ".b/c", 1, 2);
     ASSERT_TRUE(first && second);
-    EXPECT_FALSE(Token::verify(joined(partsOf(*second), 5, partsOf(*first)[5]), keyOf(3)));
-}
+    EXPECT_FALSE(Token::verify(with(partsOf(*second), 5, partsOf(*first)[5]), keyOf(3)));
 
-TEST(SandboxExtensionTokenTest, RefusesFieldsThatCannotBeWrittenGarbageAndSecondSpellings) {
-    const auto key = keyOf(5);
+    // Fields that cannot be written, garbage and second spellings.
     for (const auto& [cls, path] : std::initializer_list<std::pair<std::string, std::string>>{
              {"", kPath},
              {"a;b", kPath},
              {"with space", kPath},
              {kClass, ""},
              {kClass, std::string(Token::kMaxPathSize + 1, 'p')}}) {
-        EXPECT_FALSE(Token::make(key, cls, path, 1, 1)) << cls << " " << path.size();
+        EXPECT_FALSE(Token::make(keyOf(7), cls, path, 1, 1)) << cls << " " << path.size();
     }
-
-    const auto token = Token::make(key, "c", "/p", 12, 34);
-    ASSERT_TRUE(token);
-    const auto parts = partsOf(*token);
     std::string upper = parts[5];
-    for (char& c : upper) {
-        c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
-    }
+    std::ranges::transform(upper, upper.begin(), [](char c) { return std::toupper(c); });
     for (const auto& text :
-         {std::string(), std::string("v1"), joined(parts, 0, "v2"), *token + ";extra",
-          joined({parts.begin(), parts.end() - 1}), joined(parts, 2, "012"),
-          joined(parts, 2, "+12"), joined(parts, 2, "4294967296"), joined(parts, 3, "-1"),
-          joined(parts, 4, ""), joined(parts, 4, parts[4] + "0"), joined(parts, 4, "zz"),
-          joined(parts, 5, parts[5].substr(2)), joined(parts, 5, upper), std::string(20000, 'a')}) {
+         {std::string(), std::string("v1"), with(parts, 0, "v2"), *token + ";extra",
+          token->substr(0, token->rfind(';')), with(parts, 2, "04242"), with(parts, 2, "+4242"),
+          with(parts, 2, "4294967296"), with(parts, 3, "-1"), with(parts, 4, ""),
+          with(parts, 4, parts[4] + "0"), with(parts, 4, "zz"), with(parts, 5, parts[5].substr(2)),
+          with(parts, 5, upper), std::string(20000, 'a')}) {
         EXPECT_FALSE(Token::parse(text)) << text;
-        EXPECT_FALSE(Token::verify(text, key)) << text;
+        EXPECT_FALSE(Token::verify(text, keyOf(7))) << text;
     }
 }
 
@@ -122,21 +112,17 @@ TEST(SandboxExtensionsTest, IssuesTokensUnderTheKeyOfItsFileAndRefusesEmptyPathA
     quarn::test::TempRoot root;
     const Paths paths(root.path());
     const auto keyFile = paths.runDirectory() / LinuxSandboxExtensions::kKeyFileName;
-    const auto keyFromFile = [&] {
+    const auto keyInFile = [&] {
         struct stat st {};
         EXPECT_EQ(::stat(keyFile.c_str(), &st), 0);
         EXPECT_EQ(st.st_mode & 07777, 0600u);
         std::ifstream in(keyFile, std::ios::binary);
-        const std::string bytes{std::istreambuf_iterator<char>(in), {}};
-        Token::Key key{};
-        EXPECT_EQ(bytes.size(), key.size());
-        std::copy_n(bytes.begin(), std::min(bytes.size(), key.size()), key.begin());
-        return key;
+        return std::string{std::istreambuf_iterator<char>(in), {}};
     };
-    const auto keyNow = [](LinuxSandboxExtensions& extensions) {
-        auto key = extensions.key();
+    const auto keyOf = [](LinuxSandboxExtensions& extensions) {
+        const auto key = extensions.key();
         EXPECT_TRUE(key);
-        return key ? *key : Token::Key{};
+        return key ? std::string(key->begin(), key->end()) : std::string();
     };
 
     LinuxSandboxExtensions extensions(paths);
@@ -145,35 +131,36 @@ TEST(SandboxExtensionsTest, IssuesTokensUnderTheKeyOfItsFileAndRefusesEmptyPathA
     auto issued = extensions.issueFileExtension(
         SandboxExtensions::kContainerClass, "/private/var/mobile/Containers/X", peer->auditToken());
     ASSERT_TRUE(issued) << issued.error().description();
-    EXPECT_TRUE(Token::verify(*issued, keyFromFile()));
+    const std::string key = keyOf(extensions);
+    EXPECT_EQ(keyInFile(), key);
+    EXPECT_TRUE(Token::verify(*issued, *extensions.key()));
     const auto fields = Token::parse(*issued);
     ASSERT_TRUE(fields);
-    EXPECT_EQ(fields->pid, static_cast<std::uint32_t>(::getpid()));
-    EXPECT_EQ(fields->startTime, IpcPeer::fieldsOfAuditToken(peer->auditToken()).startTime);
-    IpcPeer::TokenFields kernel = IpcPeer::fieldsOfAuditToken(peer->auditToken());
-    kernel.pid = 0;
+    IpcPeer::TokenFields self = IpcPeer::fieldsOfAuditToken(peer->auditToken());
+    EXPECT_EQ(std::tie(fields->pid, fields->startTime), std::tie(self.pid, self.startTime));
+    self.pid = 0; // the kernel
     for (const auto& [path, token] :
-         {std::pair{"", peer->auditToken()}, std::pair{"/p", IpcPeer::makeAuditToken(kernel)}}) {
+         {std::pair{"", peer->auditToken()}, std::pair{"/p", IpcPeer::makeAuditToken(self)}}) {
         auto refused =
             extensions.issueFileExtension(SandboxExtensions::kContainerClass, path, token);
         ASSERT_FALSE(refused) << path;
         EXPECT_EQ(refused.error().domain, Error::Domain::POSIX) << path;
     }
 
-    const Token::Key key = keyNow(extensions);
     LinuxSandboxExtensions second(paths);
-    EXPECT_EQ(keyNow(second), key);
+    EXPECT_EQ(keyOf(second), key);
     std::filesystem::remove(keyFile);
-    EXPECT_EQ(keyNow(extensions), key);
+    EXPECT_EQ(keyOf(extensions), key); // kept in memory
+    // A short or readable key file is replaced.
     for (const auto& [contents, mode] :
          {std::pair<std::string, mode_t>{"short", 0600},
           std::pair<std::string, mode_t>{std::string(32, 'k'), 0644}}) {
         std::ofstream(keyFile, std::ios::binary | std::ios::trunc) << contents;
         ::chmod(keyFile.c_str(), mode);
         LinuxSandboxExtensions fresh(paths);
-        const Token::Key freshKey = keyNow(fresh);
-        EXPECT_EQ(keyFromFile(), freshKey);
-        EXPECT_NE(std::string(freshKey.begin(), freshKey.end()), contents);
+        const std::string freshKey = keyOf(fresh);
+        EXPECT_EQ(keyInFile(), freshKey);
+        EXPECT_NE(freshKey, contents);
     }
 }
 
