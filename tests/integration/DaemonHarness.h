@@ -7,30 +7,65 @@
 // Every wait is bounded by kWaitLimit; none of them measures anything.
 
 #include "Client/QRNClient.h"
-#include "ClientPrograms.h"
+#include "Daemon/platform/Paths.h"
+#include "Daemon/support/PropertyList.h"
 #include "Daemon/support/Value.h"
 #include "common/shared/ChildProcess.h"
+#include "common/shared/FrameSocket.h"
+#include "common/shared/HexCbor.h"
 #include "common/shared/RequestValues.h"
 #include "common/shared/ScratchRoot.h"
 
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sodium.h>
+#include <unistd.h>
 
 #include <chrono>
-#include <cstddef>
 #include <filesystem>
+#include <fstream>
 #include <functional>
-#include <memory>
+#include <iostream>
+#include <iterator>
 #include <optional>
 #include <string>
-#include <string_view>
+#include <thread>
 #include <vector>
 
 namespace quarn::test {
 
+// The client programs of the registry: hard links of quarn_test_client, one
+// per set of entitlements (the kernel reports a process's executable by the
+// path it was started from, so each link is a program of its own).
+namespace program {
+inline constexpr std::string_view kAllowed = "allowed";    // "allowed", with the right digest
+inline constexpr std::string_view kNone = "none";          // no entitlements
+inline constexpr std::string_view kLookup = "lookup";      // lookup of the allowed client's class 2
+inline constexpr std::string_view kWipeBool = "wipe-bool"; // wipeContainer: true
+inline constexpr std::string_view kWipeArray = "wipe-array"; // wipeContainer: [itself]
+inline constexpr std::string_view kTestability = "testability";
+inline constexpr std::string_view kBadDigest = "bad-digest"; // "allowed", wrong digest
+inline std::string identifierOf(std::string_view name) {
+    return "com.orvex.test." + std::string(name);
+}
+} // namespace program
+
+constexpr std::chrono::seconds kWaitLimit{30};
+
+// Polls `condition` until it holds or the limit has passed; answers its last value.
+inline bool waitUntil(const std::function<bool()>& condition) {
+    const auto deadline = std::chrono::steady_clock::now() + kWaitLimit;
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() >= deadline) {
+            return condition();
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return true;
+}
+
 class DaemonHarness {
 public:
-    static constexpr std::chrono::seconds kWaitLimit{30};
-
     // What one run of a client copy printed.
     struct ClientRun {
         std::vector<Value> replies;
@@ -38,57 +73,165 @@ public:
         std::optional<ChildProcess::Exit> exit; // none: it did not end
     };
 
-    DaemonHarness();
+    DaemonHarness() {
+        root_.writeFile("/etc/os-release", "ID=quarnos\nVERSION_ID=1.0\nBUILD_ID=1A100\n"
+                                           "VARIANT_ID=internal\n");
+        writeRegistry(Paths(root()).configDirectory() / "codesign.d");
+    }
     DaemonHarness(const DaemonHarness&) = delete;
-    DaemonHarness& operator=(const DaemonHarness&) = delete;
 
     const std::filesystem::path& root() const { return root_.path(); }
-    // An absolute device path taken below the root.
-    std::filesystem::path operator/(std::string_view absolute) const;
-    std::filesystem::path runDirectory() const;
-    std::filesystem::path socketPath() const;
+    std::filesystem::path operator/(std::string_view absolute) const { return root_ / absolute; }
+    std::filesystem::path socketPath() const { return QRNClient::socketPathForRoot(root()); }
 
-    // Spawns quarnd on the root (with `environment` added) and returns at
-    // once. False when it cannot be spawned.
-    bool spawn(std::vector<std::string> environment = {});
-    // Polls connecting to the socket until it accepts; false when the
-    // daemon ended or the limit passed first.
-    bool waitUntilAccepting();
-    bool start() { return spawn() && waitUntilAccepting(); }
-    bool isRunning() const;
-    // SIGTERM, then waits for the exit; none when the daemon does not end.
-    std::optional<ChildProcess::Exit> stop();
+    // Spawns quarnd on the root (with `environment` added) and waits until
+    // its socket accepts; false when the daemon ended or the limit passed first.
+    bool start(std::vector<std::string> environment = {}) {
+        runLogStart_ = std::filesystem::exists(stderr_) ? std::filesystem::file_size(stderr_) : 0;
+        daemon_.reset();
+        auto spawned = ChildProcess::spawn(
+            {.program = QUARN_DAEMON_PATH,
+             .arguments = {"--root", root().string(), "--foreground", "--log-level", "debug"},
+             .environment = std::move(environment),
+             .stdoutFile = {},
+             .stderrFile = stderr_});
+        if (!spawned) {
+            ADD_FAILURE() << spawned.error().description();
+            return false;
+        }
+        daemon_.emplace(std::move(*spawned));
+        // waitFor doubles as the pause between attempts, and ends early on a crash.
+        return waitUntil([&] {
+                   return FrameSocket::accepts(socketPath()) ||
+                          daemon_->waitFor(std::chrono::milliseconds(10));
+               }) &&
+               daemon_->isRunning();
+    }
+    bool isRunning() const { return daemon_ && daemon_->isRunning(); }
+    // SIGTERM, then fails the calling test unless the daemon exits with status 0.
+    void expectCleanStop() {
+        if (!daemon_) {
+            return;
+        }
+        daemon_->signal(SIGTERM);
+        const auto exit = daemon_->waitFor(kWaitLimit);
+        EXPECT_TRUE(exit && exit->exitedWith(0))
+            << "quarnd did not stop cleanly on SIGTERM: "
+            << (exit ? exit->description() : "still running") << "\n"
+            << log();
+    }
 
-    // The daemon's stderr of the current run (debug level), from byte
-    // `from` of that run on.
-    std::string log(std::size_t from = 0) const;
-    std::size_t logSize() const;
-    // Waits until `text` appears in the current run's log at or after
-    // `from`; answers where, or npos when the daemon ended or the limit
-    // passed first.
-    std::size_t waitForLog(std::string_view text, std::size_t from = 0) const;
+    // The daemon's stderr of the current run (debug level), from byte `from` on.
+    std::string log(std::size_t from = 0) const {
+        std::ifstream in(stderr_, std::ios::binary);
+        in.seekg(static_cast<std::streamoff>(runLogStart_ + from));
+        return std::string(std::istreambuf_iterator<char>(in), {});
+    }
+    std::size_t logSize() const { return log().size(); }
 
     // Runs the client copy `program` with `requests` on one connection.
-    ClientRun runClient(std::string_view program, const std::vector<Value>& requests) const;
+    ClientRun runClient(std::string_view program, const std::vector<Value>& requests) const {
+        ChildProcess::Launch launch{.program = clients() / program,
+                                    .arguments = {"--socket", socketPath().string()},
+                                    .environment = {},
+                                    .stdoutFile =
+                                        clients() / ("run-" + std::to_string(++clientRuns_)),
+                                    .stderrFile = {}};
+        for (const Value& request : requests) {
+            launch.arguments.push_back(HexCbor::encode(request));
+        }
+        ClientRun run;
+        auto child = ChildProcess::spawn(launch);
+        if (!child) {
+            run.failure = child.error().description();
+            return run;
+        }
+        run.exit = child->waitFor(kWaitLimit);
+        std::ifstream out(launch.stdoutFile);
+        for (std::string line; run.failure.empty() && std::getline(out, line);) {
+            auto reply = HexCbor::decode(line);
+            if (line.starts_with('!') || !reply) {
+                run.failure = line;
+            } else {
+                run.replies.push_back(std::move(*reply));
+            }
+        }
+        return run;
+    }
     // A connection of the test binary, which the registry grants "allowed".
-    Result<QRNClient> connect() const;
-    // One request on a new connection of the test binary; fails the
-    // calling test when no reply comes.
-    Value request(const Value& request) const;
+    Result<QRNClient> connect() const {
+        return QRNClient::connect(socketPath(), {.timeout = kWaitLimit});
+    }
+    // One request on a new connection; fails the calling test when no reply comes.
+    Value request(const Value& request) const {
+        auto client = connect();
+        auto reply = client ? client->send(request) : Result<Value>(QRN_UNEXPECTED(client.error()));
+        EXPECT_TRUE(reply) << request.description() << ": " << reply.error().description();
+        return reply ? *reply : Value();
+    }
 
 private:
+    std::filesystem::path clients() const { return root() / "clients"; }
+
+    void writeRegistry(const std::filesystem::path& registry) const {
+        [[maybe_unused]] static const int sodiumReady = sodium_init();
+        std::filesystem::create_directories(clients());
+        std::filesystem::create_directories(registry);
+        const auto grant = [](std::string_view name, Value value) {
+            return Value(Value::Dictionary{
+                {"com.orvex.private.Quarn." + std::string(name), std::move(value)}});
+        };
+        std::ifstream in(QUARN_TEST_CLIENT_PATH, std::ios::binary);
+        const std::string bytes(std::istreambuf_iterator<char>(in), {});
+        unsigned char digest[crypto_hash_sha256_BYTES];
+        crypto_hash_sha256(digest, reinterpret_cast<const unsigned char*>(bytes.data()),
+                           bytes.size());
+        char hex[2 * sizeof digest + 1];
+        sodium_bin2hex(hex, sizeof hex, digest, sizeof digest);
+        using namespace program;
+        const Value lookup(Value::Dictionary{{"appData", Value::Array{identifierOf(kAllowed)}}});
+        // Name, entitlements (none: no entry) and digest (empty: no entry).
+        const std::tuple<std::string_view, Value, std::string> programs[] = {
+            {kAllowed, grant("allowed", true), hex},
+            {kNone, Value(), ""},
+            {kLookup, grant("lookup", lookup), ""},
+            {kWipeBool, grant("wipeContainer", true), ""},
+            {kWipeArray, grant("wipeContainer", Value::Array{identifierOf(kWipeArray)}), ""},
+            {kTestability, grant("testability", true), ""},
+            {kBadDigest, grant("allowed", true), std::string(64, '0')},
+        };
+        for (const auto& [name, entitlements, sha256] : programs) {
+            const std::filesystem::path copy = clients() / name;
+            if (::link(QUARN_TEST_CLIENT_PATH, copy.c_str()) != 0) {
+                // Another file system: a copy is a program of its own path just as well.
+                std::filesystem::copy_file(QUARN_TEST_CLIENT_PATH, copy);
+                std::filesystem::permissions(copy, std::filesystem::perms::owner_all);
+            }
+            Value::Dictionary entry{{"Program", copy.string()}, {"Identifier", identifierOf(name)}};
+            if (!entitlements.isNone()) {
+                entry.emplace("Entitlements", entitlements);
+            }
+            if (!sha256.empty()) {
+                entry.emplace("SHA256", sha256);
+            }
+            EXPECT_TRUE(
+                QRN_writeToURL(Value(std::move(entry)), registry / (std::string(name) + ".plist")));
+        }
+        // The test binary itself, so that the test's threads can talk to the daemon directly.
+        EXPECT_TRUE(QRN_writeToURL(
+            Value(Value::Dictionary{
+                {"Program", std::filesystem::read_symlink("/proc/self/exe").string()},
+                {"Identifier", "com.orvex.test.integration"},
+                {"Entitlements", grant("allowed", true)}}),
+            registry / "test-binary.plist"));
+    }
+
     ScratchRoot root_{{.withMobileUser = true, .installContext = false}, "quarn-it"};
-    std::filesystem::path stderrFile_;
+    std::filesystem::path stderr_ = root() / "quarnd.stderr";
     std::size_t runLogStart_ = 0;        // where the current run's stderr begins
     mutable std::size_t clientRuns_ = 0; // names each client run's output file
-    std::optional<ClientPrograms> clients_;
-    std::optional<ChildProcess>
-        daemon_; // last: a daemon still running is killed before the root goes
+    std::optional<ChildProcess> daemon_; // last: a running daemon is killed before the root goes
 };
-
-// Polls `condition` until it holds or `limit` has passed; answers its last value.
-bool waitUntil(const std::function<bool()>& condition,
-               std::chrono::milliseconds limit = DaemonHarness::kWaitLimit);
 
 // A test suite sharing one daemon: started before the suite's first test,
 // stopped after its last, when it must exit with status 0. Each test fails
@@ -96,21 +239,29 @@ bool waitUntil(const std::function<bool()>& condition,
 // test when it failed.
 class SharedDaemonTest : public ::testing::Test {
 protected:
-    static void SetUpTestSuite();
-    static void TearDownTestSuite();
-    void SetUp() override;
-    void TearDown() override;
-
+    static void SetUpTestSuite() {
+        harness_ = std::make_unique<DaemonHarness>();
+        EXPECT_TRUE(harness_->start()) << "quarnd did not start\n" << harness_->log();
+    }
+    static void TearDownTestSuite() {
+        harness_->expectCleanStop();
+        harness_.reset();
+    }
+    void SetUp() override {
+        ASSERT_TRUE(harness_->isRunning()) << "quarnd is not running";
+        logStart_ = harness_->logSize();
+    }
+    void TearDown() override {
+        EXPECT_TRUE(harness_->isRunning()) << "quarnd ended during the test";
+        if (HasFailure()) {
+            std::cerr << "---- quarnd stderr ----\n" << harness_->log(logStart_) << "----\n";
+        }
+    }
     static DaemonHarness& daemon() { return *harness_; }
 
 private:
-    static std::unique_ptr<DaemonHarness> harness_;
+    static inline std::unique_ptr<DaemonHarness> harness_;
     std::size_t logStart_ = 0;
 };
-
-// Prints the daemon's log from `from` on, under a header, for a failed test.
-void dumpLog(const DaemonHarness& harness, std::size_t from);
-// Stops the daemon and fails the calling test unless it exits with status 0.
-void expectCleanStop(DaemonHarness& harness);
 
 } // namespace quarn::test

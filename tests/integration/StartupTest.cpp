@@ -25,21 +25,16 @@ class Startup : public ::testing::Test {
 protected:
     void TearDown() override {
         if (harness_.isRunning()) {
-            expectCleanStop(harness_);
+            harness_.expectCleanStop();
         }
         if (HasFailure()) {
-            dumpLog(harness_, 0);
+            std::cerr << "---- quarnd stderr ----\n" << harness_.log() << "----\n";
         }
     }
-
     // Lines of "<run>/notifications/<name>": one per posting.
     std::size_t postings(const char* name) const {
-        std::ifstream in(harness_.runDirectory() / "notifications" / name);
-        return static_cast<std::size_t>(
-            std::count(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>(), '\n'));
-    }
-    bool logged(std::string_view text) const {
-        return harness_.log().find(text) != std::string::npos;
+        std::ifstream in(Paths(harness_.root()).runDirectory() / "notifications" / name);
+        return static_cast<std::size_t>(std::count(std::istreambuf_iterator<char>(in), {}, '\n'));
     }
 
     DaemonHarness harness_;
@@ -75,27 +70,37 @@ private:
 
 } // namespace
 
-TEST_F(Startup, FirstBootWorkRunsOnlyWhileTheMarkerIsAbsent) {
+// Started again in the same boot, the daemon finds the marker, so only the
+// boot work runs, and it finds the container made before.
+TEST_F(Startup, FirstBootWorkRunsOnlyWhileTheMarkerIsAbsentAndARestartFindsWhatWasMade) {
     const FirstBootMarker marker(harness_.root());
     ASSERT_FALSE(marker.exists());
     ASSERT_TRUE(harness_.start());
     ASSERT_TRUE(waitUntil(
         [&] { return postings(kRebootCleanupComplete) == 1 && postings(kCleanupComplete) == 1; }));
     EXPECT_TRUE(marker.exists());
-    EXPECT_TRUE(logged("quarnd performing first boot initialization"));
-    expectCleanStop(harness_);
+    EXPECT_NE(harness_.log().find("quarnd performing first boot initialization"),
+              std::string::npos);
+    const auto lookup = [&](bool create) {
+        return harness_.request(
+            QRNClientRequests::createOrLookup("com.orvex.test.kept", 2, create, false));
+    };
+    const Value created = lookup(true);
+    ASSERT_EQ(replyError(created), kQRNErrorNone) << created.description();
+    harness_.expectCleanStop();
 
-    // Started again in the same boot: the marker is there, so only the boot work runs.
     ASSERT_TRUE(harness_.start());
     ASSERT_TRUE(waitUntil([&] { return postings(kCleanupComplete) == 2; }));
     EXPECT_EQ(postings(kRebootCleanupComplete), 1u);
-    EXPECT_FALSE(logged("first boot"));
+    EXPECT_EQ(harness_.log().find("first boot"), std::string::npos);
+    const Value found = lookup(false);
+    EXPECT_EQ(replyError(found), kQRNErrorNone) << found.description();
+    EXPECT_TRUE(found.get("ReplyUUID") && *found.get("ReplyUUID") == *created.get("ReplyUUID"));
 }
 
 TEST_F(Startup, ClientConnectingDuringInitialisationIsServedAfterIt) {
     NotifySocket notify(harness_.root() / "notify.sock");
-    ASSERT_TRUE(harness_.spawn({notify.environment()}));
-    ASSERT_TRUE(harness_.waitUntilAccepting());
+    ASSERT_TRUE(harness_.start({notify.environment()}));
     auto client = harness_.connect();
     ASSERT_TRUE(client) << client.error().description();
     if (notify.readyReceived()) {
