@@ -10,7 +10,6 @@
 #include <fmt/format.h>
 #include <sys/socket.h>
 
-#include <algorithm>
 #include <fstream>
 #include <latch>
 #include <map>
@@ -65,59 +64,48 @@ Value padded(std::size_t size) {
 // Frames no well-behaved client sends, over a raw socket: each may end its
 // own connection, never the daemon.
 TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
-    enum class After { Wait, HangUp, ShutdownWrite };
-    struct Case {
+    enum After { kWait, kHangUp, kShutdownWrite };
+    const Value normal = create({{"Identifier", "com.orvex.test.hostile"}});
+    const std::vector<std::uint8_t> body = CborCodec::encode(normal);
+    const auto size = static_cast<std::uint32_t>(body.size());
+    const auto frame = [](const Value& v) { return FrameSocket::frame(v, kReply); };
+    const auto raw = [](std::uint32_t length, std::uint8_t flags, std::vector<std::uint8_t> b) {
+        return FrameSocket::rawFrame(length, flags, b);
+    };
+    std::vector<std::uint8_t> twoRequests = frame(normal);
+    const auto second = frame(create({{"ContainerClass", 0u}}));
+    twoRequests.insert(twoRequests.end(), second.begin(), second.end());
+    const Value unknownKeys = create(
+        {{"Identifier", "com.orvex.test.unknown"}, {"NoSuchKey", Value(Value::Dictionary{})}});
+    const struct {
         std::string name;
         std::vector<std::uint8_t> bytes;
         After after;
         std::vector<std::uint64_t> replies; // the expected codes, in order
         const char* closesWith;             // null: the daemon keeps the connection
-    };
-    const Value normal = create({{"Identifier", "com.orvex.test.hostile"}});
-    const std::vector<std::uint8_t> body = CborCodec::encode(normal);
-    const auto raw = [](std::uint32_t length, std::uint8_t flags, std::vector<std::uint8_t> bytes) {
-        return FrameSocket::rawFrame(length, flags, bytes);
-    };
-    const auto frame = [](const Value& v) { return FrameSocket::frame(v, kReply); };
-    std::vector<std::uint8_t> twoRequests = frame(normal);
-    const auto second = frame(create({{"ContainerClass", 0u}}));
-    twoRequests.insert(twoRequests.end(), second.begin(), second.end());
-    const Case cases[] = {
-        {"truncated header", {0x10, 0x00, 0x00}, After::ShutdownWrite, {}, ""},
-        {"truncated body, then gone", raw(100, kReply, {0xa1, 0x67}), After::HangUp, {}, nullptr},
-        {"frame over 1 MiB", raw((1u << 20) + 1, kReply, {}), After::Wait, {}, "over the limit"},
-        {"reserved flag bits",
-         raw(static_cast<std::uint32_t>(body.size()), 0x03, body),
-         After::Wait,
-         {},
-         "reserved bits"},
-        {"not CBOR", raw(3, kReply, {0xff, 0xfe, 0x13}), After::Wait, {}, "does not decode"},
-        {"CBOR that is no map",
-         frame(Value(Value::Array{0u})),
-         After::Wait,
-         {},
-         "not a dictionary"},
-        {"nesting 33 deep", frame(nested(33)), After::Wait, {}, "nest deeper than 32"},
+    } cases[] = {
+        {"truncated header", {0x10, 0x00, 0x00}, kShutdownWrite, {}, ""},
+        {"truncated body, gone", raw(100, kReply, {0xa1, 0x67}), kHangUp, {}, nullptr},
+        {"over 1 MiB", raw((1u << 20) + 1, kReply, {}), kWait, {}, "over the limit"},
+        {"reserved flag bits", raw(size, 0x03, body), kWait, {}, "reserved bits"},
+        {"not CBOR", raw(3, kReply, {0xff, 0xfe, 0x13}), kWait, {}, "does not decode"},
+        {"not a map", frame(Value(Value::Array{0u})), kWait, {}, "not a dictionary"},
+        {"nesting 33 deep", frame(nested(33)), kWait, {}, "nest deeper than 32"},
         {"reply flag clear",
-         FrameSocket::frame(normal, 0x00),
-         After::Wait,
+         FrameSocket::frame(normal, 0),
+         kWait,
          {},
-         "Dictionary does not have reply context"},
-        {"frame of exactly 1 MiB", frame(padded(1u << 20)), After::Wait, {kQRNErrorNone}, nullptr},
-        {"nesting 32 deep", frame(nested(32)), After::Wait, {kQRNErrorNone}, nullptr},
-        {"unknown keys",
-         frame(create({{"Identifier", "com.orvex.test.unknown"},
-                       {"NoSuchKey", Value(Value::Dictionary{{"a", 1u}})}})),
-         After::Wait,
-         {kQRNErrorNone},
-         nullptr},
+         "does not have reply context"},
+        {"exactly 1 MiB", frame(padded(1u << 20)), kWait, {kQRNErrorNone}, nullptr},
+        {"nesting 32 deep", frame(nested(32)), kWait, {kQRNErrorNone}, nullptr},
+        {"unknown keys", frame(unknownKeys), kWait, {kQRNErrorNone}, nullptr},
         {"two requests in one write",
          twoRequests,
-         After::Wait,
+         kWait,
          {kQRNErrorNone, kQRNErrorUnexpectedContainerType},
          nullptr},
     };
-    for (const Case& c : cases) {
+    for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         const std::size_t logStart = daemon().logSize();
         Descriptor connection(FrameSocket::connectTo(daemon().socketPath()));
@@ -125,9 +113,9 @@ TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
         const timeval limit{.tv_sec = kWaitLimit.count(), .tv_usec = 0};
         ASSERT_EQ(::setsockopt(connection.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit), 0);
         ASSERT_TRUE(FrameSocket::writeAll(connection.get(), c.bytes));
-        if (c.after == After::HangUp) {
+        if (c.after == kHangUp) {
             connection.close();
-        } else if (c.after == After::ShutdownWrite) {
+        } else if (c.after == kShutdownWrite) {
             ::shutdown(connection.get(), SHUT_WR);
         }
         for (std::uint64_t expected : c.replies) {
@@ -169,29 +157,24 @@ TEST_F(Serving, ConcurrentClientsGetOneContainerPerIdentity) {
     constexpr std::size_t kClients = 16, kShared = 4, kOwn = 12, kRounds = 3;
     // Used by no other test of this daemon, so its directory holds only ours.
     constexpr std::uint64_t kClass = 10;
+    constexpr std::size_t kIdentifiers = kShared + kOwn;
     std::vector<std::vector<std::pair<std::string, Value>>> replies(kClients);
     std::latch start(kClients);
     {
         std::vector<std::jthread> clients;
         for (std::size_t client = 0; client < kClients; ++client) {
             clients.emplace_back([&, client] {
-                std::vector<std::string> identifiers;
-                for (std::size_t i = 0; i < kShared + kOwn; ++i) {
-                    identifiers.push_back(
-                        i < kShared ? fmt::format("com.orvex.test.shared.{}", i)
-                                    : fmt::format("com.orvex.test.client{}.{}", client, i));
-                }
-                // Each starts at another place of the list, to collide on every one.
-                std::rotate(identifiers.begin(), identifiers.begin() + client % identifiers.size(),
-                            identifiers.end());
                 auto connection = daemon().connect();
                 start.arrive_and_wait();
-                for (std::size_t round = 0; connection && round < kRounds; ++round) {
-                    for (const std::string& identifier : identifiers) {
-                        auto reply = connection->send(
-                            QRNClientRequests::createOrLookup(identifier, kClass, true, false));
-                        replies[client].emplace_back(identifier, reply ? *reply : Value());
-                    }
+                // Each starts at another place of the list, to collide on every one.
+                for (std::size_t n = 0; connection && n < kRounds * kIdentifiers; ++n) {
+                    const std::size_t i = (n + client) % kIdentifiers;
+                    const std::string identifier =
+                        i < kShared ? fmt::format("com.orvex.test.shared.{}", i)
+                                    : fmt::format("com.orvex.test.client{}.{}", client, i);
+                    auto reply = connection->send(
+                        QRNClientRequests::createOrLookup(identifier, kClass, true, false));
+                    replies[client].emplace_back(identifier, reply ? *reply : Value());
                 }
             });
         }
@@ -210,7 +193,7 @@ TEST_F(Serving, ConcurrentClientsGetOneContainerPerIdentity) {
             creationsOf[identifier] += existed && existed->asBool().value_or(false) ? 0 : 1;
         }
     }
-    EXPECT_EQ(count, kClients * kRounds * (kShared + kOwn));
+    EXPECT_EQ(count, kClients * kRounds * kIdentifiers);
     EXPECT_EQ(uuidsOf.size(), kShared + kClients * kOwn);
     std::set<std::string> expectedOnDisk, onDisk;
     for (const auto& [identifier, uuids] : uuidsOf) {

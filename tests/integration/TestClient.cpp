@@ -14,23 +14,26 @@
 
 #include <cstdio>
 #include <string>
-#include <vector>
 
-namespace {
-
-using quarn::QRNClient;
-using quarn::Value;
 using quarn::test::HexCbor;
 
-int sendAll(QRNClient& client, const std::vector<std::string>& requests) {
-    for (const std::string& hex : requests) {
-        auto request = HexCbor::decode(hex);
+int main(int argc, char** argv) {
+    if (argc < 3 || std::string(argv[1]) != "--socket") {
+        std::fprintf(stderr, "usage: %s --socket PATH HEX...\n", argv[0]);
+        return 1;
+    }
+    auto client = quarn::QRNClient::connect(argv[2]);
+    if (!client) {
+        std::printf("!%s\n", client.error().description().c_str());
+        return 2;
+    }
+    for (int i = 3; i < argc; ++i) {
+        auto request = HexCbor::decode(argv[i]);
         if (!request) {
-            std::fprintf(stderr, "bad request %s: %s\n", hex.c_str(),
-                         request.error().description().c_str());
+            std::fprintf(stderr, "bad request %s\n", argv[i]);
             return 1;
         }
-        auto reply = client.send(*request);
+        auto reply = client->send(*request);
         if (!reply) {
             std::printf("!%s\n", reply.error().description().c_str());
             return 3;
@@ -39,20 +42,4 @@ int sendAll(QRNClient& client, const std::vector<std::string>& requests) {
         std::fflush(stdout);
     }
     return 0;
-}
-
-} // namespace
-
-int main(int argc, char** argv) {
-    if (argc < 3 || std::string(argv[1]) != "--socket") {
-        std::fprintf(stderr, "usage: %s --socket PATH HEX...\n", argv[0]);
-        return 1;
-    }
-    const std::vector<std::string> requests(argv + 3, argv + argc);
-    auto client = QRNClient::connect(argv[2]);
-    if (!client) {
-        std::printf("!%s\n", client.error().description().c_str());
-        return 2;
-    }
-    return sendAll(*client, requests);
 }
