@@ -16,18 +16,10 @@
 #include <linux/fs.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
-#include <sys/stat.h>
 #include <sys/xattr.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <cstdio>
-#include <cstring>
-#include <filesystem>
 #include <fstream>
-#include <optional>
-#include <string>
-#include <string_view>
 
 namespace quarn::test {
 

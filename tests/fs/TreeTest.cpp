@@ -1,9 +1,10 @@
 // Removal, moves and copies of whole trees.
 #include "FsTestSupport.h"
 
+#include "Daemon/support/Descriptor.h"
+
 #include <algorithm>
 #include <climits>
-#include <random>
 
 namespace quarn::test {
 namespace {
@@ -132,21 +133,22 @@ void setACL(const fs::path& p, acl_type_t type, const char* text) {
 
 class MoveCopyTest : public RemoveTest {
 protected:
-    // Each item's mtime is one second after its atime; the nanoseconds are set alike.
-    static void setTimes(const fs::path& p, time_t seconds, long nanos) {
-        const struct timespec times[2] = {{seconds, nanos}, {seconds + 1, nanos}};
-        ASSERT_EQ(::utimensat(AT_FDCWD, p.c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << p;
-    }
+    // Access and modification times set on items of the rich tree, the
+    // directories after their contents, which a copy must set in that order.
+    static constexpr std::pair<const char*, time_t> kTimes[] = {{"sub/deeper/empty", 1000000000},
+                                                                {"sub/link", 1100000000},
+                                                                {"sub/deeper", 1200000000},
+                                                                {"sub", 1300000000},
+                                                                {"", 1400000000}};
 
     // A tree with every kind of item and metadata the copy must carry.
     fs::path makeRichTree() {
         auto top = dir() / "src";
         fs::create_directories(top / "sub" / "deeper");
-        std::string data(3 << 20, '\0');
-        std::mt19937 gen(42);
-        for (auto& c : data)
-            c = static_cast<char>(gen());
-        writeFile(top / "data", data);
+        data_.resize(3 << 20);
+        for (std::size_t i = 0; i < data_.size(); ++i)
+            data_[i] = static_cast<char>(i % 251);
+        writeFile(top / "data", data_);
         writeFile(top / "sub" / "small", "small");
         writeFile(top / "sub" / "deeper" / "empty", "");
         fs::create_symlink("../data", top / "sub" / "link");
@@ -161,12 +163,11 @@ protected:
         ::setxattr((top / "sub").c_str(), kProtectionClassAttribute, "3", 1, 0);
         setACL(top / "sub" / "small", ACL_TYPE_ACCESS, kFileACL);
         setACL(top / "sub", ACL_TYPE_DEFAULT, kDefaultACL);
-        setTimes(top / "sub" / "deeper" / "empty", 1000000000, 123456789);
-        setTimes(top / "sub" / "link", 1100000000, 5);
-        setTimes(top / "sub" / "deeper", 1200000000, 7);
-        setTimes(top / "sub", 1300000000, 9);
-        setTimes(top, 1400000000, 11);
-        data_ = data;
+        for (auto [item, seconds] : kTimes) {
+            const struct timespec times[2] = {{seconds, seconds % 997},
+                                              {seconds + 1, seconds % 997}};
+            EXPECT_EQ(::utimensat(AT_FDCWD, (top / item).c_str(), times, AT_SYMLINK_NOFOLLOW), 0);
+        }
         return top;
     }
 
@@ -184,17 +185,13 @@ protected:
         EXPECT_EQ(xattrOf(top / "sub" / "small", "user.note"), "hello");
         EXPECT_EQ(aclText(top / "sub" / "small"), kFileACL);
         EXPECT_EQ(aclText(top / "sub", ACL_TYPE_DEFAULT), kDefaultACL);
-        auto empty = lstatOf(top / "sub" / "deeper" / "empty");
-        EXPECT_EQ(empty.st_atim.tv_sec, 1000000000);
-        EXPECT_EQ(empty.st_mtim.tv_nsec, 123456789);
-        // Directory times are set after their contents were written.
-        const std::pair<const char*, time_t> modified[] = {{"sub/deeper/empty", 1000000001},
-                                                           {"sub/link", 1100000001},
-                                                           {"sub/deeper", 1200000001},
-                                                           {"sub", 1300000001},
-                                                           {"", 1400000001}};
-        for (auto [item, seconds] : modified)
-            EXPECT_EQ(lstatOf(top / item).st_mtim.tv_sec, seconds) << item;
+        for (auto [item, seconds] : kTimes) {
+            const auto st = lstatOf(top / item);
+            EXPECT_EQ(st.st_mtim.tv_nsec, seconds % 997) << item;
+            EXPECT_EQ(st.st_mtim.tv_sec, seconds + 1) << item;
+        }
+        // Reading the tree moves other items' access times; an empty file's stays.
+        EXPECT_EQ(lstatOf(top / kTimes[0].first).st_atim.tv_sec, kTimes[0].second);
     }
 
     std::string data_;
@@ -285,24 +282,21 @@ TEST_F(MoveCopyTest, FailedCopyRemovesWhatItMade) {
 TEST_F(MoveCopyTest, TreesDeeperThanAPathCanBeAreCopiedWalkedAndRemoved) {
     makeDeepTree(dir() / "deep", 150); // about 6000 characters of path
     ASSERT_TRUE(manager_.copyItemAtURL(dir() / "deep", dir() / "copy"));
+    // The copy is walked by descriptor, its bottom file read through its parent's.
     int directories = 0;
-    std::string bottom;
-    auto walked = manager_._traverseDirectory(
-        dir() / "copy", [&](const QRNFileManager::TraversalEntry& entry) -> Status {
-            directories += entry.kind == QRNFileManager::TraversalEntry::Kind::DirectoryPreOrder;
-            if (entry.name == "bottom") {
-                char buffer[8] = {};
-                int fd = ::openat(entry.parentFd, "bottom", O_RDONLY | O_CLOEXEC);
-                EXPECT_EQ(::read(fd, buffer, sizeof buffer), 4);
-                ::close(fd);
-                bottom = buffer;
-                EXPECT_GT(entry.path.string().size(), std::size_t{PATH_MAX});
-            }
-            return {};
-        });
+    char bottom[8] = {};
+    auto walked = manager_._traverseDirectory(dir() / "copy", [&](const auto& entry) -> Status {
+        directories += entry.kind == QRNFileManager::TraversalEntry::Kind::DirectoryPreOrder;
+        if (entry.name == "bottom") {
+            Descriptor fd(::openat(entry.parentFd, "bottom", O_RDONLY | O_CLOEXEC));
+            EXPECT_EQ(::read(fd.get(), bottom, sizeof bottom), 4);
+            EXPECT_GT(entry.path.string().size(), std::size_t{PATH_MAX});
+        }
+        return {};
+    });
     ASSERT_TRUE(walked) << walked.error().description();
     EXPECT_EQ(directories, 151);
-    EXPECT_EQ(bottom, "deep");
+    EXPECT_STREQ(bottom, "deep");
     EXPECT_TRUE(manager_.removeItemAtURL(dir() / "copy"));
     EXPECT_TRUE(manager_.removeItemAtURL(dir() / "deep"));
     EXPECT_EQ(countEntries(dir()), 0);
