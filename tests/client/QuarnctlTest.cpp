@@ -7,6 +7,7 @@
 #include "Daemon/model/QRNContainerClass.h"
 #include "FakeServer.h"
 #include "common/TempRoot.h"
+#include "common/shared/RequestValues.h"
 
 #include <gtest/gtest.h>
 
@@ -20,16 +21,13 @@ using namespace quarn::test;
 
 // Container classes on the command line: numbers and short names of the
 // class table, nothing outside 1..13.
-TEST(ContainerClassName, EveryClassByNumberAndByName) {
+TEST(ContainerClassName, EveryClassByNumberAndByNameAndNothingElse) {
     for (std::uint64_t cls = 1; cls <= 13; ++cls) {
         EXPECT_EQ(ContainerClassName::parse(std::to_string(cls)), cls);
         EXPECT_EQ(ContainerClassName::parse(QRNContainerClass::shortName(cls)), cls);
     }
     EXPECT_EQ(ContainerClassName::parse("APPDATA"), 2u);
     EXPECT_EQ(ContainerClassName::parse("systemgroup"), 13u);
-}
-
-TEST(ContainerClassName, RefusesWhatIsNoClass) {
     for (const char* text : {"0", "14", "-1", "+2", " 2", "2x", "", "appdata2", "Undefined", "MAX",
                              "99999999999999999999"}) {
         EXPECT_FALSE(ContainerClassName::parse(text)) << text;
@@ -181,72 +179,70 @@ protected:
 
 } // namespace
 
-TEST_F(QuarnctlTest, CreatePrintsTheContainerAndSendsCommandZero) {
+// One walk through the subcommands: the request each sends, text and JSON
+// output, and the exit codes scripts rely on.
+TEST_F(QuarnctlTest, SubcommandsSendTheirRequestAndPrintTheReply) {
+    const auto sent = [&](const char* key) {
+        const Value* v = lastRequest().get(key);
+        return v ? *v : Value();
+    };
     const UUID uuid = UUID::random();
-    nextReply_.set("ReplyError", 1u);
-    nextReply_.set("ReplyUUID", uuid);
-    nextReply_.set("ReplyExisted", false);
-    nextReply_.set("ReplyPath", "/data/X");
-    nextReply_.set("ReplyIdentifier", "com.example.notes");
+    nextReply_ = dictionaryOf({{"ReplyError", 1u},
+                               {"ReplyUUID", uuid},
+                               {"ReplyExisted", false},
+                               {"ReplyPath", "/data/X"},
+                               {"ReplyIdentifier", "com.example.notes"}});
     auto result = run({"create", "-c", "appData", "com.example.notes"});
-    EXPECT_EQ(result.code, 0) << result.err;
+    EXPECT_EQ(result.code, Quarnctl::kSuccess) << result.err;
     EXPECT_EQ(result.out, "path        /data/X\nuuid        " + uuid.string() +
                               "\nidentifier  com.example.notes\nexisted     no\n");
-    EXPECT_EQ(lastRequest().get("CreateIfNecessary")->asBool(), true);
-    EXPECT_EQ(lastRequest().get("ContainerClass")->asUInt64(), 2u);
-
+    EXPECT_EQ(sent("CreateIfNecessary"), Value(true));
+    EXPECT_EQ(sent("ContainerClass"), Value(2u));
     // Global options may follow the subcommand.
     result = run({"lookup", "--class", "2", "--json"});
-    EXPECT_EQ(result.code, 0);
+    EXPECT_EQ(result.code, Quarnctl::kSuccess);
     EXPECT_NE(result.out.find("\"$uuid\": \"" + uuid.string() + "\""), std::string::npos)
         << result.out;
-    EXPECT_EQ(lastRequest().get("CreateIfNecessary")->asBool(), false);
-    EXPECT_EQ(lastRequest().get("Identifier"), nullptr);
-}
+    EXPECT_EQ(sent("CreateIfNecessary"), Value(false));
+    EXPECT_EQ(sent("Identifier"), Value());
 
-TEST_F(QuarnctlTest, DaemonErrorsGoToStderrWithExitOne) {
-    nextReply_.set("ReplyError", 21u);
-    auto result = run({"info", "get", "-c", "appData", "com.example.gone", "Color"});
+    nextReply_ = dictionaryOf({{"ReplyError", 21u}});
+    result = run({"info", "get", "-c", "appData", "com.example.gone", "Color"});
     EXPECT_EQ(result.code, Quarnctl::kFailed);
     EXPECT_EQ(result.err, "error 21 (ContainerNotFound)\n");
     EXPECT_EQ(result.out, "");
-    EXPECT_EQ(*lastRequest().get("Key"), Value("Color"));
-}
+    EXPECT_EQ(sent("Key"), Value("Color"));
 
-TEST_F(QuarnctlTest, InfoSetReadsTheValueAsTextOrAsJson) {
-    nextReply_.set("ReplyError", 1u);
-    ASSERT_EQ(run({"info", "set", "-c", "appData", "com.example.notes", "Color", "42"}).code, 0);
-    EXPECT_EQ(*lastRequest().get("Value")->asString(), "42");
-    ASSERT_EQ(run({"info", "set", "-c", "appData", "com.example.notes", "Size", "--json-value",
-                   R"({"$int": -42})"})
-                  .code,
+    nextReply_ = dictionaryOf({{"ReplyError", 1u}});
+    EXPECT_EQ(run({"info", "set", "-c", "appData", "com.example.notes", "Color", "42"}).code, 0);
+    EXPECT_EQ(sent("Value"), Value("42"));
+    EXPECT_EQ(run({"info", "set", "-c", "2", "x", "Size", "--json-value", R"({"$int": -42})"}).code,
               0);
-    EXPECT_EQ(lastRequest().get("Value")->asInt64(), -42);
-    EXPECT_EQ(run({"info", "set", "-c", "2", "x", "K", "--json-value", "{"}).code,
-              Quarnctl::kUsage);
-}
+    EXPECT_EQ(sent("Value").asInt64(), -42);
 
-TEST_F(QuarnctlTest, RawSendsTheJsonRequestAndPrintsTheReplyInTheConvention) {
-    nextReply_.set("ReplyError", 49u);
-    nextReply_.set("ReplyData", Value::Data{1, 2, 3});
-    auto result =
+    nextReply_ = dictionaryOf({{"ReplyError", 49u}, {"ReplyData", Value::Data{1, 2, 3}}});
+    result =
         run({"raw", R"({"Command": 27, "Id": {"$uuid": "E621E1F8-C36C-495A-93FC-0C247A3E6E5F"}})"});
     EXPECT_EQ(result.code, Quarnctl::kFailed);
     EXPECT_EQ(result.err, "error 49 (InvalidCommand)\n");
     EXPECT_NE(result.out.find(R"("$data": "AQID")"), std::string::npos) << result.out;
-    EXPECT_EQ(lastRequest().get("Id")->kind(), Value::Kind::UUID);
-    EXPECT_EQ(run({"raw", "[1, 2]"}).code, Quarnctl::kUsage);
-}
+    EXPECT_EQ(sent("Id").kind(), Value::Kind::UUID);
 
-TEST_F(QuarnctlTest, UsageErrorsAndAnUnreachableDaemonHaveTheirOwnCodes) {
-    EXPECT_EQ(run({"create", "-c", "appdata2", "x"}).code, Quarnctl::kUsage);
-    EXPECT_EQ(run({"create", "x"}).code, Quarnctl::kUsage); // no class
-    EXPECT_EQ(run({"metadata", "-c", "2", "--uuid", "nope", "x"}).code, Quarnctl::kUsage);
-    EXPECT_EQ(run({}).code, Quarnctl::kUsage);
+    // Usage errors send nothing.
+    const auto sentBefore = server_.requests().size();
+    for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
+             {"info", "set", "-c", "2", "x", "K", "--json-value", "{"},
+             {"raw", "[1, 2]"},
+             {"create", "-c", "appdata2", "x"},
+             {"create", "x"}, // no class
+             {"metadata", "-c", "2", "--uuid", "nope", "x"},
+             {}}) {
+        EXPECT_EQ(run(args).code, Quarnctl::kUsage) << (args.empty() ? "" : args[0]);
+    }
     EXPECT_EQ(run({"--help"}).code, Quarnctl::kSuccess);
-    EXPECT_TRUE(server_.requests().empty());
+    EXPECT_EQ(server_.requests().size(), sentBefore);
 
-    auto result = run({"--root", root_.path().string(), "personas"}, false);
+    result = run({"--root", root_.path().string(), "personas"}, false);
     EXPECT_EQ(result.code, Quarnctl::kUnreachable);
     EXPECT_NE(result.err.find("cannot connect"), std::string::npos) << result.err;
 }
