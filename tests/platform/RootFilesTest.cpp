@@ -61,14 +61,12 @@ TEST_F(RootFilesTest, OnlyAnExplicitTrueInAFeatureFileOfItsDirectorySwitchesAFea
     } cases[] = {
         {feature(on), true},
         {feature("<dict><key>Enabled</key><false/></dict>"), false},
-        {feature(on), true},
         {feature("<dict><key>Enabled</key><string>YES</string></dict>"), false},
         {feature("<dict><key>Enabled</key><integer>1</integer></dict>"), false},
         {feature("<true/>"), false},
         {feature("<dict/>"), false},
         {plist("<dict><key>g</key>" + on + "</dict>"), false},
         {"not a property list", false},
-        {"", false},
         {plist("<array><string>f</string></array>"), false},
         {plist("<dict><key>f</key>" + on), false},
     };
@@ -107,10 +105,6 @@ TEST(HostFlags, OnlyOneUnsigned32BitDecimalInTheRootsConfigFile) {
     EXPECT_FALSE(config.multiUserFlags());
     root.writeFile("/etc/quarnd/host-multiuser-flags", "3\n");
     EXPECT_EQ(config.multiUserFlags(), 3u);
-    for (const std::string& bad : {std::string("three\n"), std::string(1000, '1')}) {
-        root.writeFile("/etc/quarnd/host-multiuser-flags", bad);
-        EXPECT_FALSE(config.multiUserFlags());
-    }
     std::filesystem::remove(root / "/etc/quarnd/host-multiuser-flags");
     std::filesystem::create_directory(root / "/etc/quarnd/host-multiuser-flags");
     EXPECT_FALSE(config.multiUserFlags());
