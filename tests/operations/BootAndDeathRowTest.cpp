@@ -15,7 +15,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <cstring>
 #include <future>
 #include <map>
 #include <set>
@@ -53,11 +52,14 @@ protected:
         root_.writeFile(absolute, absolute);
         return root_ / absolute;
     }
-    // Runs one pass to its end (transaction closed) and answers its error.
-    static std::optional<Error> runPass() {
+    // Runs one pass to its end and answers its error; notes the open
+    // transactions while its completion runs.
+    std::optional<Error> runPass() {
         std::promise<std::optional<Error>> done;
-        shared().deleteContainersOnDeathRowWithCompletion(
-            [&done](std::optional<Error> error) { done.set_value(std::move(error)); });
+        shared().deleteContainersOnDeathRowWithCompletion([&](std::optional<Error> error) {
+            transactionsInCompletion_ = ProcessTransaction::count();
+            done.set_value(std::move(error));
+        });
         std::optional<Error> error = done.get_future().get();
         drainBackground();
         return error;
@@ -68,10 +70,10 @@ protected:
         std::atomic<int> calls{0};
         std::promise<void> done;
         auto completion = [&] {
-            if (check && calls == 0) {
-                check();
-            }
             if (++calls == 1) {
+                if (check) {
+                    check();
+                }
                 done.set_value();
             }
         };
@@ -84,9 +86,14 @@ protected:
         drainBackground();
         return calls;
     }
+    std::size_t transactionsInCompletion_ = 0;
 };
 
-TEST_F(DeathRowTest, MovesParkEachItemInItsOwnDirectoryAndMissingItemsStartNothing) {
+TEST_F(DeathRowTest, ItemsAreParkedApartAndPassesDestroyThemOrSetThemAside) {
+    fs::remove(deathRow());
+    EXPECT_FALSE(runPass().has_value()) << "a missing death row is nothing to do";
+    fs::create_directories(deathRow());
+    fs::create_directories(root_ / "/tmp");
     const std::size_t open = ProcessTransaction::count();
     background()->suspend(); // passes wait, so death row can be looked at
     EXPECT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / "/private/var/gone", true, true));
@@ -108,60 +115,40 @@ TEST_F(DeathRowTest, MovesParkEachItemInItsOwnDirectoryAndMissingItemsStartNothi
         EXPECT_TRUE(fs::exists(deathRow() / unique / "Data"));
     }
     EXPECT_FALSE(fs::exists(a) || fs::exists(b));
-
     background()->resume();
     drainBackground();
     EXPECT_EQ(ProcessTransaction::count(), open);
     EXPECT_EQ(entriesIn(deathRow()), 0u) << "the pass destroyed everything parked";
-}
 
-TEST_F(DeathRowTest, PassDestroysImmutableFilesAndClosesItsTransactionAfterTheCompletion) {
-    fs::path file = makeFile("/private/var/locked/Library/pinned");
-    int fd = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
-    ASSERT_GE(fd, 0);
+    // Immutable files are destroyed too, where the file system has the flag,
+    // and a pass's transaction stays open through its completion.
+    fs::path pinned = makeFile("/private/var/locked/Library/pinned");
+    int fd = ::open(pinned.c_str(), O_RDONLY | O_CLOEXEC);
     int flags = 0;
-    bool immutable = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
-    flags |= FS_IMMUTABLE_FL;
-    immutable = immutable && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
-    const int setError = errno;
-    ::close(fd);
-    if (!immutable) {
-        GTEST_SKIP() << "this file system refuses the immutable flag: " << std::strerror(setError);
+    if (fd >= 0 && ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0) {
+        flags |= FS_IMMUTABLE_FL;
+        (void)::ioctl(fd, FS_IOC_SETFLAGS, &flags);
     }
+    ::close(fd);
     ASSERT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / "/private/var/locked", true, false));
-
-    const std::size_t open = ProcessTransaction::count();
-    std::promise<std::size_t> openDuringCompletion;
-    shared().deleteContainersOnDeathRowWithCompletion([&](std::optional<Error> error) {
-        EXPECT_FALSE(error.has_value()) << error->description();
-        openDuringCompletion.set_value(ProcessTransaction::count());
-    });
-    EXPECT_EQ(openDuringCompletion.get_future().get(), open + 1);
-    drainBackground();
+    EXPECT_FALSE(runPass().has_value());
+    EXPECT_EQ(transactionsInCompletion_, open + 1);
     EXPECT_EQ(ProcessTransaction::count(), open);
     EXPECT_EQ(entriesIn(deathRow()), 0u);
     EXPECT_EQ(entriesIn(root_ / "/tmp"), 0u) << "destroyed, not moved aside";
-}
 
-TEST_F(DeathRowTest, PassMovesUndeletableItemsToTmpAndGoesOnAfterAFailure) {
-    fs::remove(deathRow());
-    EXPECT_FALSE(runPass().has_value()) << "a missing death row is nothing to do";
-    fs::create_directories(deathRow());
-    fs::create_directories(root_ / "/tmp");
+    // Nothing can be unlinked, and the first move aside fails too: the pass
+    // goes on after the failure and reports it.
     for (std::string dir : {"/private/var/one", "/private/var/two"}) {
         makeFile(dir + "/file");
         ASSERT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / dir, true, false));
     }
-    // Nothing can be unlinked, and the first move aside fails too.
     env_->failCallsFrom(EnvCall::Unlink, 1, EBUSY);
     env_->failCall(EnvCall::Rename, 1, EIO);
-    LogCapture log;
     std::optional<Error> error = runPass();
     env_->clearFailures();
-
     ASSERT_TRUE(error.has_value());
     EXPECT_TRUE(error->isQRN(kQRNErrorDestroyFailed));
-    EXPECT_EQ(log.count("Failed to destroy item at:"), 1u) << log.all();
     EXPECT_EQ(entriesIn(deathRow()), 1u) << "the failed item stays on death row";
     EXPECT_EQ(entriesIn(root_ / "/tmp"), 1u) << "the other went to /tmp below the root";
     EXPECT_FALSE(runPass().has_value());
@@ -213,9 +200,7 @@ TEST_F(DeathRowTest, SystemContainersGetNewDirectoriesExceptWellKnownAndAnalytic
     }
 }
 
-using BootCleanupTest = DeathRowTest;
-
-TEST_F(BootCleanupTest, StagingLeftoversAreDestroyedBeforeTheCompletionWhateverTheGlobalOneIs) {
+TEST_F(DeathRowTest, StagingLeftoversAreDestroyedBeforeTheCompletionWhateverTheGlobalOneIs) {
     const fs::path global = configuration().stagingDirectory();
     const fs::path leftover = makeTree(global / "global-leftover");
     const fs::path perUser = stagingDirectory(kQRNContainerClassAppData) / "leftover";
@@ -247,7 +232,7 @@ TEST_F(BootCleanupTest, StagingLeftoversAreDestroyedBeforeTheCompletionWhateverT
     EXPECT_TRUE(fs::exists(global)) << "the unreadable item itself is left alone";
 }
 
-TEST_F(BootCleanupTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsContainers) {
+TEST_F(DeathRowTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsContainers) {
     // The daemon's own connection may make any identifier's container.
     auto made = shared().createOrLookupContainerWithContainerIdentity(
         identity("com.example.kept", kQRNContainerClassAppData), true, false, true);
@@ -279,47 +264,43 @@ TEST_F(BootCleanupTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeeps
     // The next boot cleanup destroys what the first-boot one parked.
     EXPECT_EQ(runCleanup(false), 1);
     EXPECT_TRUE(namesOnDeathRow().empty());
-}
 
-TEST_F(BootCleanupTest, OrphanPassSkipsVanishedEntriesAndExplainsOnInternalBuilds) {
+    // The orphan pass skips entries gone since the listing, and explains
+    // itself on internal builds.
     configuration().setIsInternalImage(true);
-    const fs::path classDir = classDirectory(kQRNContainerClassAppGroup);
-    const fs::path orphan = makeTree(classDir / UUID::random().string());
-    const fs::path gone = classDir / UUID::random().string();
+    const fs::path groupOrphan =
+        makeTree(classDirectory(kQRNContainerClassAppGroup) / UUID::random().string());
     LogCapture log;
-    shared()._cleanupOrphanedDataForDirectories({gone, orphan}, kQRNContainerClassAppGroup);
+    shared()._cleanupOrphanedDataForDirectories(
+        {classDirectory(kQRNContainerClassAppGroup) / UUID::random().string(), groupOrphan},
+        kQRNContainerClassAppGroup);
     EXPECT_TRUE(log.contains("Here are the invalid files:")) << log.all();
-    EXPECT_FALSE(fs::exists(orphan));
+    EXPECT_FALSE(fs::exists(groupOrphan));
 }
 
 // First-boot setup: system containers restored from a backup are merged
 // into the live containers of their identifiers.
-class BootSetupTest : public DeathRowTest {
-protected:
-    fs::path live(const std::string& identifier, std::uint64_t cls) {
+TEST_F(DeathRowTest, BootSetupMergesRestoredContainersIntoTheLiveOnesAndSetsAsideTheRest) {
+    auto live = [this](const std::string& identifier, std::uint64_t cls) {
         QRNMetadataPtr made = create(identifier, cls);
         return made ? made->url() : fs::path();
-    }
-    std::shared_ptr<QRNPerUserConfiguration> perUser_ =
-        configuration().getPerUserConfigurationForUserIdentity(user());
-    const fs::path backupBase_ = perUser_->systemContainerBackupBaseDirectory();
-    const fs::path dataBackup_ = perUser_->systemContainerBackupDirectory();
-};
-
-TEST_F(BootSetupTest, RestoredContainersAreMergedIntoTheLiveOnesAndTheBackupRemoved) {
+    };
+    auto perUser = configuration().getPerUserConfigurationForUserIdentity(user());
+    const fs::path backupBase = perUser->systemContainerBackupBaseDirectory();
+    const fs::path dataBackup = perUser->systemContainerBackupDirectory();
     // Internal builds keep a backup they made, so nothing must be made here.
     configuration().setIsInternalImage(true);
     shared().rebootQuarnManagerSetup();
     shared().quarnManagerSetup();
-    EXPECT_FALSE(fs::exists(backupBase_)) << "made without a backup";
+    EXPECT_FALSE(fs::exists(backupBase)) << "made without a backup";
     configuration().setIsInternalImage(false);
     const fs::path existing = live("com.example.sysd", kQRNContainerClassSystemData);
     write(existing / "settings.plist", "old");
     write(existing / "local-only", "stays");
-    write(dataBackup_ / "com.example.sysd" / "settings.plist", "restored");
-    write(dataBackup_ / "com.example.sysd" / "Library" / "Preferences" / "p.plist", "prefs");
-    write(dataBackup_ / "com.example.sysd" / QRNMetadata::kFileName, "not metadata");
-    write(perUser_->systemGroupContainerBackupDirectory() / "systemgroup.com.example.shared" /
+    write(dataBackup / "com.example.sysd" / "settings.plist", "restored");
+    write(dataBackup / "com.example.sysd" / "Library" / "Preferences" / "p.plist", "prefs");
+    write(dataBackup / "com.example.sysd" / QRNMetadata::kFileName, "not metadata");
+    write(perUser->systemGroupContainerBackupDirectory() / "systemgroup.com.example.shared" /
               "shared.db",
           "group");
 
@@ -333,22 +314,20 @@ TEST_F(BootSetupTest, RestoredContainersAreMergedIntoTheLiveOnesAndTheBackupRemo
     EXPECT_EQ(
         read(live("systemgroup.com.example.shared", kQRNContainerClassSystemGroup) / "shared.db"),
         "group");
-    EXPECT_FALSE(fs::exists(backupBase_)) << "not an internal build: the backup goes";
-}
+    EXPECT_FALSE(fs::exists(backupBase)) << "not an internal build: the backup goes";
 
-TEST_F(BootSetupTest, AnItemThatCannotBeMergedIsSetAsideAndTheOthersStillInstalled) {
+    // An item that cannot be merged is set aside and the others still installed.
     configuration().setIsInternalImage(true);
-    write(dataBackup_ / "com.example.broken", "a file, not a container");
-    write(dataBackup_ / "com.example.fine" / "data", "fine");
+    write(dataBackup / "com.example.broken", "a file, not a container");
+    write(dataBackup / "com.example.fine" / "data", "fine");
     // A stale "inprogress" from a start cut short is replaced.
-    write(fs::path(dataBackup_.string() + ".inprogress") / "com.example.stale" / "x", "stale");
-
+    write(fs::path(dataBackup.string() + ".inprogress") / "com.example.stale" / "x", "stale");
     shared().rebootQuarnManagerSetup();
-    EXPECT_EQ(read(backupBase_ / "Data.failed" / "com.example.broken"), "a file, not a container");
+    EXPECT_EQ(read(backupBase / "Data.failed" / "com.example.broken"), "a file, not a container");
     EXPECT_EQ(read(live("com.example.fine", kQRNContainerClassSystemData) / "data"), "fine");
-    EXPECT_FALSE(fs::exists(backupBase_ / "Data.inprogress" / "com.example.stale"));
-    EXPECT_FALSE(fs::exists(dataBackup_));
-    EXPECT_TRUE(fs::exists(backupBase_)) << "internal builds keep the backup for inspection";
+    EXPECT_FALSE(fs::exists(backupBase / "Data.inprogress" / "com.example.stale"));
+    EXPECT_FALSE(fs::exists(dataBackup));
+    EXPECT_TRUE(fs::exists(backupBase)) << "internal builds keep the backup for inspection";
 }
 
 } // namespace
