@@ -43,6 +43,37 @@ std::string feature(const std::string& body) {
 
 using RootFilesTest = quarn::test::TempRootTest;
 
+using V = std::vector<std::int32_t>;
+
+// Collects the states a watch reports (it is the callback), for tests to wait on.
+struct Reports {
+    void operator()(std::int32_t state) {
+        std::lock_guard guard(mutex);
+        states.push_back(state);
+        changed.notify_all();
+    }
+    // Waits (generously) until `count` states arrived; 0 answers at once.
+    V waitFor(std::size_t count = 0) {
+        std::unique_lock lock(mutex);
+        changed.wait_for(lock, std::chrono::seconds(20), [&] { return states.size() >= count; });
+        return states;
+    }
+    std::mutex mutex; // guards states
+    std::condition_variable changed;
+    V states;
+};
+
+const std::string kLockFile = "/private/var/run/quarnd/lockstate";
+
+std::vector<std::string> linesOf(const std::filesystem::path& file) {
+    std::ifstream in(file);
+    std::vector<std::string> lines;
+    for (std::string line; std::getline(in, line);) {
+        lines.push_back(line);
+    }
+    return lines;
+}
+
 } // namespace
 
 TEST_F(RootFilesTest, OnlyAnExplicitTrueInAFeatureFileOfItsDirectorySwitchesAFeatureOn) {
@@ -307,34 +338,6 @@ TEST(AccountsOnSystemRoot, AsksTheNameServiceAndLeavesHomesAlone) {
     EXPECT_FALSE(a.userByName("no-such-user-quarn") || a.groupByName("no-such-group-quarn"));
 }
 
-namespace {
-
-using V = std::vector<std::int32_t>;
-
-// Collects the states a watch reports, for tests to wait on.
-struct Reports {
-    LockState::Callback callback() {
-        return [this](std::int32_t state) {
-            std::lock_guard guard(mutex);
-            states.push_back(state);
-            changed.notify_all();
-        };
-    }
-    // Waits (generously) until `count` states arrived; 0 answers at once.
-    V waitFor(std::size_t count = 0) {
-        std::unique_lock lock(mutex);
-        changed.wait_for(lock, std::chrono::seconds(20), [&] { return states.size() >= count; });
-        return states;
-    }
-    std::mutex mutex; // guards states
-    std::condition_variable changed;
-    V states;
-};
-
-const std::string kLockFile = "/private/var/run/quarnd/lockstate";
-
-} // namespace
-
 TEST_F(RootFilesTest, LockStateFollowsTheFileHoldingOneDecimalState) {
     const std::pair<const char*, std::optional<std::int32_t>> cases[] = {
         {"0", 0},   {"1\n", 1}, {"  3 \r\n", 3}, {"-2", -2},  {"", {}},    {"\n", {}},
@@ -373,7 +376,7 @@ TEST_F(RootFilesTest, LockStateWatchSeesChangesAndStopsCleanly) {
         EXPECT_EQ(first.waitFor(expected.size()), expected);
     };
     const auto write = [&](const char* text) { root_.writeFile(kLockFile, text); };
-    ASSERT_TRUE(lockState.startWatching(first.callback())); // makes the run directory
+    ASSERT_TRUE(lockState.startWatching(std::ref(first))); // makes the run directory
     step([&] { write("1"); }, 1);
     write("1"); // no change: not reported
     root_.writeFile("/private/var/run/quarnd/unrelated", "0");
@@ -386,12 +389,12 @@ TEST_F(RootFilesTest, LockStateWatchSeesChangesAndStopsCleanly) {
     step([&] { write("1"); }, 1);
 
     // A new watch replaces the old and does not report the state at its start (1).
-    ASSERT_TRUE(lockState.startWatching(second.callback()));
+    ASSERT_TRUE(lockState.startWatching(std::ref(second)));
     write("0");
     EXPECT_EQ(second.waitFor(1), V{0});
     lockState.stopWatching();
     lockState.stopWatching(); // twice is harmless
-    ASSERT_TRUE(lockState.startWatching(third.callback()));
+    ASSERT_TRUE(lockState.startWatching(std::ref(third)));
     write("1");
     EXPECT_EQ(third.waitFor(1), V{1});
     std::filesystem::remove_all(file.parent_path()); // a lost run directory is unlocked
@@ -404,30 +407,17 @@ TEST_F(RootFilesTest, LockStateWatchSeesChangesAndStopsCleanly) {
     // A callback may stop its own watch; destruction joins.
     auto lock = std::make_unique<LinuxLockState>(Paths(root_.path()));
     Reports reports;
-    ASSERT_TRUE(lock->startWatching([&, record = reports.callback()](std::int32_t state) {
+    ASSERT_TRUE(lock->startWatching([&](std::int32_t state) {
         lock->stopWatching(); // must neither deadlock nor crash
-        record(state);
+        reports(state);
     }));
     root_.writeFile(kLockFile, "1");
     EXPECT_EQ(reports.waitFor(1), V{1});
-    ASSERT_TRUE(lock->startWatching(reports.callback()));
+    ASSERT_TRUE(lock->startWatching(std::ref(reports)));
     lock.reset(); // with a live watch: the thread must be gone before the object
     root_.writeFile(kLockFile, "0");
     EXPECT_EQ(reports.waitFor(), V{1});
 }
-
-namespace {
-
-std::vector<std::string> linesOf(const std::filesystem::path& file) {
-    std::ifstream in(file);
-    std::vector<std::string> lines;
-    for (std::string line; std::getline(in, line);) {
-        lines.push_back(line);
-    }
-    return lines;
-}
-
-} // namespace
 
 // Each post appends a line to a file named after the notification and,
 // under a service manager, becomes the status line.

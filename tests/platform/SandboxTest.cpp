@@ -17,7 +17,7 @@
 #include <algorithm>
 #include <fstream>
 #include <iterator>
-#include <sstream>
+#include <ranges>
 #include <vector>
 
 using namespace quarn;
@@ -35,9 +35,8 @@ Token::Key keyOf(std::uint8_t fill) {
 
 Parts partsOf(const std::string& token) {
     Parts parts;
-    std::stringstream in(token);
-    for (std::string part; std::getline(in, part, ';');) {
-        parts.push_back(part);
+    for (const auto part : token | std::views::split(';')) {
+        parts.emplace_back(part.begin(), part.end());
     }
     return parts;
 }
@@ -50,6 +49,10 @@ std::string with(Parts parts, std::size_t index, std::string value) {
 
 const std::string kClass = "com.orvex.sandbox.container";
 const std::string kPath = "/private/var/mobile/Containers/Data/Application/X;Y";
+
+SandboxItem item(std::string id, std::uint64_t cls, std::string path) {
+    return SandboxItem{1, std::move(id), cls, 501, std::move(path)};
+}
 
 } // namespace
 
@@ -85,13 +88,11 @@ TEST(SandboxExtensionTokenTest, VerifiesOnlyUnderItsKeyWithEveryFieldInItsOnlySp
     EXPECT_FALSE(Token::verify(with(partsOf(*second), 5, partsOf(*first)[5]), keyOf(3)));
 
     // Fields that cannot be written, garbage and second spellings.
-    for (const auto& [cls, path] : std::initializer_list<std::pair<std::string, std::string>>{
-             {"", kPath},
-             {"a;b", kPath},
-             {"with space", kPath},
-             {kClass, ""},
-             {kClass, std::string(Token::kMaxPathSize + 1, 'p')}}) {
-        EXPECT_FALSE(Token::make(keyOf(7), cls, path, 1, 1)) << cls << " " << path.size();
+    for (const char* cls : {"", "a;b", "with space"}) {
+        EXPECT_FALSE(Token::make(keyOf(7), cls, kPath, 1, 1)) << cls;
+    }
+    for (const auto& path : {std::string(), std::string(Token::kMaxPathSize + 1, 'p')}) {
+        EXPECT_FALSE(Token::make(keyOf(7), kClass, path, 1, 1)) << path.size();
     }
     std::string upper = parts[5];
     std::ranges::transform(upper, upper.begin(), [](char c) { return std::toupper(c); });
@@ -162,12 +163,6 @@ TEST(SandboxExtensionsTest, IssuesTokensUnderTheKeyOfItsFileAndRefusesEmptyPathA
         EXPECT_NE(freshKey, contents);
     }
 }
-
-namespace {
-SandboxItem item(std::string id, std::uint64_t cls, std::string path) {
-    return SandboxItem{1, std::move(id), cls, 501, std::move(path)};
-}
-} // namespace
 
 TEST(SandboxKernel, MappingsArePerUserAndReplaceByIdentity) {
     InMemorySandboxKernel k;
