@@ -101,6 +101,9 @@ protected:
             .containerForContainerIdentity(identity, transient)
             .has_value();
     }
+    static bool cached(const std::string& identifier, std::uint64_t cls) {
+        return cached(identity(identifier, cls));
+    }
 
     static Path classDirectory(std::uint64_t cls, bool transient = false) {
         return *configuration().containerDirectoryURLForUserIdentity(user(), cls, transient);
@@ -139,6 +142,7 @@ protected:
     // Waits for the background passes queued so far.
     static void drainBackground() {
         QRNClientConnection::_sharedBackgroundQueue()->sync([] {});
+        QRNClientConnection::_sharedDeathrowQueue()->sync([] {});
         QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
     }
     // Every Env call made so far, of any kind.

@@ -5,32 +5,19 @@
 // fake extension issuer records the tokens asked for, and a mapping with
 // group records stands in for the code-signing database.
 
+#include "operations/CreateFixture.h"
+
 #include "Daemon/codesigning/QRNCodeSigningMapping.h"
-#include "Daemon/model/QRNContainerCache.h"
-#include "Daemon/model/QRNMetadata.h"
-#include "Daemon/model/QRNUserIdentitySharedCache.h"
-#include "Daemon/operations/QRNClientConnection.h"
-#include "Daemon/operations/QRNClientIdentity.h"
 #include "Daemon/platform/CodeSigningRegistry.h"
 #include "Daemon/platform/IpcConnection.h"
 #include "Daemon/platform/SandboxExtensions.h"
 #include "Daemon/service/QRNVellEvent.h"
-#include "Daemon/support/Queue.h"
-
-#include "common/TempRoot.h"
-#include "common/shared/RequestValues.h"
-
-#include <gtest/gtest.h>
 
 #include <unistd.h>
 
 #include <functional>
 #include <map>
-#include <memory>
 #include <mutex>
-#include <optional>
-#include <string>
-#include <vector>
 
 namespace quarn::test {
 
@@ -127,15 +114,14 @@ inline IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body,
     return event;
 }
 
-class VellEventFixture : public ::testing::Test {
+class VellEventFixture : public CreateFixture {
 protected:
-    VellEventFixture() {
+    VellEventFixture() : CreateFixture(false) {
         root_.context().install<CodeSigningRegistry>(registry_);
         root_.context().install<SandboxExtensions>(extensions_);
         root_.context().install<QRNCodeSigningMapping>(mapping_);
         setClient(kVellClient, Value::dictionary());
     }
-    ~VellEventFixture() override { drainDeathRow(); }
 
     // The client the registry reports from now on.
     void setClient(const std::string& identifier, Value entitlements) {
@@ -144,7 +130,6 @@ protected:
     static Value allowed() {
         return dictionaryOf({{"com.orvex.private.Quarn.allowed", Value(true)}});
     }
-
     // Delivers one request with a reply context; answers every reply sent
     // on the connection for it.
     std::vector<Value> dispatch(const Value& request) {
@@ -162,36 +147,6 @@ protected:
     }
     std::uint64_t codeOf(const Value& request) { return replyError(send(request)); }
 
-    static QRNUserIdentityPtr user() {
-        return QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity();
-    }
-    static QRNContainerIdentityPtr identity(const std::string& identifier, std::uint64_t cls) {
-        auto made =
-            QRNContainerIdentity::containerIdentityWithUserIdentity(user(), identifier, cls);
-        EXPECT_TRUE(made.has_value());
-        return made ? *made : nullptr;
-    }
-    // Creates (or finds) a container with every right.
-    static QRNMetadataPtr create(const std::string& identifier, std::uint64_t cls) {
-        auto made = QRNClientConnection::privilegedClientConnectionWithUserIdentity(user())
-                        ->createOrLookupContainerWithContainerIdentity(identity(identifier, cls),
-                                                                       true, false, true);
-        EXPECT_TRUE(made.has_value()) << "code " << (made ? 1 : made.error());
-        return made ? *made : nullptr;
-    }
-    // Whether the cache still knows the container.
-    static bool cached(const std::string& identifier, std::uint64_t cls) {
-        return QRNContainerCache::sharedInstance()
-            .containerForContainerIdentity(identity(identifier, cls))
-            .has_value();
-    }
-    // Waits for the background deletion passes started so far.
-    static void drainDeathRow() {
-        QRNClientConnection::_sharedDeathrowQueue()->sync([] {});
-        QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
-    }
-
-    TempRoot root_;
     std::shared_ptr<FakeIpcConnection> connection_ = std::make_shared<FakeIpcConnection>();
     std::shared_ptr<FakeCodeSigningRegistry> registry_ =
         std::make_shared<FakeCodeSigningRegistry>();

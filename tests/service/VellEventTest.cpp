@@ -143,13 +143,13 @@ TEST_F(VellEventTest, DeathRowDeletionRepliesOnceFromItsCompletion) {
     std::filesystem::create_directories(deathrow / "A" / "deep");
     // Refused: the dispatcher's reply is the only one.
     EXPECT_EQ(codeOf(dictionaryOf({{"Command", Value(4u)}})), 55u);
-    drainDeathRow();
+    drainBackground();
     EXPECT_TRUE(std::filesystem::exists(deathrow / "A"));
     connection_ = std::make_shared<FakeIpcConnection>();
     setClient(kVellClient,
               dictionaryOf({{"com.orvex.private.Quarn.userManagedAssets", Value(true)}}));
     dispatch(dictionaryOf({{"Command", Value(4u)}}));
-    drainDeathRow();
+    drainBackground();
     EXPECT_EQ(connection_->replies(),
               std::vector<Value>{dictionaryOf({{"ReplyError", Value(1u)}})});
     EXPECT_FALSE(std::filesystem::exists(deathrow / "A"));
