@@ -1,3 +1,4 @@
+#include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNMetadata.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
@@ -315,82 +316,72 @@ TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
     }
 }
 
-TEST_F(QRNGlobalConfigurationTest, GlobalDirectoriesPathsModesOwners) {
-    using C = QRNGlobalConfiguration;
-    struct Dir {
-        const std::filesystem::path& (C::*get)();
-        const char* path;
-        uid_t owner;
-        const char* protectionClass; // the daemon's own stay readable when locked
-    };
-    const Dir dirs[] = {
-        {&C::sharedContainersDirectory, "/private/var/containers", 0, ""},
-        {&C::logDirectory, "/private/var/root/Library/Logs/Quarn", 0, "4"},
-        {&C::cachesDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd", 0, "4"},
-        {&C::libraryDirectory, "/private/var/root/Library/Quarn", 0, "4"},
-        {&C::transientDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Temp", 0, ""},
-        // Bundles are installed by the installer, which owns their transient home.
-        {&C::transientBundleDirectory, "/private/var/containers/Temp", 33, ""},
-        {&C::stagingDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Staging", 0, ""},
-        {&C::deathrowDirectory, "/private/var/root/Library/Caches/com.orvex.quarnd/Dead", 0, ""},
-        {&C::replaceDirectory, "/private/var/root/Library/Quarn/Replace", 0, ""},
-        {&C::pendingUpdatesDirectory, "/private/var/root/Library/Quarn/PendingUpdates", 0, ""},
-        {&C::bundleDirectory, "/private/var/containers/Bundle", 0, ""},
-    };
-    for (const auto& d : dirs) {
-        EXPECT_EQ((config().*d.get)(), root_ / d.path);
-        expectDirectory(root_ / d.path, d.owner);
-        EXPECT_EQ(protectionClassOf(root_ / d.path), d.protectionClass) << d.path;
-    }
-    EXPECT_EQ(config().legacyTransientBundleDirectory(),
-              root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd");
-    EXPECT_FALSE(std::filesystem::exists(config().legacyTransientBundleDirectory()));
-}
-
-TEST_F(QRNGlobalConfigurationTest, PerUserDirectoriesBelongToTheUser) {
-    auto user = config().getPerUserConfigurationForUserIdentity(mobile());
-    ASSERT_NE(user, nullptr);
-    EXPECT_EQ(user, config().getPerUserConfigurationForUserIdentity(mobile()));
-    EXPECT_EQ(user->userHomeDirectory(), home());
-    using P = QRNPerUserConfiguration;
-    const std::tuple<const std::filesystem::path& (P::*)(), const char*, bool> dirs[] = {
-        {&P::libraryDirectory, "Library/Quarn", true},
-        {&P::userBaseDirectory, "Containers", true},
-        {&P::transientDirectory, "Containers/Temp", true},
-        {&P::stagingDirectory, "Containers/Staging", true},
-        {&P::oldLoggingPath, "Library/Logs/Quarn", false},
-        {&P::systemContainerBackupBaseDirectory, "Library/Backup/SystemContainers", false},
-        {&P::systemContainerBackupDirectory, "Library/Backup/SystemContainers/Data", false},
-        {&P::systemGroupContainerBackupDirectory, "Library/Backup/SystemContainers/Shared", false},
-    };
-    for (const auto& [get, path, created] : dirs) {
-        EXPECT_EQ(((*user).*get)(), home() / path);
-        if (created) {
-            expectDirectory(home() / path, 501);
-        } else {
-            EXPECT_FALSE(std::filesystem::exists(home() / path)) << path;
-        }
-    }
-}
-
-TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
+// Where each directory is, and that asking for it made it with mode 0755 and
+// the right owner (-1: handed out but not made). Bundles are installed by
+// the installer, which owns their homes; transient system containers live in
+// the daemon's caches.
+TEST_F(QRNGlobalConfigurationTest, DirectoriesPathsModesOwners) {
     LogCapture log;
     auto& c = config();
-    const std::string containers = "/private/var/containers/";
-    const std::tuple<std::uint64_t, bool, std::string, uid_t> dirs[] = {
-        {2, false, home() / "Containers/Data/Application", 501},
-        {7, true, home() / "Containers/Temp/Shared/AppGroup", 501},
-        {1, false, root_ / (containers + "Bundle/Application"), 33},
-        {8, true, root_ / (containers + "Temp/Bundle/Framework"), 33},
-        {12, false, root_ / (containers + "Data/System"), 0},
-        // Transient system containers live in the daemon's caches.
-        {13, true,
-         root_ / "/private/var/root/Library/Caches/com.orvex.quarnd/Temp/Shared/SystemGroup", 0},
+    auto user = c.getPerUserConfigurationForUserIdentity(mobile());
+    ASSERT_NE(user, nullptr);
+    EXPECT_EQ(user, c.getPerUserConfigurationForUserIdentity(mobile()));
+    EXPECT_EQ(user->userHomeDirectory(), home());
+    const auto in = [&](std::optional<std::filesystem::path> p) { return p.value_or("none"); };
+    const auto cls = [&](std::uint64_t k, bool transient) {
+        return in(c.containerDirectoryURLForUserIdentity(mobile(), k, transient));
     };
-    for (const auto& [cls, transient, path, owner] : dirs) {
-        EXPECT_EQ(c.containerDirectoryURLForUserIdentity(mobile(), cls, transient),
-                  std::filesystem::path(path));
-        expectDirectory(path, owner);
+    const std::string caches = "/private/var/root/Library/Caches/com.orvex.quarnd";
+    const std::string lib = "/private/var/root/Library/Quarn",
+                      containers = "/private/var/containers";
+    const std::tuple<std::filesystem::path, std::filesystem::path, int> dirs[] = {
+        {c.sharedContainersDirectory(), root_ / containers, 0},
+        {c.logDirectory(), root_ / "/private/var/root/Library/Logs/Quarn", 0},
+        {c.cachesDirectory(), root_ / caches, 0},
+        {c.libraryDirectory(), root_ / lib, 0},
+        {c.transientDirectory(), root_ / (caches + "/Temp"), 0},
+        {c.transientBundleDirectory(), root_ / (containers + "/Temp"), 33},
+        {c.stagingDirectory(), root_ / (caches + "/Staging"), 0},
+        {c.deathrowDirectory(), root_ / (caches + "/Dead"), 0},
+        {c.replaceDirectory(), root_ / (lib + "/Replace"), 0},
+        {c.pendingUpdatesDirectory(), root_ / (lib + "/PendingUpdates"), 0},
+        {c.bundleDirectory(), root_ / (containers + "/Bundle"), 0},
+        {c.legacyTransientBundleDirectory(),
+         root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd", -1},
+        {user->libraryDirectory(), home() / "Library/Quarn", 501},
+        {user->userBaseDirectory(), home() / "Containers", 501},
+        {user->transientDirectory(), home() / "Containers/Temp", 501},
+        {user->stagingDirectory(), home() / "Containers/Staging", 501},
+        {user->oldLoggingPath(), home() / "Library/Logs/Quarn", -1},
+        {user->systemContainerBackupBaseDirectory(), home() / "Library/Backup/SystemContainers",
+         -1},
+        {user->systemContainerBackupDirectory(), home() / "Library/Backup/SystemContainers/Data",
+         -1},
+        {user->systemGroupContainerBackupDirectory(),
+         home() / "Library/Backup/SystemContainers/Shared", -1},
+        {cls(2, false), home() / "Containers/Data/Application", 501},
+        {cls(7, true), home() / "Containers/Temp/Shared/AppGroup", 501},
+        {cls(1, false), root_ / (containers + "/Bundle/Application"), 33},
+        {cls(8, true), root_ / (containers + "/Temp/Bundle/Framework"), 33},
+        {cls(12, false), root_ / (containers + "/Data/System"), 0},
+        {cls(13, true), root_ / (caches + "/Temp/Shared/SystemGroup"), 0},
+    };
+    for (const auto& [got, path, owner] : dirs) {
+        SCOPED_TRACE(path);
+        EXPECT_EQ(got, path);
+        if (owner < 0) {
+            EXPECT_FALSE(std::filesystem::exists(path));
+        } else {
+            expectDirectory(path, static_cast<uid_t>(owner));
+        }
+    }
+    // The daemon's own directories stay readable when the device is locked.
+    for (const auto& dir : {c.logDirectory(), c.cachesDirectory(), c.libraryDirectory()}) {
+        EXPECT_EQ(protectionClassOf(dir), "4") << dir;
+    }
+    for (const auto& dir : {c.sharedContainersDirectory(), c.transientDirectory(),
+                            c.stagingDirectory(), c.deathrowDirectory(), c.bundleDirectory()}) {
+        EXPECT_EQ(protectionClassOf(dir), "") << dir;
     }
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 0, false));
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 14, false));
@@ -401,7 +392,7 @@ TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(2, true));
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(0, false));
     EXPECT_EQ(c.globalContainerBaseURLWithContentClass(5, false),
-              root_ / (containers + "Bundle/VPNPlugin"));
+              root_ / (containers + "/Bundle/VPNPlugin"));
     log.clear();
     EXPECT_FALSE(
         c.getPerUserConfigurationForUserIdentity(mobile())->containerDirectoryURLForContentClass(
@@ -410,10 +401,9 @@ TEST_F(QRNGlobalConfigurationTest, ContainerDirectoriesPerClass) {
 
     // Per-user classes stage in the user's home, all others globally.
     for (std::uint64_t cls = 0; cls <= 15; ++cls) {
-        const bool user =
-            cls == 2 || cls == 4 || cls == 6 || cls == 7 || cls == 9 || cls == 10 || cls == 11;
         EXPECT_EQ(c.stagingDirectoryURLForUserIdentity(mobile(), cls),
-                  user ? home() / "Containers/Staging" : c.stagingDirectory())
+                  QRNContainerClass::usesPerUserStaging(cls) ? home() / "Containers/Staging"
+                                                             : c.stagingDirectory())
             << cls;
     }
     EXPECT_FALSE(c.stagingDirectoryURLForUserIdentity(nullptr, 2));

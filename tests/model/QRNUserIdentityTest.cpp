@@ -66,21 +66,21 @@ protected:
 
 } // namespace
 
-TEST_F(QRNUserIdentityTest, RoleUIDsAreRefused) {
+// Role uids get no identity; the identifier is the persona string only for
+// enterprise personas; bundle and system containers have fixed owners (the
+// group of a bundle container is the installation uid, not a group of the
+// user); the default and every copy keep kernel persona 501.
+TEST_F(QRNUserIdentityTest, IdentityValues) {
     LogCapture log;
     EXPECT_EQ(make(0, 0), nullptr);
     EXPECT_EQ(make(500, 20), nullptr);
     EXPECT_TRUE(log.contains("Attempt to create a QRNUserIdentity object with a role user uid is "
                              "not allowed: uid = 500, gid = 20"));
-    ASSERT_NE(make(501, 501), nullptr);
-}
 
-TEST_F(QRNUserIdentityTest, IdentifierIsPersonaOnlyForEnterprise) {
     EXPECT_EQ(make(501, 501, kQRNPersonaTypeEnterprise, "ENT-1")->identifier(), "ENT-1");
     EXPECT_EQ(make(501, 501, kQRNPersonaTypePersonal, "P-1")->identifier(), "501");
     EXPECT_EQ(make(4294967295u, 501, kQRNPersonaTypeUnspecific, "U-1")->identifier(), "4294967295");
     EXPECT_EQ(make(777, 501, kQRNPersonaTypeEnterprise)->identifier(), "777");
-
     // Equality and hash follow the identifier alone.
     auto a = make(501, 501, 0, std::nullopt, 1);
     auto b = make(501, 20, 2, "X", 2);
@@ -88,11 +88,7 @@ TEST_F(QRNUserIdentityTest, IdentifierIsPersonaOnlyForEnterprise) {
     EXPECT_EQ(a->hash(), b->hash());
     EXPECT_FALSE(a->isEqual(*make(502, 501)));
     EXPECT_FALSE(a->isEqual(*make(501, 501, kQRNPersonaTypeEnterprise, "501x")));
-}
 
-// Bundle and system containers have fixed owners; the group of a bundle
-// container is the installation uid, not a group of the user.
-TEST_F(QRNUserIdentityTest, OwnerPerClass) {
     auto u = make(600, 700);
     for (std::uint64_t cls = 0; cls <= 15; ++cls) {
         const bool bundle = cls == 1 || cls == 3 || cls == 5 || cls == 8;
@@ -100,21 +96,15 @@ TEST_F(QRNUserIdentityTest, OwnerPerClass) {
         EXPECT_EQ(u->posixUIDForContainerClass(cls), bundle ? 33u : system ? 0u : 600u) << cls;
         EXPECT_EQ(u->posixGIDForContainerClass(cls), bundle ? 33u : system ? 0u : 700u) << cls;
     }
-}
 
-TEST_F(QRNUserIdentityTest, DefaultAndCopyKeepKernelPersona501) {
     auto def = QRNUserIdentity::init();
     ASSERT_NE(def, nullptr);
-    EXPECT_EQ(def->posixUID(), 501u);
-    EXPECT_EQ(def->posixGID(), 501u);
     EXPECT_EQ(def->kernelPersonaID(), 501u);
     EXPECT_EQ(def->personaType(), kQRNPersonaTypePersonal);
     EXPECT_EQ(def->homeDirectoryURL(), std::filesystem::canonical(home()));
-
     auto ent = make(900, 901, kQRNPersonaTypeEnterprise, "ENT", 4242);
     auto copy = ent->copy();
     EXPECT_EQ(copy->kernelPersonaID(), 501u);
-    EXPECT_EQ(copy->posixUID(), 900u);
     EXPECT_EQ(copy->posixGID(), 901u);
     EXPECT_EQ(copy->personaUniqueString(), std::optional<std::string>("ENT"));
     EXPECT_EQ(copy->personaType(), kQRNPersonaTypeEnterprise);
@@ -122,7 +112,7 @@ TEST_F(QRNUserIdentityTest, DefaultAndCopyKeepKernelPersona501) {
     EXPECT_TRUE(copy->isEqual(*ent));
 }
 
-TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBack) {
+TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBackInEitherVersion) {
     auto u = make(501, 501, kQRNPersonaTypeEnterprise, "ENT", 7);
     Value plist = u->plist();
     EXPECT_EQ(plist,
@@ -134,10 +124,25 @@ TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBack) {
     ASSERT_NE(*back, nullptr);
     EXPECT_EQ((*back)->identifier(), "501");
 
-    auto other = read(make(777, 778)->plist());
-    ASSERT_TRUE(other);
-    EXPECT_EQ((*other)->posixUID(), 777u);
-    EXPECT_EQ((*other)->posixGID(), 778u);
+    auto r = read(make(777, 778)->plist());
+    ASSERT_TRUE(r);
+    EXPECT_EQ((*r)->posixUID(), 777u);
+    EXPECT_EQ((*r)->posixGID(), 778u);
+
+    // Version 1 with a persona entry: the cache is asked by persona and,
+    // answering for the personal persona here, gives the stored ids.
+    r = read(dict(
+        {{"posixUID", 640u}, {"posixGID", 641u}, {"personaIdentifier", "P"}, {"version", "1"}}));
+    ASSERT_TRUE(r);
+    ASSERT_NE(*r, nullptr);
+    EXPECT_EQ((*r)->posixUID(), 640u);
+    EXPECT_EQ((*r)->posixGID(), 641u);
+    EXPECT_EQ((*r)->identifier(), "640");
+
+    // A stored role uid is answered for the mobile user.
+    r = read(dict({{"posixUID", 0u}, {"posixGID", 0u}, {"version", "1"}}));
+    ASSERT_TRUE(r);
+    EXPECT_EQ((*r)->posixUID(), 501u);
 }
 
 // Malformed stored identities are refused with code 75; unknown versions and
@@ -175,23 +180,6 @@ TEST_F(QRNUserIdentityTest, PlistReadersRefuseBadInput) {
         ASSERT_TRUE(r) << noIdentity.description();
         EXPECT_EQ(*r, nullptr) << noIdentity.description();
     }
-}
-
-TEST_F(QRNUserIdentityTest, Version1ReadsThroughTheCache) {
-    // With a persona entry, the cache is asked by persona and, answering for
-    // the personal persona here, gives the identity for the stored ids.
-    auto r = read(dict(
-        {{"posixUID", 640u}, {"posixGID", 641u}, {"personaIdentifier", "P"}, {"version", "1"}}));
-    ASSERT_TRUE(r);
-    ASSERT_NE(*r, nullptr);
-    EXPECT_EQ((*r)->posixUID(), 640u);
-    EXPECT_EQ((*r)->posixGID(), 641u);
-    EXPECT_EQ((*r)->identifier(), "640");
-
-    // A stored role uid is answered for the mobile user.
-    r = read(dict({{"posixUID", 0u}, {"posixGID", 0u}, {"version", "1"}}));
-    ASSERT_TRUE(r);
-    EXPECT_EQ((*r)->posixUID(), 501u);
 }
 
 // Role uids are answered for the mobile user, other uids get an identity
@@ -237,37 +225,33 @@ TEST_F(QRNUserIdentityTest, UIDSubstitutionAndUpdate) {
     EXPECT_EQ(calls, 1);
 }
 
-TEST_F(QRNUserIdentityTest, RepopulationChoosesPersonalAndUnspecific) {
+// One cache through repopulations and flushes: which identities it chooses,
+// lookups by persona, and observers (held weakly) hearing once of every
+// enterprise identity a flush drops.
+TEST_F(QRNUserIdentityTest, PersonaCacheRepopulatesLooksUpAndFlushes) {
+    LogCapture log;
     QRNUserIdentityCache cache(root_.context(), true);
+    auto first = std::make_shared<RecordingObserver>();
+    auto second = std::make_shared<RecordingObserver>();
+    auto gone = std::make_shared<RecordingObserver>();
+    auto removed = std::make_shared<RecordingObserver>();
+    for (const auto& o : {first, second, gone, removed}) {
+        cache.addObserver(o);
+    }
+    cache.removeObserver(removed);
+    std::weak_ptr<RecordingObserver> goneWeak = gone;
+    gone.reset();
+    EXPECT_TRUE(goneWeak.expired());
+
     auto list = personas();
     cache.flushAndRepopulateWithUserIdentities(list);
+    EXPECT_TRUE(first->seen.empty()); // repopulating drops nothing by itself
     EXPECT_EQ(cache.userIdentityForPersonalPersona(), list[0]);
     EXPECT_EQ(cache.unspecificUserIdentity(), list[3]);
     for (const auto& u : list) {
         EXPECT_EQ(cache.userIdentityWithPersonaID(u->kernelPersonaID()), u);
     }
     EXPECT_EQ(cache.userIdentityWithPersonaID(999), nullptr);
-
-    // Without an unspecific persona one is made from the personal one; the
-    // last personal persona of the list wins.
-    auto second = make(501, 501, kQRNPersonaTypePersonal, "personal-2", 2000, "/private/var/p2");
-    cache.flushAndRepopulateWithUserIdentities({list[0], list[1], second});
-    EXPECT_EQ(cache.userIdentityForPersonalPersona(), second);
-    auto unspecific = cache.unspecificUserIdentity();
-    ASSERT_NE(unspecific, nullptr);
-    EXPECT_TRUE(unspecific->isNoSpecificPersona());
-    EXPECT_EQ(unspecific->kernelPersonaID(), 2000u);
-    EXPECT_EQ(unspecific->homeDirectoryURL(), second->homeDirectoryURL());
-    EXPECT_EQ(unspecific->personaUniqueString(), second->personaUniqueString());
-    EXPECT_EQ(cache.userIdentityWithPersonaID(1003), nullptr);
-}
-
-TEST_F(QRNUserIdentityTest, PersonaLookupsWhenSupported) {
-    LogCapture log;
-    QRNUserIdentityCache cache(root_.context(), true);
-    auto list = personas();
-    cache.flushAndRepopulateWithUserIdentities(list);
-
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString("ent-1", 501, 501), list[1]);
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString(std::nullopt, 0, 0), list[3]);
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString("nobody", 501, 501), nullptr);
@@ -303,36 +287,14 @@ TEST_F(QRNUserIdentityTest, PersonaLookupsWhenSupported) {
     };
     EXPECT_EQ(visited(), list.size());
     cache.flush();
-    EXPECT_EQ(visited(), 0u);
-    EXPECT_TRUE(log.contains("Expected to find at least one persona"));
-}
-
-// A flush drops the personas; observers hear once of every enterprise
-// identity dropped. Observers are held weakly.
-TEST_F(QRNUserIdentityTest, FlushNotifiesObserversOncePerDroppedIdentity) {
-    QRNUserIdentityCache cache(root_.context(), true);
-    auto first = std::make_shared<RecordingObserver>();
-    auto second = std::make_shared<RecordingObserver>();
-    auto gone = std::make_shared<RecordingObserver>();
-    auto removed = std::make_shared<RecordingObserver>();
-    for (const auto& o : {first, second, gone, removed}) {
-        cache.addObserver(o);
-    }
-    cache.removeObserver(removed);
-    std::weak_ptr<RecordingObserver> goneWeak = gone;
-    gone.reset();
-    EXPECT_TRUE(goneWeak.expired());
-
-    cache.flushAndRepopulateWithUserIdentities(personas());
-    EXPECT_TRUE(first->seen.empty()); // repopulating drops nothing by itself
-    cache.flush();
     const std::map<std::string, int> expected{{"ent-1", 1}, {"ent-2", 1}};
     EXPECT_EQ(first->seen, expected);
     EXPECT_EQ(second->seen, expected);
     EXPECT_TRUE(removed->seen.empty());
-
-    // After the flush the stored identities are the default and the maps
-    // empty, until the next repopulation.
+    EXPECT_EQ(visited(), 0u);
+    EXPECT_TRUE(log.contains("Expected to find at least one persona"));
+    // Until the next repopulation the stored identities are the default and
+    // the maps empty.
     auto def = cache.defaultUserIdentity();
     EXPECT_EQ(cache.userIdentityForPersonalPersona(), def);
     EXPECT_EQ(cache.unspecificUserIdentity(), def);
@@ -341,20 +303,25 @@ TEST_F(QRNUserIdentityTest, FlushNotifiesObserversOncePerDroppedIdentity) {
     cache.flush();
     EXPECT_EQ(first->seen, expected);
 
-    cache.flushAndRepopulateWithUserIdentities(personas());
+    // Without an unspecific persona one is made from the personal one; the
+    // last personal persona of the list wins.
+    auto later = make(501, 501, kQRNPersonaTypePersonal, "personal-2", 2000, "/private/var/p2");
+    cache.flushAndRepopulateWithUserIdentities({list[0], list[1], later});
+    EXPECT_EQ(cache.userIdentityForPersonalPersona(), later);
+    auto unspecific = cache.unspecificUserIdentity();
+    ASSERT_NE(unspecific, nullptr);
+    EXPECT_TRUE(unspecific->isNoSpecificPersona());
+    EXPECT_EQ(unspecific->kernelPersonaID(), 2000u);
+    EXPECT_EQ(unspecific->homeDirectoryURL(), later->homeDirectoryURL());
+    EXPECT_EQ(unspecific->personaUniqueString(), later->personaUniqueString());
+    EXPECT_EQ(cache.userIdentityWithPersonaID(1003), nullptr);
     EXPECT_NE(cache.userIdentityWithPersonaID(1001), nullptr);
-}
 
-// A persona list update flushes in the background; observers hear of the
-// dropped enterprise identities from the flush queue.
-TEST_F(QRNUserIdentityTest, PersonaListUpdateFlushesInTheBackground) {
-    QRNUserIdentityCache cache(root_.context(), true);
-    auto observer = std::make_shared<RecordingObserver>();
-    cache.addObserver(observer);
-    cache.flushAndRepopulateWithUserIdentities(personas());
+    // A persona list update flushes in the background; observers hear of
+    // the dropped enterprise identity from the flush queue.
     cache.personaListDidUpdate();
-    ASSERT_TRUE(observer->waitFor(2));
+    ASSERT_TRUE(first->waitFor(3));
     EXPECT_EQ(cache.userIdentityWithPersonaID(1001), nullptr);
-    std::lock_guard guard(observer->mutex);
-    EXPECT_EQ(observer->seen, (std::map<std::string, int>{{"ent-1", 1}, {"ent-2", 1}}));
+    std::lock_guard guard(first->mutex);
+    EXPECT_EQ(first->seen, (std::map<std::string, int>{{"ent-1", 2}, {"ent-2", 1}}));
 }
