@@ -217,6 +217,4 @@ TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
     const timespec times[2] = {before.st_atim, before.st_mtim};
     ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
     EXPECT_EQ(digestNow(), sha256Hex("other version"));
-    std::ofstream(file, std::ios::binary | std::ios::app) << " grown";
-    EXPECT_EQ(digestNow(), sha256Hex("other version grown"));
 }

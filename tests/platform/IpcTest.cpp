@@ -441,9 +441,9 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
     ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
     ::setenv("LISTEN_FDS", "2", 1);
     ::setenv("LISTEN_FDNAMES", "com.orvex.quarnd.upcall:com.orvex.quarnd", 1);
-    const int found[] = {IpcListener::socketFromSystemd("com.orvex.quarnd"),
-                         IpcListener::socketFromSystemd("com.orvex.quarnd.upcall"), // a pipe
-                         IpcListener::socketFromSystemd("other")};
+    EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd"), 4);
+    EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd.upcall"), -1); // a pipe
+    EXPECT_EQ(IpcListener::socketFromSystemd("other"), -1);
     for (const char* name : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) {
         ::unsetenv(name);
     }
@@ -451,7 +451,6 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
         saved[i] >= 0 ? ::dup2(saved[i], 3 + i) : ::close(3 + i);
         ::close(saved[i]);
     }
-    EXPECT_EQ(std::vector(std::begin(found), std::end(found)), (std::vector{4, -1, -1}));
     EXPECT_EQ(IpcListener::socketFromSystemd("com.orvex.quarnd"), -1);
 
     // Neither a pipe nor a file in the socket's place is taken (or replaced).
@@ -521,7 +520,8 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
 
 TEST(CborCodecTest, EveryKindRoundTripsKeepsItsSignAndIsPlainCborRefusedWhenCutOrFollowed) {
     const Value original = everyKind();
-    const auto decoded = CborCodec::decode(CborCodec::encode(original));
+    const Bytes valid = CborCodec::encode(original);
+    const auto decoded = CborCodec::decode(valid);
     ASSERT_TRUE(decoded) << decoded.error().message;
     EXPECT_EQ(*decoded, original) << decoded->description();
     EXPECT_EQ(decoded->get("ints")->asArray()->front().kind(), Value::Kind::Int64);
@@ -548,15 +548,10 @@ TEST(CborCodecTest, EveryKindRoundTripsKeepsItsSignAndIsPlainCborRefusedWhenCutO
               Value(Date{1700000000LL * 1000000}));
     EXPECT_TRUE(CborCodec::decode(Bytes({0xf6}))->isNone());
 
-    // Every truncation and any trailing byte are refused.
-    const Bytes valid = CborCodec::encode(original);
+    // Every truncation is refused.
     for (std::size_t length = 0; length < valid.size(); ++length) {
-        const std::span<const std::uint8_t> prefix(valid.data(), length);
-        EXPECT_FALSE(CborCodec::decode(prefix)) << "prefix of " << length << " bytes";
+        EXPECT_FALSE(CborCodec::decode(std::span(valid.data(), length))) << length << " bytes";
     }
-    const auto trailing = CborCodec::decode(concat(valid, Bytes({0x00})));
-    ASSERT_FALSE(trailing);
-    EXPECT_NE(trailing.error().message.find("follow the value"), std::string::npos);
 }
 
 TEST(CborCodecTest, NestingAndSizeLimits) {
@@ -581,6 +576,7 @@ TEST(CborCodecTest, MalformedInputIsRefusedForItsReason) {
     };
     const Case cases[] = {
         {"empty", {}, "ends after 0 bytes"},
+        {"trailing byte", {0xf6, 0x00}, "follow the value"},
         {"2^64-6 items", {0x9b, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xfa}, "declares"},
         {"map of 2^32 pairs", {0xbb, 0, 0, 0, 1, 0, 0, 0, 0, 0x00}, "declares"},
         {"array of 9 in 8 bytes", {0x89, 1, 2, 3, 4, 5, 6, 7}, "declares"},

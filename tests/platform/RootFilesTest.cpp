@@ -65,13 +65,9 @@ struct Reports {
 
 const std::string kLockFile = "/private/var/run/quarnd/lockstate";
 
-std::vector<std::string> linesOf(const std::filesystem::path& file) {
+std::string contentsOf(const std::filesystem::path& file) {
     std::ifstream in(file);
-    std::vector<std::string> lines;
-    for (std::string line; std::getline(in, line);) {
-        lines.push_back(line);
-    }
-    return lines;
+    return {std::istreambuf_iterator<char>(in), {}};
 }
 
 } // namespace
@@ -432,14 +428,13 @@ TEST_F(RootFilesTest, NotificationsArePostedAsLinesAndStatusAndBadNamesAndLinksR
     ASSERT_TRUE(root_.context().instance<Notifications>().post(Notifications::kCleanupComplete));
 
     EXPECT_EQ(notifications.directory(), root_ / "/private/var/run/quarnd/notifications");
-    const auto lines = linesOf(fileFor(name));
-    ASSERT_EQ(lines.size(), 2u);
-    const std::regex format(
-        R"(\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{6}Z com\.orvex\.quarnd\.user-invalidated)");
-    for (const auto& line : lines) {
-        EXPECT_TRUE(std::regex_match(line, format)) << line;
-    }
-    EXPECT_EQ(linesOf(fileFor(Notifications::kCleanupComplete)).size(), 1u);
+    const std::string lines = contentsOf(fileFor(name));
+    EXPECT_TRUE(std::regex_match(
+        lines,
+        std::regex(
+            R"((\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{6}Z com\.orvex\.quarnd\.user-invalidated\n){2})")))
+        << lines;
+    EXPECT_EQ(std::ranges::count(contentsOf(fileFor(Notifications::kCleanupComplete)), '\n'), 1);
 
     // Stands in for the service manager: a datagram socket named by NOTIFY_SOCKET.
     const auto path = root_.path() / "notify";
@@ -487,5 +482,5 @@ TEST_F(RootFilesTest, NotificationsArePostedAsLinesAndStatusAndBadNamesAndLinksR
     auto throughLink = notifications.post(Notifications::kCleanupComplete);
     ASSERT_FALSE(throughLink);
     EXPECT_TRUE(throughLink.error().isPOSIX(ELOOP));
-    EXPECT_EQ(linesOf(elsewhere / "victim"), std::vector<std::string>{"untouched"});
+    EXPECT_EQ(contentsOf(elsewhere / "victim"), "untouched\n");
 }
