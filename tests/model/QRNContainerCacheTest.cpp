@@ -98,7 +98,12 @@ protected:
 
 // --- Building an entry from disk -------------------------------------------------------
 
-TEST_F(QRNContainerCacheTest, OnlyUUIDNamesAreContainersExceptWellKnownSystemNames) {
+// A listing keeps UUID-named directories whose metadata is valid for this
+// user and class, and well-known system names; the rest is left out, and
+// containers without valid metadata are reported. Files of one directory
+// share the work of reading their stored user identity; one that stores
+// another user's is still refused wherever it comes in the listing.
+TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
     auto real = makeContainer(kData, "com.example.uuid");
     makeContainer(kData, "com.example.named", "com.example.named");
     makeContainer(kData, "com.orvex.devicesettings", "com.orvex.devicesettings");
@@ -106,6 +111,17 @@ TEST_F(QRNContainerCacheTest, OnlyUUIDNamesAreContainersExceptWellKnownSystemNam
     std::filesystem::create_directory_symlink(real->url(),
                                               classDirectory(kData) / UUID::random().string());
     std::ofstream(classDirectory(kData) / UUID::random().string()) << "file";
+    const auto empty = classDirectory(kData) / UUID::random().string();
+    std::filesystem::create_directories(empty);
+    auto corrupt = makeContainer(kData, "com.example.corrupt");
+    std::ofstream(corrupt->url() / QRNMetadata::kFileName, std::ios::trunc) << "garbage";
+    makeContainer(kData, "com.example.group", {}, false, kGroup);
+    Ids expected{"com.example.uuid"};
+    for (int i = 0; i < 4; ++i) {
+        expected.push_back(fmt::format("com.example.mine{}", i));
+        makeContainer(kData, expected.back());
+        makeContainer(kData, fmt::format("com.example.theirs{}", i), {}, false, 0, guest());
+    }
     makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
     makeContainer(kSystem, "com.orvex.unknown", "com.orvex.unknown");
     makeContainer(kSystem, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
@@ -113,11 +129,17 @@ TEST_F(QRNContainerCacheTest, OnlyUUIDNamesAreContainersExceptWellKnownSystemNam
     makeContainer(group, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
     makeContainer(group, "systemgroup.com.orvex.uuid");
 
-    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.uuid"});
+    std::sort(expected.begin(), expected.end());
+    EXPECT_EQ(identifiersOf(kData), expected);
     EXPECT_EQ(identifiersOf(kSystem), Ids{"com.orvex.devicesettings"});
     EXPECT_EQ(identifiersOf(group),
               (Ids{"systemgroup.com.orvex.pairing", "systemgroup.com.orvex.uuid"}));
-    EXPECT_FALSE(log_.contains("INCONSISTENT")) << log_.all();
+    EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
+    const auto reported = log_.count("Cache: [501]-appData: INCONSISTENT-No Metadata at: ");
+    EXPECT_EQ(reported, 7u) << log_.all();
+    EXPECT_EQ(log_.count("INCONSISTENT"), reported); // nothing in the system classes
+    EXPECT_TRUE(log_.contains(fmt::format("INCONSISTENT-No Metadata at: {} for id: {}, class: 2",
+                                          empty.string(), empty.filename().string())));
 }
 
 TEST_F(QRNContainerCacheTest, OfTwoContainersWithOneIdentifierTheOneListedLaterWins) {
@@ -133,20 +155,6 @@ TEST_F(QRNContainerCacheTest, OfTwoContainersWithOneIdentifierTheOneListedLaterW
     ASSERT_TRUE(found) << log_.all();
     EXPECT_EQ((*found)->uuid(), later->uuid());
     EXPECT_EQ((*found)->url(), later->url());
-}
-
-TEST_F(QRNContainerCacheTest, ContainersWithoutValidMetadataAreReportedAndLeftOut) {
-    makeContainer(kData, "com.example.good");
-    const auto empty = classDirectory(kData) / UUID::random().string();
-    std::filesystem::create_directories(empty);
-    auto corrupt = makeContainer(kData, "com.example.corrupt");
-    std::ofstream(corrupt->url() / QRNMetadata::kFileName, std::ios::trunc) << "garbage";
-    makeContainer(kData, "com.example.group", {}, false, kGroup);
-
-    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.good"});
-    EXPECT_EQ(log_.count("Cache: [501]-appData: INCONSISTENT-No Metadata at: "), 3u) << log_.all();
-    EXPECT_TRUE(log_.contains(fmt::format("INCONSISTENT-No Metadata at: {} for id: {}, class: 2",
-                                          empty.string(), empty.filename().string())));
 }
 
 TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsNothing) {
@@ -193,22 +201,6 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
     auto beyond = cache().allContainersForUserIdentity(mobile(), kQRNContainerClassMax, false);
     ASSERT_FALSE(beyond);
     EXPECT_TRUE(beyond.error().isQRN(kQRNErrorInvalidCacheInput));
-}
-
-// Files of one directory share the work of reading their stored user
-// identity; a file that stores another user's is still refused wherever it
-// comes in the listing.
-TEST_F(QRNContainerCacheTest, EachFilesStoredUserIdentityIsChecked) {
-    auto other = guest();
-    ASSERT_TRUE(other);
-    Ids expected;
-    for (int i = 0; i < 4; ++i) {
-        expected.push_back(fmt::format("com.example.mine{}", i));
-        makeContainer(kData, expected.back());
-        makeContainer(kData, fmt::format("com.example.theirs{}", i), {}, false, 0, other);
-    }
-    EXPECT_EQ(identifiersOf(kData), expected);
-    EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
 }
 
 // --- The kernel sandbox mapping -------------------------------------------------------------
