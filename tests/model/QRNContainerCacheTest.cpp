@@ -232,7 +232,35 @@ TEST_F(QRNContainerCacheTest, AReplacedRecordKeepsItsSlotConsistent) {
     EXPECT_FALSE(log_.contains("Failed to remove container mapping")) << log_.all();
 }
 
-TEST_F(QRNContainerCacheTest, AddingAndRemovingKeepsTheSandboxMappingInStep) {
+// Only permanent containers are mapped, an entry only once; invalidating a
+// user removes its mappings and the global ones, not another user's; adding
+// and removing a record pushes and removes its mapping.
+TEST_F(QRNContainerCacheTest, TheSandboxMappingFollowsTheCache) {
+    auto temp = makeContainer(kData, "com.example.t", {}, true);
+    ASSERT_TRUE(cache().addContainerMetadata(temp, temp->url(), true, true));
+    makeContainer(kGroup, "group.example");
+    auto id = identity(kGroup, "group.example");
+    ASSERT_TRUE(cache().containerForContainerIdentity(id));
+    EXPECT_TRUE(mapped(501).empty());
+
+    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
+    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
+    ASSERT_EQ(mapped(501).size(), 1u);
+    EXPECT_EQ(log_.count("Pushed user: 501, itemType: 2, identifier group.example"), 1u);
+
+    auto data = makeContainer(kData, "com.example.app");
+    auto system = makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
+    for (const auto& made : {data, system}) {
+        ASSERT_TRUE(cache().addContainerMetadata(made, made->url(), false, true));
+    }
+    const SandboxItem theirs{1, "com.example.theirs", kData, 502, "/x"};
+    sandbox().setContainerMapping(502, theirs);
+
+    cache().invalidateUserIdentity(mobile());
+    EXPECT_TRUE(mapped(501).empty());
+    EXPECT_TRUE(mapped(0).empty());
+    EXPECT_EQ(mapped(502), std::vector<SandboxItem>{theirs});
+
     struct Case {
         std::uint64_t cls, itemType; // item type 0: never mapped
         std::uint32_t uid;
@@ -265,20 +293,6 @@ TEST_F(QRNContainerCacheTest, AddingAndRemovingKeepsTheSandboxMappingInStep) {
         EXPECT_FALSE(cache().containerForContainerIdentity(identity(c.cls, id)));
     }
     EXPECT_FALSE(log_.contains("Unsupported class")) << log_.all();
-}
-
-TEST_F(QRNContainerCacheTest, OnlyPermanentContainersAreMappedAndAnEntryOnlyOnce) {
-    auto temp = makeContainer(kData, "com.example.t", {}, true);
-    ASSERT_TRUE(cache().addContainerMetadata(temp, temp->url(), true, true));
-    makeContainer(kGroup, "group.example");
-    auto id = identity(kGroup, "group.example");
-    ASSERT_TRUE(cache().containerForContainerIdentity(id));
-    EXPECT_TRUE(mapped(501).empty());
-
-    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
-    ASSERT_TRUE(cache().containerForContainerIdentity(id, false, true));
-    ASSERT_EQ(mapped(501).size(), 1u);
-    EXPECT_EQ(log_.count("Pushed user: 501, itemType: 2, identifier group.example"), 1u);
 }
 
 // A mapping the kernel kept while the daemon restarted answers without a
@@ -339,21 +353,6 @@ TEST_F(QRNContainerCacheTest, InvalidatingOneUserRebuildsOnlyTheGlobalEntriesFor
     lookUpAll();
     EXPECT_EQ(rebuilds("[501]-appGroup"), 2u);
     EXPECT_EQ(notificationsPosted(), 2u);
-}
-
-TEST_F(QRNContainerCacheTest, InvalidationRemovesTheUsersAndTheGlobalSandboxMappings) {
-    auto data = makeContainer(kData, "com.example.app");
-    auto system = makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
-    for (const auto& made : {data, system}) {
-        ASSERT_TRUE(cache().addContainerMetadata(made, made->url(), false, true));
-    }
-    const SandboxItem theirs{1, "com.example.theirs", kData, 502, "/x"};
-    sandbox().setContainerMapping(502, theirs);
-
-    cache().invalidateUserIdentity(mobile());
-    EXPECT_TRUE(mapped(501).empty());
-    EXPECT_TRUE(mapped(0).empty());
-    EXPECT_EQ(mapped(502), std::vector<SandboxItem>{theirs});
 }
 
 TEST_F(QRNContainerCacheTest, TheUserIdentityCacheTellsTheCacheWhomItDroppedWhileTheCacheLives) {
