@@ -145,14 +145,6 @@ protected:
         QRNClientConnection::_sharedDeathrowQueue()->sync([] {});
         QRNClientConnection::_sharedDeathrowBackgroundQueue()->sync([] {});
     }
-    // Every Env call made so far, of any kind.
-    std::uint64_t totalCalls() const {
-        std::uint64_t total = 0;
-        for (std::size_t call = 0; call < static_cast<std::size_t>(EnvCall::Count_); ++call) {
-            total += env_->count(static_cast<EnvCall>(call));
-        }
-        return total;
-    }
     static struct stat lstatOf(const Path& path) {
         struct stat st {};
         EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;

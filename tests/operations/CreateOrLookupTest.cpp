@@ -207,17 +207,23 @@ TEST_F(CreateOrLookupTest, FastSizingSwitchSizesTheNewContainer) {
 // Access: who may look up which container. A lookup that passes the checks
 // answers "not found" (21); a refused one "not entitled" (55).
 
-TEST_F(CreateOrLookupTest, AnotherIdentifierWithoutRightsIsRefusedBeforeAnyDiskAccess) {
-    auto connection = connectionFor(kClientBundle);
-    const std::uint64_t before = totalCalls();
-    EXPECT_EQ(codeOf(*connection, "com.other.app", kClass, true), kQRNErrorNotEntitled);
-    EXPECT_EQ(totalCalls(), before);
-}
-
 TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
+    const std::uint64_t app = kClass, group = kQRNContainerClassAppGroup,
+                        sysGroup = kQRNContainerClassSystemGroup,
+                        sysData = kQRNContainerClassSystemData,
+                        plugin = kQRNContainerClassPluginData;
+    const std::uint64_t found = kQRNErrorContainerNotFound, refused = kQRNErrorNotEntitled;
     auto lookingUp = [&](const char* client, const char* shortName, Value granted) {
         return connectionFor(client, {.lookup = dictionaryOf({{shortName, std::move(granted)}})});
     };
+    auto none = connectionFor(kClientBundle);
+    // A refusal comes before any disk access.
+    std::uint64_t calls = 0;
+    env_->setHook([&calls](EnvCall, std::uint64_t) { ++calls; });
+    EXPECT_EQ(codeOf(*none, "com.other.app", app, true), refused);
+    EXPECT_EQ(calls, 0u);
+    env_->setHook(nullptr);
+
     auto groups = connectionFor(kClientBundle);
     groups->setAllowGroupIdLookup(true);
     auto widened = connectionFor(kClientBundle);
@@ -225,10 +231,12 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
     // Elements that are not strings are skipped, not the whole list.
     auto listed = lookingUp(kClientBundle, "appData",
                             arrayOf({Value(7), Value("com.other.app"), dictionaryOf({})}));
+    auto misTyped = lookingUp(kClientBundle, "appData", Value("com.other.app"));
     auto search = connectionFor("com.orvex.searchd");
     auto daemon = connectionFor("com.example.daemon");
+    auto declared =
+        lookingUp("com.example.daemon", "systemData", arrayOf({Value("com.example.daemon")}));
     auto accounts = connectionFor("com.orvex.accountsd");
-    const std::uint64_t found = kQRNErrorContainerNotFound, refused = kQRNErrorNotEntitled;
     const struct {
         const char* what;
         std::shared_ptr<QRNClientConnection> connection;
@@ -236,38 +244,28 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
         std::uint64_t cls;
         std::uint64_t code;
     } cases[] = {
-        {"no right", connectionFor(kClientBundle), "com.other.app", kClass, refused},
-        {"other ids", connectionFor(kClientBundle, {.otherIds = true}), "com.other.app", kClass,
+        {"no right", none, "com.other.app", app, refused},
+        {"other ids", connectionFor(kClientBundle, {.otherIds = true}), "com.other.app", app,
          found},
-        {"unrestricted", privileged(), "com.other.app", kClass, found},
-        {"other ids set later", widened, "com.other.app", kClass, found},
-        {"group right, app group", groups, "group.other", kQRNContainerClassAppGroup, found},
-        {"group right, system group", groups, "systemgroup.other", kQRNContainerClassSystemGroup,
-         found},
-        {"group right is for groups only", groups, "com.other.app", kClass, refused},
-        {"listed identifier", listed, "com.other.app", kClass, found},
-        {"unlisted identifier", listed, "com.third.app", kClass, refused},
-        {"listed under another class", listed, "com.other.app", kQRNContainerClassPluginData,
+        {"unrestricted", privileged(), "com.other.app", app, found},
+        {"other ids set later", widened, "com.other.app", app, found},
+        {"group right, app group", groups, "group.other", group, found},
+        {"group right, system group", groups, "systemgroup.other", sysGroup, found},
+        {"group right is for groups only", groups, "com.other.app", app, refused},
+        {"listed identifier", listed, "com.other.app", app, found},
+        {"unlisted identifier", listed, "com.third.app", app, refused},
+        {"listed under another class", listed, "com.other.app", plugin, refused},
+        {"a string where an array belongs", misTyped, "com.other.app", app, refused},
+        {"well-known exception", search, "com.orvex.notes", app, found},
+        {"exception of another class", search, "com.orvex.notes", plugin, refused},
+        {"exception of another identifier", search, "com.orvex.photos", app, refused},
+        {"open to everyone", none, "systemgroup.com.orvex.diagnostics", sysGroup, found},
+        {"own identifier, other class", daemon, "com.example.daemon", app, found},
+        {"own system container, undeclared", daemon, "com.example.daemon", sysData, refused},
+        {"own system container, declared", declared, "com.example.daemon", sysData, found},
+        {"well-known system client, its own", accounts, "com.orvex.accountsd", sysData, found},
+        {"well-known system client, another's", accounts, "com.orvex.devicesettings", sysData,
          refused},
-        {"a string where an array belongs",
-         lookingUp(kClientBundle, "appData", Value("com.other.app")), "com.other.app", kClass,
-         refused},
-        {"well-known exception", search, "com.orvex.notes", kClass, found},
-        {"exception of another class", search, "com.orvex.notes", kQRNContainerClassPluginData,
-         refused},
-        {"exception of another identifier", search, "com.orvex.photos", kClass, refused},
-        {"open to everyone", connectionFor(kClientBundle), "systemgroup.com.orvex.diagnostics",
-         kQRNContainerClassSystemGroup, found},
-        {"own identifier, other class", daemon, "com.example.daemon", kClass, found},
-        {"own system container, undeclared", daemon, "com.example.daemon",
-         kQRNContainerClassSystemData, refused},
-        {"own system container, declared",
-         lookingUp("com.example.daemon", "systemData", arrayOf({Value("com.example.daemon")})),
-         "com.example.daemon", kQRNContainerClassSystemData, found},
-        {"well-known system client, its own", accounts, "com.orvex.accountsd",
-         kQRNContainerClassSystemData, found},
-        {"well-known system client, another's", accounts, "com.orvex.devicesettings",
-         kQRNContainerClassSystemData, refused},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(codeOf(*c.connection, c.identifier, c.cls), c.code) << c.what;

@@ -31,20 +31,12 @@ TEST(DaemonLockStateTest, FollowerSuspendsAndResumesOncePerChange) {
         bool running;
     } cases[] = {
         {"locked suspends", false, {kLocked}, kLocked, false},
-        {"a second locked does not suspend again",
-         false,
-         {kLocked, kLocked, kUnlocked},
-         kUnlocked,
-         true},
-        {"a second unlocked does not resume again",
-         false,
-         {kLocked, kUnlocked, kUnlocked},
-         kUnlocked,
-         true},
-        {"transitional states change nothing", false, {kLocked, 2, -1}, kLocked, false},
-        {"nor after unlocking", false, {kLocked, kUnlocked, 7}, kUnlocked, true},
+        {"no second suspend", false, {kLocked, kLocked, kUnlocked}, kUnlocked, true},
+        {"no second resume", false, {kLocked, kUnlocked, kUnlocked}, kUnlocked, true},
+        {"transitional states", false, {kLocked, 2, -1}, kLocked, false},
+        {"transitional, unlocked", false, {kLocked, kUnlocked, 7}, kUnlocked, true},
         // A resume by the follower would let the other holder's block run.
-        {"a first unlocked resumes nothing", true, {kUnlocked}, kUnlocked, false},
+        {"first unlocked resumes nothing", true, {kUnlocked}, kUnlocked, false},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.what);
