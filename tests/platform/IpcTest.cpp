@@ -16,7 +16,6 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
-#include <fmt/format.h>
 #include <linux/sockios.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
@@ -126,7 +125,7 @@ Value everyKind() {
 
 } // namespace
 
-TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessAndNoneOnceItIsGone) {
+TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessNoneOnceItIsGoneAndProcIsParsedStrictly) {
     int fds[2];
     ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     auto peer = IpcPeer::fromSocket(fds[0]);
@@ -160,26 +159,8 @@ TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessAndNoneOnceItIsGone) {
     EXPECT_FALSE(IpcPeer::processStartTime(child));
     EXPECT_FALSE(IpcPeer::fromPID(child));
     EXPECT_FALSE(IpcPeer::fromPID(0));
-}
 
-TEST(IpcPeerTest, WireFormsOfTokensAndFramesAreLittleEndian) {
-    const IpcPeer::TokenFields fields{0x04030201, 11, 12, 13, 14, 0x00010000, 16, 0xA1B2C3D4};
-    const auto token = IpcPeer::makeAuditToken(fields);
-    const std::array<std::uint8_t, 8> ends{token[0],  token[3],  token[4],  token[16],
-                                           token[22], token[24], token[28], token[31]};
-    EXPECT_EQ(ends, (std::array<std::uint8_t, 8>{0x01, 0x04, 11, 14, 0x01, 16, 0xD4, 0xA1}));
-    EXPECT_EQ(IpcPeer::makeAuditToken(IpcPeer::fieldsOfAuditToken(token)), token);
-
-    const auto header = IpcFrame::encodeHeader(0x01020304, true);
-    EXPECT_EQ(header, (std::array<std::uint8_t, 5>{0x04, 0x03, 0x02, 0x01, 0x01}));
-    const auto decoded = IpcFrame::decodeHeader(header);
-    ASSERT_TRUE(decoded);
-    EXPECT_EQ(decoded->length, 0x01020304u);
-    EXPECT_TRUE(decoded->expectsReply);
-    EXPECT_FALSE(IpcFrame::decodeHeader(std::array<std::uint8_t, 5>{1, 0, 0, 0, 0x80}));
-}
-
-TEST(IpcPeerTest, ProcFilesAreParsedStrictly) {
+    // What the peer reads from /proc, parsed strictly.
     // The command name holds blanks and parentheses; start time 98765.
     EXPECT_EQ(ProcessInfo::parseStartTime("4242 (evil) name (x) ) S 1 4242 4242 0 -1 4194560 100 "
                                           "0 0 0 3 1 0 0 20 0 1 0 98765 4096 200 1 1 1 0 0 0\n"),
@@ -202,6 +183,23 @@ TEST(IpcPeerTest, ProcFilesAreParsedStrictly) {
     EXPECT_EQ(ProcessInfo::parseLoginUID("501\n"), 501u);
     EXPECT_FALSE(ProcessInfo::parseLoginUID("-1"));
     EXPECT_FALSE(ProcessInfo::parseLoginUID(""));
+}
+
+TEST(IpcPeerTest, WireFormsOfTokensAndFramesAreLittleEndian) {
+    const IpcPeer::TokenFields fields{0x04030201, 11, 12, 13, 14, 0x00010000, 16, 0xA1B2C3D4};
+    const auto token = IpcPeer::makeAuditToken(fields);
+    const std::array<std::uint8_t, 8> ends{token[0],  token[3],  token[4],  token[16],
+                                           token[22], token[24], token[28], token[31]};
+    EXPECT_EQ(ends, (std::array<std::uint8_t, 8>{0x01, 0x04, 11, 14, 0x01, 16, 0xD4, 0xA1}));
+    EXPECT_EQ(IpcPeer::makeAuditToken(IpcPeer::fieldsOfAuditToken(token)), token);
+
+    const auto header = IpcFrame::encodeHeader(0x01020304, true);
+    EXPECT_EQ(header, (std::array<std::uint8_t, 5>{0x04, 0x03, 0x02, 0x01, 0x01}));
+    const auto decoded = IpcFrame::decodeHeader(header);
+    ASSERT_TRUE(decoded);
+    EXPECT_EQ(decoded->length, 0x01020304u);
+    EXPECT_TRUE(decoded->expectsReply);
+    EXPECT_FALSE(IpcFrame::decodeHeader(std::array<std::uint8_t, 5>{1, 0, 0, 0, 0x80}));
 }
 
 namespace {
@@ -388,7 +386,6 @@ TEST_F(IpcListenerTest, ServesInOrderConcurrentlyHeldOnesLaterAndHearsEachEndOnc
     Client neverResumed(socketPath());
 
     // Each message names its writer: here a child sharing the connection.
-    LogCapture log;
     const pid_t child = inChild([&] { client.send(message(65)); });
     EXPECT_EQ(seqOf(client.receive()), 65u);
     EXPECT_EQ(client.roundTrip(66), 66u);
@@ -396,12 +393,8 @@ TEST_F(IpcListenerTest, ServesInOrderConcurrentlyHeldOnesLaterAndHearsEachEndOnc
     const Bytes frame = IpcFrame::encodeMessage(message(67), true);
     const auto half = frame.begin() + static_cast<std::ptrdiff_t>(frame.size() / 2);
     client.write({frame.begin(), half});
-    const pid_t second = inChild([&] { client.write({half, frame.end()}); });
-    EXPECT_TRUE(client.closedByService());
-    EXPECT_TRUE(log.contains(fmt::format("Closing the connection of pid {}: a frame holds bytes "
-                                         "written by pid {} and by pid {}",
-                                         ::getpid(), ::getpid(), second)))
-        << log.all();
+    inChild([&] { client.write({half, frame.end()}); });
+    EXPECT_TRUE(client.closedByService()); // instead of answering 67
 
     ASSERT_TRUE(waitForEnds({0, 3, 4}));
     ASSERT_TRUE(record(5).connection);
@@ -506,8 +499,6 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
         Client bad(socketPath());
         bad.write(cases[i].bytes);
         EXPECT_TRUE(bad.closedByService());
-        EXPECT_EQ(log.count(fmt::format("Closing the connection of pid {}: ", ::getpid())), 1u)
-            << log.all();
         EXPECT_TRUE(log.contains(cases[i].reason)) << log.all();
         EXPECT_EQ(bystander.roundTrip(1), 1u);
         ASSERT_TRUE(waitForEnds({i + 2}));
@@ -546,7 +537,6 @@ TEST(CborCodecTest, EveryKindRoundTripsKeepsItsSignAndIsPlainCborRefusedWhenCutO
     EXPECT_EQ(*CborCodec::decode(Bytes({0xfa, 0x3f, 0xc0, 0, 0})), Value(1.5));
     EXPECT_EQ(*CborCodec::decode(Bytes({0xc1, 0x1a, 0x65, 0x53, 0xf1, 0x00})),
               Value(Date{1700000000LL * 1000000}));
-    EXPECT_TRUE(CborCodec::decode(Bytes({0xf6}))->isNone());
 
     // Every truncation is refused.
     for (std::size_t length = 0; length < valid.size(); ++length) {
@@ -554,7 +544,7 @@ TEST(CborCodecTest, EveryKindRoundTripsKeepsItsSignAndIsPlainCborRefusedWhenCutO
     }
 }
 
-TEST(CborCodecTest, NestingAndSizeLimits) {
+TEST(CborCodecTest, MalformedOrTooDeepOrLargeInputIsRefusedForItsReason) {
     EXPECT_TRUE(CborCodec::decode(nestedArrays(32)));
     EXPECT_FALSE(CborCodec::decode(nestedArrays(33)));
     EXPECT_TRUE(CborCodec::decode(nestedArrays(3), {.maxBytes = 64, .maxNesting = 3}));
@@ -566,9 +556,7 @@ TEST(CborCodecTest, NestingAndSizeLimits) {
     const Bytes text = CborCodec::encode(Value(std::string(20, 'x')));
     EXPECT_TRUE(CborCodec::decode(text, {.maxBytes = text.size(), .maxNesting = 1}));
     EXPECT_FALSE(CborCodec::decode(text, {.maxBytes = text.size() - 1, .maxNesting = 1}));
-}
 
-TEST(CborCodecTest, MalformedInputIsRefusedForItsReason) {
     struct Case {
         const char* name;
         Bytes input;
