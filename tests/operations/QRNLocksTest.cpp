@@ -24,32 +24,22 @@ Value ids(std::initializer_list<const char*> list) {
 enum class Kind { Read, Write, GlobalRead, GlobalWrite };
 
 void take(QRNLocks& locks, Kind kind, const Value& identifier) {
-    switch (kind) {
-    case Kind::Read:
-        return locks.read_lock_identifier(identifier);
-    case Kind::Write:
-        return locks.write_lock_identifier(identifier);
-    case Kind::GlobalRead:
-        return locks.read_lock_all_identifiers();
-    case Kind::GlobalWrite:
-        return locks.write_lock_all_identifiers();
-    }
+    kind == Kind::Read         ? locks.read_lock_identifier(identifier)
+    : kind == Kind::Write      ? locks.write_lock_identifier(identifier)
+    : kind == Kind::GlobalRead ? locks.read_lock_all_identifiers()
+                               : locks.write_lock_all_identifiers();
 }
 
 void drop(QRNLocks& locks, Kind kind, const Value& identifier) {
-    if (kind == Kind::Read || kind == Kind::Write) {
-        locks.unlock_identifier(identifier);
-    } else {
-        locks.unlock_all_identifiers();
-    }
+    kind == Kind::Read || kind == Kind::Write ? locks.unlock_identifier(identifier)
+                                              : locks.unlock_all_identifiers();
 }
 
 // Waits for a state another thread reaches; a lock that never lets it happen
 // ends the test process with the reason rather than hanging it.
 void waitUntil(const char* what, const std::function<bool()>& reached) {
-    auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(60);
-    while (!reached()) {
-        if (std::chrono::steady_clock::now() > giveUp) {
+    for (int waited = 0; !reached(); ++waited) {
+        if (waited > 60000) {
             std::fprintf(stderr, "never reached: %s\n", what);
             std::abort();
         }
@@ -161,54 +151,53 @@ TEST_F(QRNLocksTest, HoldsAreMarkedFromLockToUnlock) {
     EXPECT_EQ(ends("ReadLockWithIdentifier") + ends("GlobalReadLock"), 3);
 }
 
-TEST_F(QRNLocksTest, WriterWaitsForIdentifierHoldersAndHoldsOffNewOnes) {
+TEST_F(QRNLocksTest, GlobalAndIdentifierLocksWaitForEachOther) {
+    // A global writer waits for identifier holders and holds off new ones.
     locks.read_lock_identifier("x");
-    Holder global(locks, Kind::GlobalWrite);
-    waitUntil("global writer waits", [&] { return waiters(locks) == 1; });
-    EXPECT_FALSE(global.acquired());
-    locks.unlock_identifier("x");
-    waitUntil("global writer gets in", [&] { return global.acquired(); });
+    {
+        Holder global(locks, Kind::GlobalWrite);
+        waitUntil("global writer waits", [&] { return waiters(locks) == 1; });
+        EXPECT_FALSE(global.acquired());
+        locks.unlock_identifier("x");
+        waitUntil("global writer gets in", [&] { return global.acquired(); });
+        Holder reader(locks, Kind::Read, "y");
+        Holder writer(locks, Kind::Write, "z");
+        waitUntil("both identifier lockers wait", [&] { return waiters(locks) == 2; });
+        EXPECT_FALSE(reader.acquired() || writer.acquired());
+        global.release();
+        waitUntil("identifier lockers get in",
+                  [&] { return reader.acquired() && writer.acquired(); });
+    }
 
-    Holder reader(locks, Kind::Read, "y");
-    Holder writer(locks, Kind::Write, "z");
-    waitUntil("both identifier lockers wait", [&] { return waiters(locks) == 2; });
-    EXPECT_FALSE(reader.acquired() || writer.acquired());
-    global.release();
-    waitUntil("identifier lockers get in", [&] { return reader.acquired() && writer.acquired(); });
-    reader.release();
-    writer.release();
-}
-
-TEST_F(QRNLocksTest, ReaderSharesWithIdentifierReadersOnly) {
+    // A global reader shares with identifier readers only; a writer queued
+    // behind the reader of "x" already keeps new global readers out.
     locks.read_lock_identifier("x");
-    Holder first(locks, Kind::GlobalRead);
-    waitUntil("global reader beside an identifier reader", [&] { return first.acquired(); });
-    first.release();
+    {
+        Holder first(locks, Kind::GlobalRead);
+        waitUntil("global reader beside an identifier reader", [&] { return first.acquired(); });
+    }
+    {
+        Holder writer(locks, Kind::Write, "x");
+        waitUntil("writer pending on x", [&] { return locks.snapshot().records["x"].users == 2; });
+        Holder second(locks, Kind::GlobalRead);
+        waitUntil("global reader waits", [&] { return waiters(locks) == 1; });
+        locks.unlock_identifier("x");
+        waitUntil("writer holds x", [&] { return writer.acquired(); });
+        EXPECT_FALSE(second.acquired());
+        writer.release();
+        waitUntil("global reader gets in", [&] { return second.acquired(); });
+    }
 
-    // A writer queued behind the reader of "x" already keeps new global readers out.
-    Holder writer(locks, Kind::Write, "x");
-    waitUntil("writer pending on x", [&] { return locks.snapshot().records["x"].users == 2; });
-    Holder second(locks, Kind::GlobalRead);
-    waitUntil("global reader waits", [&] { return waiters(locks) == 1; });
-    locks.unlock_identifier("x");
-    waitUntil("writer holds x", [&] { return writer.acquired(); });
-    EXPECT_FALSE(second.acquired());
-    writer.release();
-    waitUntil("global reader gets in", [&] { return second.acquired(); });
-    second.release();
-}
-
-TEST_F(QRNLocksTest, IdentifierWriterWaitsForGlobalReaders) {
+    // An identifier writer waits for global readers, and is not counted
+    // until the global lock is free, so readers still get in.
     locks.read_lock_all_identifiers();
     Holder writer(locks, Kind::Write, "x");
     waitUntil("writer waits", [&] { return waiters(locks) == 1; });
-    // Not counted until the global lock is free, so readers still get in.
     locks.read_lock_all_identifiers();
     locks.unlock_all_identifiers();
     EXPECT_FALSE(writer.acquired());
     locks.unlock_all_identifiers();
     waitUntil("writer gets in", [&] { return writer.acquired(); });
-    writer.release();
 }
 
 // Threads mixing every kind of lock, identifier arrays in opposite orders
