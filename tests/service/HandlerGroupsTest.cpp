@@ -58,7 +58,7 @@ TEST_F(HandlerGroupsTest, GroupsOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingB
         states.push_back(QRNLocks::shared().snapshot().allReaderWriterState);
     };
     Value reply = send(groupRequest(13, kVellClient));
-    mapping_->onQuery = nullptr;
+    mapping_->onQuery = [] {};
     EXPECT_EQ(states, std::vector<std::int32_t>{-1});
     EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
     EXPECT_EQ(reply.get("ReplyGroupContainerDict")->size(), 2u) << reply.description();

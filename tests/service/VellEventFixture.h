@@ -15,6 +15,7 @@
 
 #include <unistd.h>
 
+#include <atomic>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -32,28 +33,21 @@ public:
         std::lock_guard guard(mutex_);
         replies_.push_back(reply);
     }
-    void cancel() override {
-        std::lock_guard guard(mutex_);
-        cancelled_ = true;
-    }
+    void cancel() override { cancelled = true; }
     std::vector<Value> replies() const {
         std::lock_guard guard(mutex_);
         return replies_;
     }
-    bool cancelled() const {
-        std::lock_guard guard(mutex_);
-        return cancelled_;
-    }
+    std::atomic<bool> cancelled{false};
 
 private:
     IpcPeer peer_{
         getpid(),   kMobileUID,
         kMobileUID, IpcPeer::makeAuditToken({.euid = kMobileUID, .pid = 4242, .startTime = 99}),
         99,         nullptr};
-    // Guards replies_ and cancelled_: asynchronous replies come from other threads.
+    // Guards replies_: asynchronous replies come from other threads.
     mutable std::mutex mutex_;
     std::vector<Value> replies_;
-    bool cancelled_ = false;
 };
 
 class FakeCodeSigningRegistry : public CodeSigningRegistry {
@@ -82,36 +76,27 @@ public:
 class RecordedGroupsMapping : public QRNCodeSigningMapping {
 public:
     using QRNCodeSigningMapping::QRNCodeSigningMapping;
-    using Records = std::map<std::string, Value, std::less<>>;
-    std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view identifier) override {
-        return recorded(appGroups, identifier);
+    std::optional<Value> appGroupIdentifiersForIdentifier(std::string_view owner) override {
+        return recorded(appGroups, owner);
     }
-    std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view identifier) override {
-        return recorded(systemGroups, identifier);
+    std::optional<Value> systemGroupIdentifiersForIdentifier(std::string_view owner) override {
+        return recorded(systemGroups, owner);
     }
-    Records appGroups;
-    Records systemGroups;
+    std::map<std::string, Value, std::less<>> appGroups, systemGroups;
     // Called at each query, for a test to look at what holds then.
-    std::function<void()> onQuery;
+    std::function<void()> onQuery = [] {};
 
 private:
-    std::optional<Value> recorded(const Records& records, std::string_view identifier) const {
-        if (onQuery) {
-            onQuery();
-        }
-        auto found = records.find(identifier);
+    std::optional<Value> recorded(const auto& records, std::string_view owner) const {
+        onQuery();
+        auto found = records.find(owner);
         return found == records.end() ? std::nullopt : std::optional<Value>(found->second);
     }
 };
 
 // An event of `kind` from the connection's peer.
-inline IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body,
-                                    bool expectsReply) {
-    IpcConnection::Event event;
-    event.kind = kind;
-    event.body = std::move(body);
-    event.expectsReply = expectsReply;
-    return event;
+inline IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body, bool reply) {
+    return {kind, std::move(body), reply};
 }
 
 class VellEventFixture : public CreateFixture {

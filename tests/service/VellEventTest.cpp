@@ -32,7 +32,7 @@ TEST_F(VellEventTest, UnreadableCommandsAndMessagesWithoutReplyContext) {
         dictionaryOf({{"ContainerClass", Value(2u)}, {"CreateIfNecessary", Value(true)}});
     auto quiet = std::make_shared<FakeIpcConnection>();
     QRNProcessVellEvent(quiet, eventOf(IpcConnection::Event::Kind::Message, create, false));
-    EXPECT_TRUE(quiet->cancelled());
+    EXPECT_TRUE(quiet->cancelled);
     EXPECT_TRUE(quiet->replies().empty());
     EXPECT_FALSE(cached(kVellClient, kQRNContainerClassAppData));
     // A missing or mistyped command runs command zero.
@@ -49,16 +49,19 @@ TEST_F(VellEventTest, UnreadableCommandsAndMessagesWithoutReplyContext) {
     auto invalidated = std::make_shared<FakeIpcConnection>();
     QRNProcessVellEvent(invalidated,
                         eventOf(IpcConnection::Event::Kind::Invalidated, Value(), true));
-    EXPECT_FALSE(invalidated->cancelled());
+    EXPECT_FALSE(invalidated->cancelled);
     EXPECT_TRUE(invalidated->replies().empty());
 }
 TEST_F(VellEventTest, EntitlementsAdmitToCommands) {
     auto entitled = [](const char* name, Value value) {
-        return std::optional<Value>(dictionaryOf({{name, std::move(value)}}));
+        return std::optional<Value>(
+            dictionaryOf({{(std::string("com.orvex.private.Quarn.") + name).c_str(), value}}));
     };
     const std::optional<Value> none = Value::dictionary(), unknown = std::nullopt;
     const auto allow = std::optional<Value>(allowed());
-    const auto lookup = entitled("com.orvex.private.Quarn.lookup", Value::dictionary());
+    const auto lookup = entitled("lookup", Value::dictionary());
+    const auto wipeFlag = entitled("wipeContainer", Value(true));
+    const auto wipeList = entitled("wipeContainer", arrayOf({Value("a")}));
     const struct {
         const char* name;
         std::optional<Value> entitlements; // none: a process the registry does not know
@@ -67,11 +70,9 @@ TEST_F(VellEventTest, EntitlementsAdmitToCommands) {
     } cases[] = {
         {"allowed does not reach the test commands", allow, 25, 55},
         {"allowed does not reach the test lock", allow, 31, 55},
-        {"testability reaches the test commands",
-         entitled("com.orvex.private.Quarn.testability", Value(true)), 25, 49},
+        {"testability reaches the test commands", entitled("testability", Value(true)), 25, 49},
         {"retired number", allow, 27, 49},
-        {"allowed as a string is not allowed",
-         entitled("com.orvex.private.Quarn.allowed", Value("true")), 27, 55},
+        {"allowed as a string is not allowed", entitled("allowed", Value("true")), 27, 55},
         {"no entitlements, listing", none, 1, 55},
         {"a lookup dictionary admits to listing", lookup, 1, 1},
         {"lookup is not read where the command ignores it", lookup, 3, 55},
@@ -80,10 +81,8 @@ TEST_F(VellEventTest, EntitlementsAdmitToCommands) {
         {"no entitlements, own system groups", none, 16, 1},
         {"no entitlements, group identifiers", none, 14, 55},
         {"no entitlements, info values", none, 5, 55},
-        {"wipe as a boolean", entitled("com.orvex.private.Quarn.wipeContainer", Value(true)), 11,
-         55},
-        {"wipe as a list", entitled("com.orvex.private.Quarn.wipeContainer", arrayOf({Value("a")})),
-         11, 49},
+        {"wipe as a boolean", wipeFlag, 11, 55},
+        {"wipe as a list", wipeList, 11, 49},
         {"allowed reaches wipe without a list", allow, 11, 49},
         {"asynchronous command refused", none, 21, 55},
         {"asynchronous command not in this build", allow, 21, 49},
@@ -138,7 +137,7 @@ TEST_F(VellEventTest, RightsHandedToTheClientConnection) {
     EXPECT_EQ(error, 1u);
 }
 
-TEST_F(VellEventTest, DeathRowDeletionRepliesOnceFromItsCompletion) {
+TEST_F(VellEventTest, RepliesGoOutOnceFromACompletionOrAnyCopy) {
     std::filesystem::path deathrow = QRNGlobalConfiguration::sharedInstance().deathrowDirectory();
     std::filesystem::create_directories(deathrow / "A" / "deep");
     // Refused: the dispatcher's reply is the only one.
@@ -153,12 +152,11 @@ TEST_F(VellEventTest, DeathRowDeletionRepliesOnceFromItsCompletion) {
     EXPECT_EQ(connection_->replies(),
               std::vector<Value>{dictionaryOf({{"ReplyError", Value(1u)}})});
     EXPECT_FALSE(std::filesystem::exists(deathrow / "A"));
-}
 
-TEST_F(VellEventTest, AReplyAndItsCopiesGoOutOnceBetweenThem) {
     // A handler that replies from its completion keeps a copy; should the
     // dispatcher then report a late failure, the client must still get one
     // reply, not two that the next request would mistake for its own.
+    connection_ = std::make_shared<FakeIpcConnection>();
     QRNVellReply reply(connection_);
     QRNVellReply completionCopy = reply;
     reply.sendWithError(40);
