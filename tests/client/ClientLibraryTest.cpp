@@ -27,10 +27,9 @@ Value withError(std::uint64_t code, Value keys = Value::dictionary()) {
     return keys;
 }
 
-// A reply frame whose header and body are as given.
-FakeServer::Response rawFrame(std::uint32_t declaredLength, std::uint8_t flags,
+FakeServer::Response rawFrame(std::uint32_t length, std::uint8_t flags,
                               std::vector<std::uint8_t> body, bool closeAfter = false) {
-    return {FrameSocket::rawFrame(declaredLength, flags, body), closeAfter};
+    return {FrameSocket::rawFrame(length, flags, body), closeAfter};
 }
 
 } // namespace
@@ -44,9 +43,9 @@ TEST(QRNClient, SendsFramedRequestsAndReadsRepliesInOrder) {
         if (req == request(7)) {
             keys.set("Blob", blob);
         }
-        return FakeServer::reply(keys);
+        return FakeServer::reply(withError(1, keys));
     });
-    auto client = QRNClient::adopt(server.takeClientEnd(), {});
+    auto client = QRNClient::connect(server.path);
     ASSERT_TRUE(client);
     Value huge = request(5);
     huge.set("Value", Value::Data(1024 * 1024, 0));
@@ -63,9 +62,10 @@ TEST(QRNClient, SendsFramedRequestsAndReadsRepliesInOrder) {
                   command == 7 ? blob : Value());
     }
     client->close();
-    EXPECT_EQ(server.requests().size(), 3u);
-    EXPECT_EQ(server.replyFlags(), std::vector<bool>(3, true));
-    EXPECT_EQ(server.requests()[1], request(7));
+    const auto sent = server.requests();
+    ASSERT_EQ(sent.size(), 3u);
+    EXPECT_TRUE(sent[0].second && sent[1].second && sent[2].second); // the reply flag
+    EXPECT_EQ(sent[1].first, request(7));
 }
 
 // Every broken or missing reply is an error that closes the connection.
@@ -83,16 +83,15 @@ TEST(QRNClient, BrokenRepliesAreErrorsThatCloseTheConnection) {
         {rawFrame(1024 * 1024 + 1, 0, {}), EMSGSIZE, "1048577 bytes"},
         {rawFrame(1, 0x02, {0xA0}), EPROTO, "flag"},
         {rawFrame(2, 0, {0xFF, 0xFF}), EBADMSG, "does not decode"},
-        {{FakeServer::frame(Value("text")), false}, EBADMSG, "not a dictionary"},
+        {FakeServer::reply(Value("text")), EBADMSG, "not a dictionary"},
         {rawFrame(1, 0, {0xA0, 0x00, 0x00}), EPROTO, "2 unexpected bytes"},
         {{}, ETIMEDOUT, ""}, // no reply at all
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.messagePart);
         FakeServer server([&](const Value&) { return c.response; });
-        auto client = QRNClient::adopt(
-            server.takeClientEnd(),
-            {std::chrono::milliseconds(c.expectedErrno == ETIMEDOUT ? 20 : 30000)});
+        auto client = QRNClient::connect(
+            server.path, {std::chrono::milliseconds(c.expectedErrno == ETIMEDOUT ? 20 : 30000)});
         ASSERT_TRUE(client);
         auto reply = client->send(request(0));
         ASSERT_FALSE(reply);
@@ -126,11 +125,11 @@ TEST(QRNClient, ReportsWhyItCannotConnect) {
 // or holding the wrong types are errors naming the key.
 TEST(QRNContainerClient, RequestKeysReplyFieldsAndBadReplies) {
     Value next;
-    FakeServer server([&](const Value&) { return FakeServer::Response{FakeServer::frame(next)}; });
-    auto connection = QRNClient::adopt(server.takeClientEnd(), {});
+    FakeServer server([&](const Value&) { return FakeServer::reply(next); });
+    auto connection = QRNClient::connect(server.path);
     ASSERT_TRUE(connection);
     QRNContainerClient client(*connection);
-    const auto sent = [&] { return server.requests().back(); };
+    const auto sent = [&] { return server.requests().back().first; };
 
     // The UUID as 16 bytes of data is read as well as a UUID value.
     const UUID uuid = UUID::random();

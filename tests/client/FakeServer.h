@@ -1,16 +1,16 @@
 #pragma once
-// A stand-in for quarnd in client tests: reads request frames, records them,
-// and writes back whatever bytes the test wants (a good reply frame, or a
-// broken one). Serves a socketpair, or a listening socket at a path.
+// A stand-in for quarnd in client tests: listens at a socket of its own,
+// records each request frame with its reply flag and writes back whatever
+// bytes the test wants (a good reply frame or a broken one), one connection
+// after the other.
 
-#include "Daemon/support/Value.h"
+#include "common/shared/FrameSocket.h"
 
-#include <cstdint>
-#include <filesystem>
-#include <functional>
 #include <mutex>
 #include <thread>
-#include <vector>
+#include <unistd.h>
+
+#include <sys/socket.h>
 
 namespace quarn::test {
 
@@ -20,38 +20,48 @@ public:
         std::vector<std::uint8_t> bytes;
         bool closeAfter = false;
     };
-    using Respond = std::function<Response(const Value& request)>;
+    static Response reply(const Value& v) { return {FrameSocket::frame(v, 0)}; }
 
-    // A reply frame holding `reply`.
-    static std::vector<std::uint8_t> frame(const Value& reply);
-    // {"ReplyError": 1} merged with `keys`.
-    static Response reply(Value keys = Value::dictionary());
+    explicit FakeServer(std::function<Response(const Value&)> respond)
+        : respond_(std::move(respond)) {}
+    ~FakeServer() {
+        ::shutdown(listener_, SHUT_RDWR);
+        thread_.join();
+        ::close(listener_);
+        std::filesystem::remove(path);
+    }
 
-    // On a socketpair; clientEnd() hands out the other end.
-    explicit FakeServer(Respond respond);
-    // Listening at `socketPath`, one connection after the other.
-    FakeServer(const std::filesystem::path& socketPath, Respond respond);
-    ~FakeServer();
-    FakeServer(const FakeServer&) = delete;
-    FakeServer& operator=(const FakeServer&) = delete;
+    std::vector<std::pair<Value, bool>> requests() const {
+        std::lock_guard lock(mutex_);
+        return requests_;
+    }
 
-    int takeClientEnd();
-    std::vector<Value> requests() const;
-    // The reply flag of every request frame read.
-    std::vector<bool> replyFlags() const;
+    const std::filesystem::path path = std::filesystem::temp_directory_path() /
+                                       ("quarn-fake-" + std::to_string(::getpid()) + "-" +
+                                        std::to_string(reinterpret_cast<std::uintptr_t>(this)));
 
 private:
-    void serve(int fd);
-
-    Respond respond_;
-    int clientEnd_ = -1;
-    int serverEnd_ = -1;
-    int listenFd_ = -1;
-    // Guards requests_ and replyFlags_, written by the server thread.
-    mutable std::mutex mutex_;
-    std::vector<Value> requests_;
-    std::vector<bool> replyFlags_;
-    std::thread thread_;
+    std::function<Response(const Value&)> respond_;
+    mutable std::mutex mutex_; // guards requests_, written by the server thread
+    std::vector<std::pair<Value, bool>> requests_;
+    int listener_ = FrameSocket::listenAt(path, 8);
+    std::thread thread_{[this] {
+        FrameSocket::acceptEach(listener_, [this](int fd) {
+            std::vector<std::uint8_t> body;
+            while (auto frame = FrameSocket::readFrame(fd, body)) {
+                const Value request = frame->message ? *frame->message : Value();
+                {
+                    std::lock_guard lock(mutex_);
+                    requests_.emplace_back(request, frame->header.expectsReply);
+                }
+                const Response response = respond_(request);
+                if (!FrameSocket::writeAll(fd, response.bytes) || response.closeAfter) {
+                    break;
+                }
+            }
+            ::close(fd);
+        });
+    }};
 };
 
 } // namespace quarn::test
