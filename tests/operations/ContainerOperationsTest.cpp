@@ -65,11 +65,13 @@ protected:
         return std::make_shared<QRNClientConnection>(client, true, true, true, std::nullopt,
                                                      std::nullopt, std::move(queue));
     }
-    Value infoOnDisk(const QRNMetadataPtr& metadata) {
+    // The info value of `key` in the metadata file; none when missing.
+    Value infoOnDisk(const QRNMetadataPtr& metadata, const char* key) {
         auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(
             metadata->url() / QRNMetadata::kFileName, user(), true);
         EXPECT_TRUE(read.has_value());
-        return read ? (*read)->info() : Value();
+        const Value* value = read ? (*read)->info().get(key) : nullptr;
+        return value ? *value : Value();
     }
     // Runs one staged delete (with locking) on a fresh queue; answers its code.
     static std::uint64_t stage(std::vector<QRNContainerIdentityPtr> identities) {
@@ -87,7 +89,7 @@ protected:
     std::vector<std::string> ran_;
 };
 
-TEST_F(ContainerOperationsTest, InfoValuesAreWrittenReadAndRemovedAndAFailedWriteChangesNothing) {
+TEST_F(ContainerOperationsTest, InfoValuesRecordedProtectionClassAndListing) {
     auto made = create(kClientBundle, kClass);
     ASSERT_TRUE(made);
     const auto id = made->containerIdentity();
@@ -96,7 +98,7 @@ TEST_F(ContainerOperationsTest, InfoValuesAreWrittenReadAndRemovedAndAFailedWrit
     env_->failCall(EnvCall::Rename, 1, EIO);
     EXPECT_EQ(connection_->setInfoValue(Value("blue"), &key, id, true).error(),
               kQRNErrorWriteStateFileFailed);
-    EXPECT_EQ(infoOnDisk(made).get("color"), nullptr);
+    EXPECT_EQ(infoOnDisk(made, "color"), Value());
     EXPECT_EQ(connection_->infoValueForKey(&key, id, true).error(), kQRNErrorInfoValueNotFound);
     // An exception becomes code 40 and gives the identifier lock back.
     env_->setHook([](EnvCall call, std::uint64_t) {
@@ -111,13 +113,12 @@ TEST_F(ContainerOperationsTest, InfoValuesAreWrittenReadAndRemovedAndAFailedWrit
     auto read = connection_->infoValueForKey(&key, identity(kClientBundle, kClass), true);
     ASSERT_TRUE(read.has_value());
     EXPECT_EQ(*read, Value("blue"));
-    ASSERT_NE(infoOnDisk(made).get("color"), nullptr);
-    EXPECT_EQ(*infoOnDisk(made).get("color"), Value("blue"));
+    EXPECT_EQ(infoOnDisk(made, "color"), Value("blue"));
 
     // A none value removes the key, from the cache and from the file.
     ASSERT_TRUE(connection_->setInfoValue(Value(), &key, id, true));
     EXPECT_EQ(connection_->infoValueForKey(&key, id, true).error(), kQRNErrorInfoValueNotFound);
-    EXPECT_EQ(infoOnDisk(made).get("color"), nullptr);
+    EXPECT_EQ(infoOnDisk(made, "color"), Value());
 
     const Value numberKey(7);
     for (const Value* bad : {static_cast<const Value*>(nullptr), &numberKey}) {
@@ -130,13 +131,10 @@ TEST_F(ContainerOperationsTest, InfoValuesAreWrittenReadAndRemovedAndAFailedWrit
               kQRNErrorContainerNotFound);
     EXPECT_EQ(connection_->metadataWithContainerIdentity(absent).error(),
               kQRNErrorContainerNotFound);
-}
 
-TEST_F(ContainerOperationsTest, RecreatedStructureUsesTheRecordedProtectionClass) {
-    auto made = create(kClientBundle, kClass);
-    ASSERT_TRUE(made);
-    const Value key("com.orvex.Brevon.ContentProtectionClass");
-    ASSERT_TRUE(connection_->setInfoValue(Value(3), &key, made->containerIdentity(), true));
+    // The default structure made again uses the recorded protection class.
+    const Value classKey("com.orvex.Brevon.ContentProtectionClass");
+    ASSERT_TRUE(connection_->setInfoValue(Value(3), &classKey, id, true));
     fs::remove_all(made->url() / "Library");
     fs::remove_all(made->url() / "SystemData");
 
@@ -148,9 +146,8 @@ TEST_F(ContainerOperationsTest, RecreatedStructureUsesTheRecordedProtectionClass
         ASSERT_TRUE(cls.has_value()) << name;
         EXPECT_EQ(*cls, std::string_view(name) == "SystemData" ? 0 : 3) << name;
     }
-}
 
-TEST_F(ContainerOperationsTest, ContainersOfAClassAreListedForTheClientsUser) {
+    // Listing a class: the client's user's permanent containers of that class.
     create("com.example.one", kClass);
     create("com.example.two", kClass);
     create("com.example.three", kClass, true);
@@ -161,7 +158,8 @@ TEST_F(ContainerOperationsTest, ContainersOfAClassAreListedForTheClientsUser) {
     for (const auto& metadata : *listed) {
         identifiers.insert(metadata->identifier());
     }
-    EXPECT_EQ(identifiers, (std::set<std::string>{"com.example.one", "com.example.two"}));
+    EXPECT_EQ(identifiers,
+              (std::set<std::string>{kClientBundle, "com.example.one", "com.example.two"}));
 
     for (std::uint64_t invalid : {0ull, 14ull}) {
         EXPECT_EQ(connection_->containersWithClass(invalid, false).error(),
@@ -169,7 +167,7 @@ TEST_F(ContainerOperationsTest, ContainersOfAClassAreListedForTheClientsUser) {
     }
 }
 
-TEST_F(ContainerOperationsTest, CommandsInsertedWhileRunningAreAllRunInOrder) {
+TEST_F(ContainerOperationsTest, QueuedCommandsRunInOrderWhenTheRequestCompletes) {
     std::uint64_t error = kQRNErrorNone;
     EXPECT_FALSE(queue_->executeNextCommandWithError(error));
     EXPECT_EQ(error, kQRNErrorCommandQueueExhausted);
@@ -198,17 +196,14 @@ TEST_F(ContainerOperationsTest, CommandsInsertedWhileRunningAreAllRunInOrder) {
     EXPECT_TRUE(queue_->executeAllUntilExhaustedOrError(error));
     EXPECT_EQ(error, kQRNErrorNone);
     EXPECT_EQ(ran_, (std::vector<std::string>{"a", "b", "c", "d", "e"}));
-    EXPECT_EQ(queue_->count(), 0u);
-}
 
-TEST_F(ContainerOperationsTest, DeletionHappensWhenTheRequestCompletes) {
+    // Deletion is queued and happens when the request completes.
     auto made = create(kClientBundle, kClass);
     ASSERT_TRUE(made);
     auto request = withQueue(queue_);
     ASSERT_TRUE(
         request->deleteContainerWithContainerIdentity(identity(kClientBundle, kClass), false));
     EXPECT_TRUE(fs::exists(made->url())) << "still there until the queued commands run";
-    std::uint64_t error = kQRNErrorNone;
     EXPECT_TRUE(request->completeWithError(error));
     EXPECT_EQ(error, kQRNErrorNone);
     EXPECT_FALSE(fs::exists(made->url()));
@@ -250,6 +245,21 @@ TEST_F(ContainerOperationsTest, StagedContainersGoToDeathRowAndLeaveTheCacheVani
     EXPECT_TRUE(log.contains("Failed to delete container at")) << log.all();
     EXPECT_TRUE(fs::exists(d->url())) << "nothing could be removed";
     EXPECT_FALSE(cached(identity("com.example.d", kClass)));
+
+    // A transient bundle keeps the code-signing records while a permanent one exists.
+    QRNMetadataPtr permanent = create("com.example.app", kQRNContainerClassAppBundle);
+    QRNMetadataPtr transient = create("com.example.app", kQRNContainerClassAppBundle, true);
+    ASSERT_TRUE(permanent && transient);
+    log.clear();
+    EXPECT_EQ(stage({transient->containerIdentity()}), kQRNErrorNone);
+    EXPECT_TRUE(log.contains("Skipping removal of code sign mapping")) << log.all();
+    EXPECT_FALSE(fs::exists(transient->url()));
+    EXPECT_FALSE(cached(transient->containerIdentity(), true));
+    EXPECT_TRUE(cached(permanent->containerIdentity())) << "the permanent container stays";
+    log.clear();
+    EXPECT_EQ(stage({permanent->containerIdentity()}), kQRNErrorNone);
+    EXPECT_FALSE(log.contains("Skipping removal of code sign mapping"));
+    EXPECT_FALSE(fs::exists(permanent->url()));
 }
 
 TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIdentities) {
@@ -270,23 +280,6 @@ TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIde
     EXPECT_FALSE(cached(identity("com.example.a", kClass)));
     EXPECT_TRUE(cached(identity("com.example.c", kClass)));
     EXPECT_TRUE(fs::exists(c->url() / QRNMetadata::kFileName)) << "later identities untouched";
-}
-
-TEST_F(ContainerOperationsTest, TransientBundleKeepsCodeSigningRecordsWhileAPermanentOneExists) {
-    QRNMetadataPtr permanent = create("com.example.app", kQRNContainerClassAppBundle);
-    QRNMetadataPtr transient = create("com.example.app", kQRNContainerClassAppBundle, true);
-    ASSERT_TRUE(permanent && transient);
-    LogCapture log;
-    EXPECT_EQ(stage({transient->containerIdentity()}), kQRNErrorNone);
-    EXPECT_TRUE(log.contains("Skipping removal of code sign mapping")) << log.all();
-    EXPECT_FALSE(fs::exists(transient->url()));
-    EXPECT_FALSE(cached(transient->containerIdentity(), true));
-    EXPECT_TRUE(cached(permanent->containerIdentity())) << "the permanent container stays";
-
-    log.clear();
-    EXPECT_EQ(stage({permanent->containerIdentity()}), kQRNErrorNone);
-    EXPECT_FALSE(log.contains("Skipping removal of code sign mapping"));
-    EXPECT_FALSE(fs::exists(permanent->url()));
 }
 
 } // namespace
