@@ -104,7 +104,6 @@ TEST_F(CodeSigningRegistryTest, FollowsTheEntriesOfTheRunningProcessAndChecksIts
     // Another process that got the pid, or none at all.
     write("self.plist", plist);
     IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(tokenOf(::getpid()));
-    EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "com.orvex.tests");
     fields.startTime += 1;
     EXPECT_EQ(identifierOf(IpcPeer::makeAuditToken(fields)), "");
     fields.pid = 0;
@@ -189,9 +188,8 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
 }
 
-TEST(ExecutableDigestCacheTest, RewrittenFileIsHashedAgain) {
-    quarn::test::TempRoot root;
-    const auto file = root.path() / "program";
+TEST_F(CodeSigningRegistryTest, DigestCacheHashesARewrittenFileAgain) {
+    const auto file = root_.path() / "program";
     std::ofstream(file, std::ios::binary) << "first version";
     ExecutableDigestCache cache;
     auto digestNow = [&] {

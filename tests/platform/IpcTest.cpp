@@ -125,7 +125,7 @@ Value everyKind() {
 
 } // namespace
 
-TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessNoneOnceItIsGoneAndProcIsParsedStrictly) {
+TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessProcIsParsedStrictlyAndWireFormsAreLittleEndian) {
     int fds[2];
     ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     auto peer = IpcPeer::fromSocket(fds[0]);
@@ -183,9 +183,8 @@ TEST(IpcPeerTest, PeersHaveTheTokenOfTheirProcessNoneOnceItIsGoneAndProcIsParsed
     EXPECT_EQ(ProcessInfo::parseLoginUID("501\n"), 501u);
     EXPECT_FALSE(ProcessInfo::parseLoginUID("-1"));
     EXPECT_FALSE(ProcessInfo::parseLoginUID(""));
-}
 
-TEST(IpcPeerTest, WireFormsOfTokensAndFramesAreLittleEndian) {
+    // Wire forms of tokens and frames are little-endian.
     const IpcPeer::TokenFields fields{0x04030201, 11, 12, 13, 14, 0x00010000, 16, 0xA1B2C3D4};
     const auto token = IpcPeer::makeAuditToken(fields);
     const std::array<std::uint8_t, 8> ends{token[0],  token[3],  token[4],  token[16],
@@ -341,7 +340,6 @@ TEST_F(IpcListenerTest, ServesInOrderConcurrentlyHeldOnesLaterAndHearsEachEndOnc
         ASSERT_EQ(seqOf(client.receive()), i);
     }
     EXPECT_FALSE(overlapped_);
-    EXPECT_EQ(record(0).connection->peer().pid(), ::getpid());
 
     // 1 is held and reads nothing while 2 is served; replies may come from
     // this thread after the handlers returned.
@@ -409,10 +407,9 @@ TEST_F(IpcListenerTest, ServesInOrderConcurrentlyHeldOnesLaterAndHearsEachEndOnc
     record(0).connection->sendReply(Value::dictionary());
     record(2).connection->cancel();
     resume(5);
-    const int expectedEnds[] = {1, 1, 1, 1, 1, 0};
-    for (std::size_t i = 0; i < std::size(expectedEnds); ++i) {
-        EXPECT_EQ(record(i).ends, expectedEnds[i]) << "connection " << i;
-    }
+    EXPECT_EQ((std::vector{record(0).ends, record(1).ends, record(2).ends, record(3).ends,
+                           record(4).ends, record(5).ends}),
+              (std::vector{1, 1, 1, 1, 1, 0}));
 }
 
 // Also the ways start() fails without harm.
@@ -455,18 +452,16 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
     EXPECT_TRUE(std::filesystem::is_regular_file(root_ / "/not-a-socket"));
 
     // The inherited socket is served, with limits for hostile frames.
-    const Value deep(Value::Dictionary{
-        {"a", Value(Value::Array{Value(Value::Array{Value(Value::Array{Value::array()})})})}});
     const struct {
-        const char* name;
         Bytes bytes;
         const char* reason;
     } cases[] = {
-        {"oversize", FrameSocket::rawFrame(1025, 1, {}),
-         "a frame of 1025 bytes is over the limit of 1024"},
-        {"garbage", FrameSocket::rawFrame(4, 1, Bytes{0xff, 0xff, 0xff, 0xff}), "does not decode"},
-        {"empty", FrameSocket::rawFrame(0, 0, {}), "does not decode"},
-        {"deep", FrameSocket::frame(deep, 1), "nest deeper than 4"},
+        {FrameSocket::rawFrame(1025, 1, {}), "a frame of 1025 bytes is over the limit of 1024"},
+        {FrameSocket::rawFrame(4, 1, Bytes{0xff, 0xff, 0xff, 0xff}), "does not decode"},
+        {FrameSocket::rawFrame(0, 0, {}), "does not decode"}, // empty
+        // A map around three arrays around an empty one.
+        {FrameSocket::rawFrame(7, 1, Bytes{0xa1, 0x61, 'a', 0x81, 0x81, 0x81, 0x80}),
+         "nest deeper than 4"},
     };
     ASSERT_TRUE(start({.socketPath = {},
                        .inheritedFd = fd,
@@ -475,15 +470,15 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
                        .maxConnections = 2}));
     LogCapture log;
     Client bystander(socketPath());
-    // A frame of exactly the limit is served.
-    std::string pad;
-    const auto padded = [&] { return Value(Value::Dictionary{{"Seq", Value(1u)}, {"Pad", pad}}); };
-    while (IpcFrame::encodeMessage(padded(), true).size() < 5 + 1024) {
-        pad += 'p';
-    }
-    ASSERT_EQ(IpcFrame::encodeMessage(padded(), true).size(), 5 + 1024u);
-    bystander.send(padded());
-    EXPECT_EQ(bystander.receive(), padded());
+    // A frame of exactly the limit is served (a text over 255 bytes has two
+    // more bytes of length).
+    const auto padded = [](std::size_t n) {
+        return Value(Value::Dictionary{{"Seq", Value(1u)}, {"Pad", std::string(n, 'p')}});
+    };
+    const Value exact = padded(1024 - CborCodec::encode(padded(0)).size() - 2);
+    ASSERT_EQ(IpcFrame::encodeMessage(exact, true).size(), 5 + 1024u);
+    bystander.send(exact);
+    EXPECT_EQ(bystander.receive(), exact);
     {
         Client second(socketPath());
         EXPECT_EQ(second.roundTrip(2), 2u);
@@ -494,7 +489,7 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
     // Once the second has ended, there is room again.
     ASSERT_TRUE(waitForEnds({1}));
     for (std::size_t i = 0; i < std::size(cases); ++i) {
-        SCOPED_TRACE(cases[i].name);
+        SCOPED_TRACE(i);
         log.clear();
         Client bad(socketPath());
         bad.write(cases[i].bytes);
@@ -547,8 +542,6 @@ TEST(CborCodecTest, EveryKindRoundTripsKeepsItsSignAndIsPlainCborRefusedWhenCutO
 TEST(CborCodecTest, MalformedOrTooDeepOrLargeInputIsRefusedForItsReason) {
     EXPECT_TRUE(CborCodec::decode(nestedArrays(32)));
     EXPECT_FALSE(CborCodec::decode(nestedArrays(33)));
-    EXPECT_TRUE(CborCodec::decode(nestedArrays(3), {.maxBytes = 64, .maxNesting = 3}));
-    EXPECT_FALSE(CborCodec::decode(nestedArrays(4), {.maxBytes = 64, .maxNesting = 3}));
     // Maps count as nesting too.
     EXPECT_FALSE(CborCodec::decode(Bytes({0xa1, 0x61, 'k', 0x81, 0x81, 0x00}),
                                    {.maxBytes = 64, .maxNesting = 2}));

@@ -180,7 +180,6 @@ TEST(SandboxKernel, MappingsArePerUserAndReplaceByIdentity) {
 
     EXPECT_EQ(k.removeContainerMapping(501, item("com.a", 2, "")), 0);
     EXPECT_EQ(k.removeContainerMapping(501, item("com.a", 2, "")), ENOENT);
-    EXPECT_EQ(k.count(501), 1u);
     EXPECT_EQ(k.setContainerMapping(501, item("", 2, "/x")), EINVAL);
 
     // Iteration stops when asked and tolerates removal from inside.
