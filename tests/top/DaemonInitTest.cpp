@@ -52,16 +52,23 @@ protected:
     FirstBootMarker marker_;
 };
 
-TEST_F(DaemonInitTest, FirstStartRunsTheFirstBootPassesFirstAndTheNextOnlyTheBootPasses) {
+TEST_F(DaemonInitTest,
+       FirstStartRunsTheFirstBootPassesFirstAndTheNextOnlyTheBootPassesOnALockedDevice) {
     // The first start leaves the marker the second one finds.
     for (bool firstBoot : {true, false}) {
         SCOPED_TRACE(firstBoot ? "first start" : "second start");
         const fs::path transient = QRNGlobalConfiguration::sharedInstance().transientDirectory();
         fs::create_directories(transient);
         test::LogCapture log;
+        if (!firstBoot) {
+            root_.writeFile("/private/var/run/quarnd/lockstate", "1\n");
+        }
         {
             QRNDaemon daemon(root_.sharedContext());
             initialise(daemon);
+            // A device locked at start suspends the lock-state queue.
+            EXPECT_EQ(daemon.lockStateFollower()->recordedState() == LockState::kLocked,
+                      !firstBoot);
         }
         // Index of the first message beginning with `prefix` (signposts begin
         // with their name), or -1.
@@ -96,14 +103,6 @@ TEST_F(DaemonInitTest, FirstStartRunsTheFirstBootPassesFirstAndTheNextOnlyTheBoo
             EXPECT_TRUE(fs::exists(transient)) << "transient data is kept until a first boot";
         }
     }
-}
-
-TEST_F(DaemonInitTest, ALockedDeviceAtStartSuspendsTheLockStateQueue) {
-    ASSERT_TRUE(marker_.create());
-    root_.writeFile("/private/var/run/quarnd/lockstate", "1\n");
-    QRNDaemon daemon(root_.sharedContext());
-    initialise(daemon);
-    EXPECT_EQ(daemon.lockStateFollower()->recordedState(), LockState::kLocked);
 }
 
 } // namespace
