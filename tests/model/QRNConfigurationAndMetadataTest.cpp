@@ -162,17 +162,13 @@ TEST_F(QRNMetadataTest, WriteFailuresKeepTheOldFile) {
     EXPECT_FALSE(std::filesystem::exists(globalTemp));
 }
 
-// Each invalid entry is refused with its own message, in the order the
-// entries are checked.
-TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
+// Each refused file gives its code and message; entries are checked in a
+// fixed order; the legacy owner entry must match the expected user's owner.
+// The reader looks at a few keys of the file's tree but refuses what a full
+// conversion refuses (a keyed-archive UID under a key it never reads).
+TEST_F(QRNMetadataTest, RefusedFilesGiveTheirCodeAndMessage) {
     LogCapture log;
-    struct Case {
-        const char* name;
-        std::function<void(Value&)> edit;
-        const char* message;
-    };
-    Value array = Value::array();
-    array.append("x");
+    auto other = user(600);
     const auto set = [](const char* key, Value v) { return [=](Value& d) { d.set(key, v); }; };
     const auto setIdentity = [](const char* key, Value v) {
         return [=](Value& d) {
@@ -181,7 +177,15 @@ TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
             d.set("QRNMetadataUserIdentity", u);
         };
     };
-    const std::vector<Case> cases = {
+    Value list = Value::array();
+    list.append("x");
+    struct Case {
+        const char* name;
+        std::function<void(Value&)> edit;
+        const char* message;
+        QRNUserIdentityPtr expected = nullptr; // the default identity
+    };
+    const Case cases[] = {
         {"identifier", set("QRNMetadataIdentifier", 5u), "Invalid metadata Identifier: 5 at "},
         {"order",
          [](Value& d) { d.erase("QRNMetadataIdentifier"), d.set("QRNMetadataContentClass", 0u); },
@@ -199,92 +203,72 @@ TEST_F(QRNMetadataTest, InvalidEntriesAreRefused) {
         {"identity version", setIdentity("version", "3"), "Could not create user identity from "},
         {"identity persona type", setIdentity("type", 3u), ": 75"},
         {"identity other user", setIdentity("posixUID", 777u), "Incorrect User Identity: "},
-        {"info", set("QRNMetadataInfo", array), "Invalid metadata Info: "},
+        {"info", set("QRNMetadataInfo", list), "Invalid metadata Info: "},
         {"assets", set("QRNMetadataUserManagedAssetsDirName", 1u),
          "Invalid metadata User Managed Dir Name String: 1 at "},
+        {"persona", set("QRNMetadataPersona", 601u),
+         "Incorrect UserId: 601, expecting: 600 for com.example.app at ", other},
+        {"persona type", set("QRNMetadataPersona", "600"), "", other},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         log.clear();
-        auto url = fileWith(mobile(), c.edit);
-        EXPECT_EQ(failureOf(url, mobile()), kQRNErrorInvalidMetadata);
+        const auto& u = c.expected ? c.expected : mobile();
+        EXPECT_EQ(failureOf(fileWith(u, c.edit), u), kQRNErrorInvalidMetadata);
         EXPECT_TRUE(log.contains(c.message)) << log.all();
     }
-}
 
-// The reader looks at a few keys of the file's tree but refuses what a full
-// conversion refuses, and of a key given twice takes the last value.
-TEST_F(QRNMetadataTest, ReadingFromTheTreeKeepsTheFullChecks) {
-    const UUID uuid = UUID::random();
-    auto dir = containerDir(mobile(), 2, uuid);
-    auto url = dir / QRNMetadata::kFileName;
-    auto node = propertyListFromValue(record(mobile(), 2, uuid, dir).dictionary());
-    ASSERT_TRUE(node);
-    char* raw = nullptr;
-    std::uint32_t length = 0;
-    plist_to_xml(node->get(), &raw, &length);
-    const std::string xml(raw, length);
-    plist_to_xml_free(raw);
-    const auto withExtra = [&](const std::string& entries) {
-        std::string text = xml;
-        text.insert(text.rfind("</dict>"), entries);
-        std::ofstream(url, std::ios::trunc) << text;
-    };
-
-    withExtra("<key>QRNMetadataIdentifier</key><string>com.example.later</string>");
-    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), true);
-    ASSERT_TRUE(read);
-    EXPECT_EQ((*read)->identifier(), "com.example.later");
-    EXPECT_EQ((*read)->url(), dir);
-    EXPECT_EQ((*read)->urlString(), dir.native());
-
-    // A keyed-archive UID under a key the reader never looks at.
+    // What is no readable property-list dictionary gives code 12.
+    auto url = fileWith(mobile(), [](Value&) {});
+    auto node = propertyListFromValue(*QRN_dictionaryWithContentsOfURL(url));
     plist_dict_set_item(node->get(), "Other", plist_new_uid(1));
-    raw = nullptr;
-    plist_to_bin(node->get(), &raw, &length);
-    ASSERT_NE(raw, nullptr);
-    std::ofstream(url, std::ios::binary | std::ios::trunc).write(raw, length);
-    plist_to_bin_free(raw);
-    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
-}
-
-TEST_F(QRNMetadataTest, UnreadableFilesGiveCode12) {
-    LogCapture log;
-    auto url = containerDir(mobile(), 2, UUID::random()) / QRNMetadata::kFileName;
-    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
-    EXPECT_TRUE(log.contains("Failed to read metadata at URL " + url.string()));
-    auto array = *binaryPropertyList(Value(Value::Array{"x"}));
-    for (const std::string& bytes :
-         {std::string(array.begin(), array.end()), std::string("bplist00 and then garbage")}) {
+    char* uid = nullptr;
+    std::uint32_t length = 0;
+    plist_to_bin(node->get(), &uid, &length);
+    const auto array = *binaryPropertyList(Value(Value::Array{"x"}));
+    for (const std::string& bytes : {std::string(uid, length), std::string("bplist00 and then"),
+                                     std::string(array.begin(), array.end())}) {
         std::ofstream(url, std::ios::binary | std::ios::trunc) << bytes;
         EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
     }
+    plist_to_bin_free(uid);
+    std::filesystem::remove(url);
+    EXPECT_EQ(failureOf(url, mobile()), kQRNErrorReadPlistFailed);
+    EXPECT_TRUE(log.contains("Failed to read metadata at URL " + url.string()));
 }
 
 // A file without a stored identity belongs to whoever the caller expects;
-// one with a stored identity must match. The legacy owner entry is checked
-// against the expected identity's owner for the class, except for the
-// default identity.
-TEST_F(QRNMetadataTest, OwnerEntriesAgainstTheExpectedUser) {
-    LogCapture log;
+// the owner entry is not checked for the default identity; of a key given
+// twice the last value counts.
+TEST_F(QRNMetadataTest, AcceptedOwnerEntriesAndRepeatedKeys) {
     auto other = user(600);
-    auto url = fileWith(other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); });
-    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, other, true);
+    auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(
+        fileWith(other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); }), other, true);
     ASSERT_TRUE(read);
     EXPECT_EQ((*read)->userIdentity(), other);
     EXPECT_EQ((*read)->containerIdentity()->userIdentity(), other);
-    EXPECT_EQ(failureOf(fileWith(mobile(), [](Value&) {}), other, false), kQRNErrorInvalidMetadata);
-
     const auto persona = [&](Value v, const QRNUserIdentityPtr& u) {
-        return fileWith(u, [&](Value& d) { d.set("QRNMetadataPersona", v); });
+        return QRNMetadata::readAndValidateMetadataAtFileUrl(
+            fileWith(u, [&](Value& d) { d.set("QRNMetadataPersona", v); }), u, true);
     };
-    EXPECT_TRUE(QRNMetadata::readAndValidateMetadataAtFileUrl(persona(600u, other), other, true));
-    EXPECT_EQ(failureOf(persona(601u, other), other), kQRNErrorInvalidMetadata);
-    EXPECT_TRUE(log.contains("Incorrect UserId: 601, expecting: 600 for com.example.app at "))
-        << log.all();
-    EXPECT_EQ(failureOf(persona("600", other), other), kQRNErrorInvalidMetadata);
-    EXPECT_TRUE(
-        QRNMetadata::readAndValidateMetadataAtFileUrl(persona(999u, mobile()), mobile(), true));
+    EXPECT_TRUE(persona(600u, other));
+    EXPECT_TRUE(persona(999u, mobile()));
+
+    Value dict;
+    auto url = fileWith(mobile(), [&](Value& d) { dict = d; });
+    auto node = propertyListFromValue(dict);
+    char* xml = nullptr;
+    std::uint32_t length = 0;
+    plist_to_xml(node->get(), &xml, &length);
+    std::string text(xml, length);
+    plist_to_xml_free(xml);
+    text.insert(text.rfind("</dict>"),
+                "<key>QRNMetadataIdentifier</key><string>com.example.later</string>");
+    std::ofstream(url, std::ios::trunc) << text;
+    read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), true);
+    ASSERT_TRUE(read);
+    EXPECT_EQ((*read)->identifier(), "com.example.later");
+    EXPECT_EQ((*read)->url(), url.parent_path());
 }
 
 TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
