@@ -9,6 +9,8 @@
 #include "Daemon/support/ProcessTransaction.h"
 #include "Daemon/support/UUID.h"
 
+#include <gmock/gmock.h>
+
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
@@ -17,7 +19,6 @@
 #include <atomic>
 #include <future>
 #include <map>
-#include <set>
 #include <sstream>
 
 using namespace quarn;
@@ -45,9 +46,6 @@ class DeathRowTest : public CreateFixture {
 protected:
     DeathRowTest() : CreateFixture(false) {}
 
-    static std::shared_ptr<Queue> background() {
-        return QRNClientConnection::_sharedDeathrowBackgroundQueue();
-    }
     fs::path makeFile(const std::string& absolute) {
         root_.writeFile(absolute, absolute);
         return root_ / absolute;
@@ -95,7 +93,8 @@ TEST_F(DeathRowTest, ItemsAreParkedApartAndPassesDestroyThemOrSetThemAside) {
     fs::create_directories(deathRow());
     fs::create_directories(root_ / "/tmp");
     const std::size_t open = ProcessTransaction::count();
-    background()->suspend(); // passes wait, so death row can be looked at
+    QRNClientConnection::_sharedDeathrowBackgroundQueue()
+        ->suspend(); // passes wait, so death row can be looked at
     EXPECT_TRUE(shared()._moveItemAtURLToDeathRow(root_ / "/private/var/gone", true, true));
     EXPECT_EQ(entriesIn(deathRow()), 0u) << "no unique directory is left for a missing item";
     EXPECT_EQ(ProcessTransaction::count(), open) << "a missing item started a pass";
@@ -115,7 +114,7 @@ TEST_F(DeathRowTest, ItemsAreParkedApartAndPassesDestroyThemOrSetThemAside) {
         EXPECT_TRUE(fs::exists(deathRow() / unique / "Data"));
     }
     EXPECT_FALSE(fs::exists(a) || fs::exists(b));
-    background()->resume();
+    QRNClientConnection::_sharedDeathrowBackgroundQueue()->resume();
     drainBackground();
     EXPECT_EQ(ProcessTransaction::count(), open);
     EXPECT_EQ(entriesIn(deathRow()), 0u) << "the pass destroyed everything parked";
@@ -246,20 +245,17 @@ TEST_F(DeathRowTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsCon
     auto perUser = configuration().getPerUserConfigurationForUserIdentity(user());
     makeTree(perUser->transientDirectory() / "old-user-transient");
 
-    const int calls = runCleanup(
-        true, [&] { EXPECT_FALSE(fs::exists(orphan)) << "completion ran before the orphan pass"; });
-    EXPECT_EQ(calls, 1);
+    EXPECT_EQ(runCleanup(true, [&] { EXPECT_FALSE(fs::exists(orphan)) << "completion first"; }), 1);
     EXPECT_TRUE(fs::exists(kept->url() / QRNMetadata::kFileName));
-    EXPECT_FALSE(fs::exists(junk));
-    EXPECT_FALSE(fs::exists(configuration().transientDirectory()));
-    EXPECT_FALSE(fs::exists(configuration().transientBundleDirectory()));
-    EXPECT_FALSE(fs::exists(perUser->transientDirectory()));
-    const std::vector<std::string> parked = namesOnDeathRow();
-    const std::set<std::string> parkedSet(parked.begin(), parked.end());
-    for (const std::string& name : {orphanName, std::string("not-a-uuid"), std::string("Temp")}) {
-        EXPECT_TRUE(parkedSet.count(name)) << name << " not on death row";
+    for (const fs::path& gone :
+         {junk, configuration().transientDirectory(), configuration().transientBundleDirectory(),
+          perUser->transientDirectory()}) {
+        EXPECT_FALSE(fs::exists(gone)) << gone;
     }
-    EXPECT_EQ(parkedSet.count(kept->url().filename().string()), 0u);
+    const std::vector<std::string> parked = namesOnDeathRow();
+    EXPECT_THAT(parked, ::testing::IsSupersetOf(
+                            {orphanName, std::string("not-a-uuid"), std::string("Temp")}));
+    EXPECT_THAT(parked, ::testing::Not(::testing::Contains(kept->url().filename().string())));
 
     // The next boot cleanup destroys what the first-boot one parked.
     EXPECT_EQ(runCleanup(false), 1);
