@@ -5,7 +5,6 @@
 
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientIdentity.h"
-#include "Daemon/platform/IpcConnection.h"
 #include "Daemon/protection/QRNDataProtectionManager.h"
 #include "Daemon/support/PropertyList.h"
 
@@ -22,19 +21,6 @@ using namespace quarn;
 using namespace quarn::test;
 
 namespace {
-
-class FakeConnection final : public IpcConnection {
-public:
-    explicit FakeConnection(IpcPeer peer) : peer_(std::move(peer)) {}
-    const IpcPeer& peer() const override { return peer_; }
-    void setEventHandler(EventHandler) override {}
-    void resume() override {}
-    void sendReply(const Value&) override {}
-    void cancel() override {}
-
-private:
-    IpcPeer peer_;
-};
 
 // A forked copy of this process, alive until the object goes: the same
 // executable, another audit token.
@@ -72,8 +58,7 @@ protected:
     static QRNClientIdentityPtr identityOf(pid_t pid) {
         auto peer = IpcPeer::fromPID(pid);
         EXPECT_TRUE(peer);
-        return peer ? QRNClientIdentity::clientIdentityWithVellConnection(FakeConnection(*peer))
-                    : nullptr;
+        return peer ? QRNClientIdentity::clientIdentityWithPeer(*peer) : nullptr;
     }
     static QRNClientIdentityPtr client(Value entitlements) {
         return QRNClientIdentity::initWithBundleIdentifier(
@@ -121,25 +106,23 @@ TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntryAndOnlyTheInstallers
     EXPECT_NE(identityOf(::getpid()), first);
 }
 
-TEST_F(ClientIdentityTest, OnlyBooleansAndNumbersGrantAnEntitlement) {
-    auto identity = client(dictionaryOf({
-        {"flag", Value(true)},
-        {"off", Value(false)},
-        {"one", Value(1)},
-        {"zero", Value(0)},
-        {"text", Value("true")},
-        {"dict", dictionaryOf({{"x", Value(true)}})},
-        {"list", arrayOf({Value(true)})},
-    }));
+TEST_F(ClientIdentityTest,
+       OnlyBooleansAndNumbersGrantAnEntitlementAndTheFirstProtectionKeyDecides) {
+    auto identity = client(dictionaryOf({{"flag", Value(true)},
+                                         {"off", Value(false)},
+                                         {"one", Value(1)},
+                                         {"zero", Value(0)},
+                                         {"text", Value("true")},
+                                         {"dict", dictionaryOf({{"x", Value(true)}})},
+                                         {"list", arrayOf({Value(true)})}}));
     ASSERT_TRUE(identity);
     for (const char* name : {"flag", "off", "one", "zero", "text", "dict", "list", "absent"}) {
         const std::string_view granted(name);
         EXPECT_EQ(identity->boolValueOfEntitlement(name), granted == "flag" || granted == "one")
             << name;
     }
-}
 
-TEST_F(ClientIdentityTest, EntitledProtectionClassFollowsTheFirstKeyPresent) {
+    // The protection class asked for follows the first key present.
     using M = QRNDataProtectionManager;
     const struct {
         Value entitlements;
