@@ -4,9 +4,6 @@
 
 #include "FsTestSupport.h"
 
-#include <sys/socket.h>
-#include <sys/un.h>
-
 namespace quarn::test {
 namespace {
 
@@ -198,26 +195,16 @@ TEST_F(ProtectionTest, ClassesRoundTripAndThePredicateCanDecline) {
 TEST_F(ProtectionTest, ItemsThatCannotHoldAClassAnswerEBADF) {
     fs::create_symlink(file(), dir() / "link");
     ::mkfifo((dir() / "fifo").c_str(), 0600);
-    int sock = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    const auto socketPath = (dir() / "sock").string();
-    ASSERT_LT(socketPath.size(), sizeof address.sun_path);
-    socketPath.copy(address.sun_path, socketPath.size());
-    ASSERT_EQ(::bind(sock, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::mknod((dir() / "sock").c_str(), S_IFSOCK | 0600, 0), 0);
 
     for (auto item : {dir() / "link", dir() / "fifo", dir() / "sock"}) {
         EXPECT_TRUE(failedWith(manager_.dataProtectionClassOfItemAtURL(item), EBADF)) << item;
         EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(item, 2), EBADF)) << item;
     }
-    ::close(sock);
-    EXPECT_TRUE(log_.contains("Failed to getclass of file " + (dir() / "link").string()));
-    EXPECT_TRUE(log_.contains("Failed to setclass(2) on file " + (dir() / "fifo").string()));
     EXPECT_EQ(classOf(file()), 0) << "the link's target was not touched";
 
     EXPECT_TRUE(
         failedWith(manager_.setDataProtectionClassOfItemAtURL(dir() / "missing", 2), ENOENT));
-    EXPECT_TRUE(log_.contains("Failed to open " + (dir() / "missing").string() + " : "));
 }
 
 TEST_F(ProtectionTest, ClassOneItemsCannotChangeWhileLocked) {

@@ -16,79 +16,65 @@ protected:
     fs::path base() { return root_ / "/private/var/containers/Data/X"; }
     std::optional<fs::path> check(const fs::path& p) { return manager_.realPathForURL(p, base()); }
     fs::path real(const fs::path& p) { return fs::canonical(p); }
-    void link(const std::string& target, const fs::path& at) { fs::create_symlink(target, at); }
 };
 
 TEST_F(ContainmentTest, ResolvesInsideTheBaseAndRefusesEverythingElse) {
     // ".." is refused before the file system is asked, though this one stays inside.
     EXPECT_FALSE(check(base() / "sub" / ".." / "file"));
-    EXPECT_TRUE(log_.contains("contains '..' paths, which are invalid"));
     for (auto call : {EnvCall::Readlink, EnvCall::Realpath, EnvCall::Stat, EnvCall::Open})
         EXPECT_EQ(env_->count(call), 0u) << envCallName(call);
 
     const auto b = base();
     const auto r = real(b);
     fs::create_directories(b.string() + "Y");
-    link("../../other", b / "sub" / "out");
-    link("../file", b / "sub" / "up");
-    link("/etc", b / "abs");
-    link("..", b / "sub" / "home");
-    link("..", b / "parent");
-    link("hop", b / "start");
-    link("../../../other", b / "hop");
-    link("sub", b / "alias");
-    link("alias/../file", b / "chain");
-    link("../../../elsewhere", b / "gone");
-    link("gone", b / "dangling");
-    link(std::string(1024, 'a'), b / "long"); // refused, not cut
-    struct Case {
-        fs::path at;
-        std::optional<fs::path> resolved;
-        std::string logged;
-    };
-    const Case cases[] = {
-        {b / "file", r / "file", ""},
-        {b, r, ""},
-        {root_ / "/private/var/other", {}, "does not contain base path"},
+    const std::string longTarget(1024, 'a');
+    const auto under = [](const fs::path& p, const char* rel) { return *rel ? p / rel : p; };
+    // Each row's link, if any, is made just before it is checked; `resolved`
+    // is below the real base, null for a refusal. A message is checked only
+    // where it alone tells which refusal ran.
+    const char* const cases[][4] = {
+        {"file", nullptr, "file", ""},
+        {"", nullptr, "", ""},
+        {"../../../other", nullptr, nullptr, "does not contain base path"},
         // A sibling whose name extends the base's passes the string check only.
-        {b.string() + "Y", {}, "because components diverge at X != XY"},
-        {b / "sub" / "out", {}, "as it is points outside or to the base"},
-        {b / "sub" / "up", r / "file", ""},
-        {b / "abs", {}, "as absolute symlinks are not allowed"},
-        {b / "sub" / "home", r, ""}, // the base itself: not outside
-        {b / "parent", {}, ""},
+        {"../XY", nullptr, nullptr, ""},
+        {"sub/out", "../../other", nullptr, "as it is points outside or to the base"},
+        {"sub/up", "../file", "file", ""},
+        {"abs", "/etc", nullptr, "as absolute symlinks are not allowed"},
+        {"sub/home", "..", "", ""}, // the base itself: not outside
+        {"parent", "..", nullptr, ""},
         // The depth check sees one hop: later hops and parent links are
         // caught by comparing real paths.
-        {b / "start", {}, "Rejecting " + (b / "start").string() + " with base"},
-        {b / "hop" / "x", {}, ""},
-        {b / "chain", r / "file", ""},
-        {b / "alias" / "new", r / "sub" / "new", ""},
+        {"hop", "../../../other", nullptr, ""},
+        {"start", "hop", nullptr, ""},
+        {"hop/x", nullptr, nullptr, ""},
+        {"alias", "sub", "sub", ""},
+        {"chain", "alias/../file", "file", ""},
+        {"alias/new", nullptr, "sub/new", ""},
         // Missing components are appended unresolved, but a dangling link
         // would later be followed to wherever it points.
-        {b / "sub" / "new" / "deeper", r / "sub" / "new" / "deeper", ""},
-        {b / "dangling", {}, ""},
-        {b / "dangling" / "child", {}, ""},
+        {"sub/new/deeper", nullptr, "sub/new/deeper", ""},
+        {"gone", "../../../elsewhere", nullptr, ""},
+        {"dangling", "gone", nullptr, ""},
+        {"dangling/child", nullptr, nullptr, ""},
         // A file where a directory is needed is not "missing".
-        {b / "file" / "x", {}, "Readlink failed: Not a directory"},
-        {b / "long", {}, "Readlink failed: File name too long"},
+        {"file/x", nullptr, nullptr, ""},
+        {"long", longTarget.c_str(), nullptr, "Readlink failed: File name too long"}, // not cut
     };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.at);
+    for (const auto& [rel, link, resolved, logged] : cases) {
+        const auto at = under(b, rel).lexically_normal();
+        SCOPED_TRACE(at);
+        if (link)
+            fs::create_symlink(link, at);
         log_.clear();
-        EXPECT_EQ(check(c.at), c.resolved);
-        if (!c.logged.empty()) {
-            EXPECT_TRUE(log_.contains(c.logged)) << log_.all();
-        }
+        EXPECT_EQ(check(at), resolved ? std::optional(under(r, resolved)) : std::nullopt);
+        EXPECT_TRUE(!*logged || log_.contains(logged)) << log_.all();
     }
 
     env_->failCall(EnvCall::Readlink, 1, EACCES);
     EXPECT_FALSE(check(b / "file"));
-    EXPECT_TRUE(log_.contains("Readlink failed: Permission denied"));
     EXPECT_FALSE(manager_.realPathForURL(b / "none" / "a", b / "none"));
-    EXPECT_TRUE(log_.contains("Failed to retrieve realpath for base path"));
     EXPECT_FALSE(manager_._realPathForURL(b / "file" / "x", true));
-    EXPECT_TRUE(
-        log_.contains("Failed to realpath " + (b / "file" / "x").string() + " : Not a directory"));
 
     // The depth walk fails as soon as it falls below where it started.
     const std::pair<const char*, std::optional<int>> walks[] = {
@@ -98,15 +84,11 @@ TEST_F(ContainmentTest, ResolvesInsideTheBaseAndRefusesEverythingElse) {
 }
 
 TEST_F(ContainmentTest, ThePrivatePrefixIsDroppedBelowTheRoot) {
-    // Without "<root>/var" the base then cannot be resolved.
     const auto deviceStyleBase = root_ / "/var/containers/Data/X";
-    EXPECT_FALSE(manager_.realPathForURL(base() / "a", deviceStyleBase));
-    EXPECT_TRUE(log_.contains("for base path " + deviceStyleBase.string() + " "));
-    link("private/var", root_ / "/var"); // as on the device
+    fs::create_symlink("private/var", root_ / "/var"); // as on the device
     EXPECT_EQ(manager_.realPathForURL(base() / "a", deviceStyleBase), real(base()) / "a");
     EXPECT_EQ(manager_.realPathForURL(deviceStyleBase / "file", base()), real(base() / "file"));
     EXPECT_FALSE(manager_.realPathForURL(base(), "/"));
-    EXPECT_TRUE(log_.contains("because real component counts don't make sense"));
 }
 
 class CreateDirectoryTest : public FsTest {
@@ -164,12 +146,8 @@ TEST_F(CreateDirectoryTest, ExistingDirectoryIsSuccessAndStillGetsClassAndOwner)
 
 TEST_F(CreateDirectoryTest, FailuresCarryTheErrnoAndTheirMessage) {
     const auto noParent = base() / "no" / "leaf";
-    auto missingParent = manager_.createDirectoryAtURL(noParent, false, 0755);
-    EXPECT_TRUE(failedWith(missingParent, ENOENT,
+    EXPECT_TRUE(failedWith(manager_.createDirectoryAtURL(noParent, false, 0755), ENOENT,
                            "mkdir of " + noParent.string() + " failed: No such file or directory"));
-    EXPECT_NE(missingParent.error().function.find("createDirectoryAtURL"), std::string::npos);
-    EXPECT_GT(missingParent.error().line, 0);
-    EXPECT_TRUE(log_.contains("mkdir of " + noParent.string()));
 
     // A file, or a link to a directory, where a level should be: neither
     // form takes it for a directory, and nothing is given owner or class.
