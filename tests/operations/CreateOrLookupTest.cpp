@@ -339,24 +339,9 @@ TEST_F(CreateFailureTest, EachStepFailsWithItsCodeAndParksTheStagingDirectory) {
             }
         }
     }
-    // Nothing of the failures stands in the way of the next creation.
-    EXPECT_EQ(createCode(), kQRNErrorNone);
-}
-
-TEST_F(CreateFailureTest, OldTransientContainerThatCannotBeRemovedStopsTheCreation) {
-    ASSERT_EQ(createCode(true), kQRNErrorNone);
-    const auto before = namesIn(classDirectory(kClass, true));
-    ASSERT_EQ(before.size(), 1u);
-    env_->failCallsFrom(EnvCall::Rename, 1, EIO);
-    EXPECT_EQ(createCode(true), kQRNErrorRemoveTransientFailed);
-    EXPECT_EQ(namesIn(classDirectory(kClass, true)), before);
-    EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
-    EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
-}
-
-TEST_F(CreateFailureTest, CacheThatRefusesTheNewContainerLeavesItInPlace) {
-    // Just before the container moves into place its cache entry is dropped
-    // and the class directory can no longer be listed, so inserting fails.
+    // A cache that refuses the new container leaves it in place: just before
+    // it moves into place its cache entry is dropped and the class directory
+    // can no longer be listed, so inserting fails.
     const std::uint64_t moveIntoPlace = env_->count(EnvCall::Rename) + 2;
     env_->setHook([this, moveIntoPlace](EnvCall call, std::uint64_t number) {
         if (call == EnvCall::Rename && number == moveIntoPlace) {
@@ -368,11 +353,19 @@ TEST_F(CreateFailureTest, CacheThatRefusesTheNewContainerLeavesItInPlace) {
     EXPECT_EQ(namesIn(classDirectory(kClass)).size(), 1u);
     EXPECT_TRUE(namesOnDeathRow().empty());
     EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
-
-    // Once the directory can be read again the container is found there.
     env_->setHook(nullptr);
     env_->clearFailures();
-    EXPECT_EQ(codeOf(*privileged(), kClientBundle, kClass), kQRNErrorNone);
+    EXPECT_EQ(codeOf(*privileged(), kClientBundle, kClass), kQRNErrorNone) << "found once readable";
+
+    // An old transient container that cannot be removed stops the creation.
+    ASSERT_EQ(createCode(true), kQRNErrorNone);
+    const auto before = namesIn(classDirectory(kClass, true));
+    ASSERT_EQ(before.size(), 1u);
+    env_->failCallsFrom(EnvCall::Rename, 1, EIO);
+    EXPECT_EQ(createCode(true), kQRNErrorRemoveTransientFailed);
+    EXPECT_EQ(namesIn(classDirectory(kClass, true)), before);
+    EXPECT_TRUE(namesIn(stagingDirectory(kClass)).empty());
+    EXPECT_EQ(QRNLocks::shared().snapshot().allReaderWriterState, 0);
 }
 
 } // namespace

@@ -94,7 +94,7 @@ protected:
 
 } // namespace
 
-TEST_F(QRNLocksTest, DuplicatesAreLockedAndReleasedOnce) {
+TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrderAndDuplicatesOnce) {
     // A second write lock on "a" by this thread would never be granted.
     locks.write_lock_identifier(ids({"b", "a", "b", "a"}));
     auto s = locks.snapshot();
@@ -117,9 +117,8 @@ TEST_F(QRNLocksTest, DuplicatesAreLockedAndReleasedOnce) {
     EXPECT_EQ(locks.snapshot().records["x"].users, 1u);
     locks.unlock_identifier("x");
     locks.read_lock_identifier(Value::array());
-}
 
-TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrder) {
+    // Arrays are locked in ascending order.
     locks.write_lock_identifier("b");
     Holder h(locks, Kind::Write, ids({"b", "a"}));
     waitUntil("array locker queues on b", [&] { return locks.snapshot().records["b"].users == 2; });
@@ -128,7 +127,6 @@ TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrder) {
     EXPECT_FALSE(h.acquired());
     locks.unlock_identifier("b");
     waitUntil("array locker gets both", [&] { return h.acquired(); });
-    h.release();
 }
 
 TEST_F(QRNLocksTest, HoldsAreMarkedFromLockToUnlock) {
