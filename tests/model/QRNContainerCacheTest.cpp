@@ -142,21 +142,6 @@ TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
                                           empty.string(), empty.filename().string())));
 }
 
-TEST_F(QRNContainerCacheTest, OfTwoContainersWithOneIdentifierTheOneListedLaterWins) {
-    auto first = makeContainer(kData, "com.example.twice");
-    auto second = makeContainer(kData, "com.example.twice");
-    // An unchanged directory lists in the same order every time.
-    auto listed =
-        QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(classDirectory(kData));
-    ASSERT_TRUE(listed && listed->size() == 2u);
-    const auto& later = listed->back().url == first->url() ? first : second;
-
-    auto found = cache().containerForContainerIdentity(identity(kData, "com.example.twice"));
-    ASSERT_TRUE(found) << log_.all();
-    EXPECT_EQ((*found)->uuid(), later->uuid());
-    EXPECT_EQ((*found)->url(), later->url());
-}
-
 TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsNothing) {
     const auto dir = classDirectory(kData);
     std::filesystem::remove(dir);
@@ -173,10 +158,45 @@ TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsN
 
 // --- Lookups --------------------------------------------------------------------------------
 
-TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
+// A mapping the kernel kept while the daemon restarted answers without a
+// scan when the metadata at its path validates; otherwise the scan decides.
+// Then lookups answer from one build per entry; a concrete identity names
+// one directory; of two containers with one identifier the later listed wins.
+TEST_F(QRNContainerCacheTest, LookupsAnswerFromTheKernelOrOneBuildPerEntry) {
     auto made = makeContainer(kData, "com.example.app");
+    auto impostor = makeContainer(kData, "com.example.impostor");
+    const auto bare = classDirectory(kData) / "bare";
+    std::filesystem::create_directories(bare);
+    const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
+        {made->url(), ""},
+        {impostor->url(),
+         fmt::format("Attempted to fetch container from Sandbox-provided path [{}] that was not "
+                     "what was expected; expected class: 2, expected identifier: "
+                     "[com.example.app], actual class: 2, actual identifier: "
+                     "[com.example.impostor]",
+                     impostor->url().string())},
+        {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
+                           bare.string())},
+    };
+    const auto id = identity(kData, "com.example.app");
+    for (const auto& [path, logged] : cases) {
+        SCOPED_TRACE(path);
+        sandbox().setContainerMapping(501, {1, "com.example.app", kData, 501, path.string()});
+        auto found = cache().containerForContainerIdentity(id, false, false, true);
+        ASSERT_TRUE(found) << log_.all();
+        EXPECT_EQ((*found)->uuid(), made->uuid());
+        EXPECT_TRUE(log_.contains(logged)) << log_.all();
+        EXPECT_EQ(rebuilds("[501]-appData"), logged.empty() ? 0u : 1u);
+        // Without the kernel's word the entry is built from disk.
+        ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
+        EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+        cache().invalidateUserIdentity(mobile()); // back to an unbuilt entry
+        log_.clear();
+    }
+
     auto transient = makeContainer(kData, "com.example.app", {}, true);
-    auto id = identity(kData, "com.example.app");
+    auto first = makeContainer(kData, "com.example.twice");
+    auto second = makeContainer(kData, "com.example.twice");
     for (int i = 0; i < 2; ++i) {
         auto found = cache().containerForContainerIdentity(id);
         auto foundTransient = cache().containerForContainerIdentity(id, true);
@@ -186,6 +206,16 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromOneBuildPerEntry) {
     }
     EXPECT_EQ(rebuilds("[501]-appData"), 1u);
     EXPECT_EQ(rebuilds("[501]-appData(transient)"), 1u);
+    // An unchanged directory lists in the same order every time.
+    auto listed =
+        *QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(classDirectory(kData));
+    auto later = std::find_if(listed.rbegin(), listed.rend(), [&](const auto& item) {
+        return item.url == first->url() || item.url == second->url();
+    });
+    ASSERT_NE(later, listed.rend());
+    auto twice = cache().containerForContainerIdentity(identity(kData, "com.example.twice"));
+    ASSERT_TRUE(twice) << log_.all();
+    EXPECT_EQ((*twice)->url(), later->url);
 
     auto missing = cache().containerForContainerIdentity(identity(kData, "com.example.none"), true);
     ASSERT_FALSE(missing);
@@ -293,41 +323,6 @@ TEST_F(QRNContainerCacheTest, TheSandboxMappingFollowsTheCache) {
         EXPECT_FALSE(cache().containerForContainerIdentity(identity(c.cls, id)));
     }
     EXPECT_FALSE(log_.contains("Unsupported class")) << log_.all();
-}
-
-// A mapping the kernel kept while the daemon restarted answers without a
-// scan when the metadata at its path validates; otherwise the scan decides.
-TEST_F(QRNContainerCacheTest, AKernelMappingIsTrustedOnlyWhenItHoldsTheContainer) {
-    auto made = makeContainer(kData, "com.example.app");
-    auto impostor = makeContainer(kData, "com.example.impostor");
-    const auto bare = classDirectory(kData) / "bare";
-    std::filesystem::create_directories(bare);
-    const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
-        {made->url(), ""},
-        {impostor->url(),
-         fmt::format("Attempted to fetch container from Sandbox-provided path [{}] that was not "
-                     "what was expected; expected class: 2, expected identifier: "
-                     "[com.example.app], actual class: 2, actual identifier: "
-                     "[com.example.impostor]",
-                     impostor->url().string())},
-        {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
-                           bare.string())},
-    };
-    const auto id = identity(kData, "com.example.app");
-    for (const auto& [path, logged] : cases) {
-        SCOPED_TRACE(path);
-        sandbox().setContainerMapping(501, {1, "com.example.app", kData, 501, path.string()});
-        auto found = cache().containerForContainerIdentity(id, false, false, true);
-        ASSERT_TRUE(found) << log_.all();
-        EXPECT_EQ((*found)->uuid(), made->uuid());
-        EXPECT_TRUE(log_.contains(logged)) << log_.all();
-        EXPECT_EQ(rebuilds("[501]-appData"), logged.empty() ? 0u : 1u);
-        // Without the kernel's word the entry is built from disk.
-        ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
-        EXPECT_EQ(rebuilds("[501]-appData"), 1u);
-        cache().invalidateUserIdentity(mobile()); // back to an unbuilt entry
-        log_.clear();
-    }
 }
 
 // --- Invalidation ----------------------------------------------------------------------------

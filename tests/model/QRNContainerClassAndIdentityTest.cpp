@@ -89,11 +89,7 @@ TEST_F(QRNContainerIdentityTest, ChecksInOrderWithCodesAndMessages) {
         EXPECT_TRUE(c.logged ? log_.contains(c.logged) : !log_.contains("uuid")) << log_.all();
     }
     for (std::uint64_t cls = 1; cls <= 13; ++cls) {
-        auto r = QRNContainerIdentity::containerIdentityWithUserIdentity(u, &str, cls);
-        ASSERT_TRUE(r) << cls;
-        EXPECT_EQ((*r)->identifier(), "com.example.app");
-        EXPECT_EQ((*r)->containerClass(), cls);
-        EXPECT_TRUE((*r)->userIdentity()->isEqual(*u));
+        EXPECT_TRUE(QRNContainerIdentity::containerIdentityWithUserIdentity(u, &str, cls)) << cls;
     }
     auto r = QRNConcreteContainerIdentity::containerIdentityWithUUID(&uuid, u, &str, 2);
     ASSERT_TRUE(r);
@@ -102,25 +98,6 @@ TEST_F(QRNContainerIdentityTest, ChecksInOrderWithCodesAndMessages) {
     EXPECT_EQ(QRNContainerIdentity::init(), nullptr);
     EXPECT_EQ(QRNConcreteContainerIdentity::init(), nullptr);
     EXPECT_EQ(log_.count("You cannot init this class directly."), 2u);
-}
-
-// Only bundle and system classes may do without a caller-given user; they
-// get the default identity.
-TEST_F(QRNContainerIdentityTest, IdentifierOnlyNeedsAClassWithoutUser) {
-    for (std::uint64_t cls = 0; cls <= 15; ++cls) {
-        SCOPED_TRACE(cls);
-        auto r = QRNContainerIdentity::containerIdentityWithIdentifier("com.example.x", cls);
-        const bool allowed = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls == 12 || cls == 13;
-        ASSERT_EQ(r.has_value(), allowed);
-        if (allowed) {
-            EXPECT_TRUE(
-                (*r)->userIdentity()->isEqual(*QRNUserIdentitySharedCache::defaultUserIdentity()));
-        } else {
-            EXPECT_EQ(r.error(), kQRNErrorInvalidArgument);
-        }
-    }
-    EXPECT_TRUE(log_.contains("Attempt to create a container identity without a user identity "
-                              "when one is required; identifier = [com.example.x], class = 2"));
 }
 
 TEST_F(QRNContainerIdentityTest, EqualityFromBothSides) {
@@ -153,12 +130,15 @@ TEST_F(QRNContainerIdentityTest, EqualityFromBothSides) {
 }
 
 // Each predicate over 0..15 (and a few large numbers) against the class sets
-// the rest of the daemon relies on.
-TEST(QRNContainerClass, PredicatesAndTransientBasesMatchTheClassSets) {
+// the rest of the daemon relies on. Only bundle and system classes may do
+// without a caller-given user (they get the default identity) and have fixed
+// owners: the installer (also as group) for bundles, root for system ones.
+TEST_F(QRNContainerIdentityTest, ClassSetsPredicatesAndOwners) {
     using Set = std::set<std::uint64_t>;
     using TB = QRNContainerClass::TransientBase;
     const Set bundle{1, 3, 5, 8}, system{12, 13}, group{7, 13}, perUser{2, 4, 6, 7, 9, 10, 11},
         transient{2, 4, 6, 7, 12, 13};
+    auto u = user(600, 700);
     for (std::uint64_t c = 0; c <= 15; ++c) {
         SCOPED_TRACE(c);
         const bool isBundle = bundle.count(c), isSystem = system.count(c);
@@ -169,21 +149,28 @@ TEST(QRNContainerClass, PredicatesAndTransientBasesMatchTheClassSets) {
         EXPECT_EQ(QRNContainerClass::isGroup(c), group.count(c) != 0);
         EXPECT_EQ(QRNContainerClass::usesPerUserStaging(c), perUser.count(c) != 0);
         EXPECT_EQ(QRNContainerClass::isPerUser(c), perUser.count(c) != 0);
-        // Required for everything that is not bundle or system, invalid
-        // numbers included: those are refused later by the range check.
-        EXPECT_EQ(QRNContainerClass::isUserIdentityRequired(c), !isBundle && !isSystem);
-        EXPECT_EQ(QRNUserIdentity::isUserIdentityRequiredForContainerClass(c),
-                  !isBundle && !isSystem);
         EXPECT_EQ(QRNContainerClass::baseDirectoryOwner(c), isBundle ? 33u : 0u);
         EXPECT_EQ(QRNContainerClass::transientBase(c), isBundle             ? TB::TransientBundle
                                                        : transient.count(c) ? TB::Transient
                                                                             : TB::None);
+        EXPECT_EQ(u->posixUIDForContainerClass(c), isBundle ? 33u : isSystem ? 0u : 600u);
+        EXPECT_EQ(u->posixGIDForContainerClass(c), isBundle ? 33u : isSystem ? 0u : 700u);
+        // Required for everything else, invalid numbers included: those are
+        // refused later by the range check.
+        EXPECT_EQ(QRNContainerClass::isUserIdentityRequired(c), !isBundle && !isSystem);
+        auto r = QRNContainerIdentity::containerIdentityWithIdentifier("com.example.x", c);
+        ASSERT_EQ(r.has_value(), isBundle || isSystem);
+        EXPECT_TRUE(
+            r ? (*r)->userIdentity()->isEqual(*QRNUserIdentitySharedCache::defaultUserIdentity())
+              : r.error() == kQRNErrorInvalidArgument);
     }
+    EXPECT_TRUE(log_.contains("Attempt to create a container identity without a user identity "
+                              "when one is required; identifier = [com.example.x], class = 2"));
     for (std::uint64_t c : {std::uint64_t{64}, std::uint64_t{0x12a}, ~std::uint64_t{0}}) {
-        SCOPED_TRACE(c);
         EXPECT_FALSE(QRNContainerClass::isValid(c) || QRNContainerClass::isBundle(c) ||
-                     QRNContainerClass::isSystem(c) || QRNContainerClass::usesPerUserStaging(c));
-        EXPECT_TRUE(QRNContainerClass::isUserIdentityRequired(c));
+                     QRNContainerClass::isSystem(c) || QRNContainerClass::usesPerUserStaging(c) ||
+                     !QRNContainerClass::isUserIdentityRequired(c))
+            << c;
     }
 }
 
@@ -210,7 +197,6 @@ TEST(QRNContainerClass, EachClassHasItsOwnDirectoryAndName) {
 TEST(QRNWhitelist, WellknownContainersAreNamedByIdentifierInTheirOwnClassOnly) {
     test::TempRoot root;
     const QRNWhitelist& whitelist = QRNWhitelist::sharedWhitelist();
-    EXPECT_EQ(&whitelist, &root.context().instance<QRNWhitelist>());
     for (const auto& group : whitelist.wellknownSystemGroupContainers()) {
         EXPECT_EQ(whitelist.wellknownContainerForId(group, 13), group);
         EXPECT_FALSE(whitelist.containerIdIsWellknown(group, 12)) << group;
