@@ -6,13 +6,11 @@
 #include "Daemon/fs/FaultInjectingEnv.h"
 #include "Daemon/fs/LinuxEnv.h"
 #include "Daemon/model/QRNContainerCache.h"
-#include "Daemon/model/QRNContainerIdentity.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNMetadata.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/operations/QRNClientIdentity.h"
-#include "Daemon/support/Queue.h"
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
@@ -25,20 +23,10 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <memory>
-#include <optional>
-#include <string>
-#include <vector>
 
 namespace quarn::test {
 
 inline constexpr const char* kClientBundle = "com.example.client";
-
-struct Rights {
-    bool otherIds = false;
-    bool unrestricted = false;
-    std::optional<Value> lookup = std::nullopt;
-};
 
 class CreateFixture : public ::testing::Test {
 protected:
@@ -64,16 +52,17 @@ protected:
     }
 
     std::shared_ptr<QRNClientConnection> connectionFor(const std::string& bundle,
-                                                       Rights rights = {}) {
+                                                       bool otherIds = false,
+                                                       std::optional<Value> lookup = {},
+                                                       bool unrestricted = false) {
         auto client = QRNClientIdentity::initWithBundleIdentifier(
             bundle, kMobileUID, kMobileUID, 4242, user(), Value::dictionary(), false,
             QRNClientIdentity::AuditToken{}, false);
-        return std::make_shared<QRNClientConnection>(client, rights.unrestricted, rights.otherIds,
-                                                     rights.unrestricted, rights.lookup,
-                                                     std::nullopt, nullptr);
+        return std::make_shared<QRNClientConnection>(client, unrestricted, otherIds, unrestricted,
+                                                     lookup, std::nullopt, nullptr);
     }
     std::shared_ptr<QRNClientConnection> privileged() {
-        return connectionFor(kClientBundle, {.unrestricted = true});
+        return connectionFor(kClientBundle, false, {}, true);
     }
     static QRNClientConnection& shared() { return QRNClientConnection::sharedClientConnection(); }
     static QRNGlobalConfiguration& configuration() {

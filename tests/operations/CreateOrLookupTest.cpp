@@ -210,7 +210,7 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
                         plugin = kQRNContainerClassPluginData;
     const std::uint64_t found = kQRNErrorContainerNotFound, refused = kQRNErrorNotEntitled;
     auto lookingUp = [&](const char* client, const char* shortName, Value granted) {
-        return connectionFor(client, {.lookup = dictionaryOf({{shortName, std::move(granted)}})});
+        return connectionFor(client, false, dictionaryOf({{shortName, std::move(granted)}}));
     };
     auto none = connectionFor(kClientBundle);
     // A refusal comes before any disk access.
@@ -241,8 +241,7 @@ TEST_F(CreateOrLookupTest, EachRightAndLookupGrantAdmitsOnItsOwn) {
         std::uint64_t code;
     } cases[] = {
         {"no right", none, "com.other.app", app, refused},
-        {"other ids", connectionFor(kClientBundle, {.otherIds = true}), "com.other.app", app,
-         found},
+        {"other ids", connectionFor(kClientBundle, true), "com.other.app", app, found},
         {"unrestricted", privileged(), "com.other.app", app, found},
         {"other ids set later", widened, "com.other.app", app, found},
         {"group right, app group", groups, "group.other", group, found},
