@@ -139,10 +139,22 @@ TEST_F(QRNContainerIdentityTest, ClassSetsPredicatesAndOwners) {
     const Set bundle{1, 3, 5, 8}, system{12, 13}, group{7, 13}, perUser{2, 4, 6, 7, 9, 10, 11},
         transient{2, 4, 6, 7, 12, 13};
     auto u = user(600, 700);
+    std::set<std::string> seenDirs, seenNames;
     for (std::uint64_t c = 0; c <= 15; ++c) {
         SCOPED_TRACE(c);
         const bool isBundle = bundle.count(c), isSystem = system.count(c);
         EXPECT_EQ(QRNContainerClass::isValid(c), c >= 1 && c <= 13);
+        // Each valid class its own directory (two components, appended to a
+        // base, the first saying what kind of class it is) and name.
+        if (c >= 1 && c <= 13) {
+            const std::filesystem::path dir(QRNContainerClass::relativeDirectory(c));
+            EXPECT_TRUE(seenDirs.insert(dir.string()).second);
+            EXPECT_TRUE(seenNames.insert(std::string(QRNContainerClass::shortName(c))).second);
+            EXPECT_EQ(std::distance(dir.begin(), dir.end()), 2);
+            EXPECT_EQ(dir.begin()->string(), isBundle         ? "Bundle"
+                                             : group.count(c) ? "Shared"
+                                                              : "Data");
+        }
         EXPECT_EQ(QRNContainerClass::isBundle(c), isBundle);
         EXPECT_EQ(QRNContainerClass::isSystem(c), isSystem);
         EXPECT_EQ(QRNContainerClass::isGlobal(c), isBundle || isSystem);
@@ -166,30 +178,13 @@ TEST_F(QRNContainerIdentityTest, ClassSetsPredicatesAndOwners) {
     }
     EXPECT_TRUE(log_.contains("Attempt to create a container identity without a user identity "
                               "when one is required; identifier = [com.example.x], class = 2"));
+    EXPECT_EQ(QRNContainerClass::relativeDirectory(15), "");
+    EXPECT_EQ(QRNContainerClass::shortName(14), "");
     for (std::uint64_t c : {std::uint64_t{64}, std::uint64_t{0x12a}, ~std::uint64_t{0}}) {
         EXPECT_FALSE(QRNContainerClass::isValid(c) || QRNContainerClass::isBundle(c) ||
                      QRNContainerClass::isSystem(c) || QRNContainerClass::usesPerUserStaging(c) ||
                      !QRNContainerClass::isUserIdentityRequired(c))
             << c;
-    }
-}
-
-// Every valid class has its own two-component directory (the layout appends
-// it to a base) whose first part says what kind of class it is; nothing past
-// the end marker has one.
-TEST(QRNContainerClass, EachClassHasItsOwnDirectoryAndName) {
-    EXPECT_EQ(QRNContainerClass::relativeDirectory(15), "");
-    EXPECT_EQ(QRNContainerClass::shortName(14), "");
-    std::set<std::string> seenDirs, seenNames;
-    for (std::uint64_t c = 1; c <= 13; ++c) {
-        SCOPED_TRACE(c);
-        std::filesystem::path dir(QRNContainerClass::relativeDirectory(c));
-        EXPECT_EQ(std::distance(dir.begin(), dir.end()), 2);
-        EXPECT_TRUE(seenDirs.insert(dir.string()).second);
-        EXPECT_TRUE(seenNames.insert(std::string(QRNContainerClass::shortName(c))).second);
-        EXPECT_EQ(dir.begin()->string(), QRNContainerClass::isBundle(c)  ? "Bundle"
-                                         : QRNContainerClass::isGroup(c) ? "Shared"
-                                                                         : "Data");
     }
 }
 
