@@ -4,12 +4,9 @@
 namespace quarn::test {
 namespace {
 
-bool isOpen(int fd) {
-    return ::fcntl(fd, F_GETFD) != -1;
-}
-
 class EnvTest : public TempRootTest {
 protected:
+    static bool isOpen(int fd) { return ::fcntl(fd, F_GETFD) != -1; }
     LinuxEnv linux_;
 };
 

@@ -30,24 +30,19 @@ protected:
     fs::path container() { return root_ / "/private/var/containers/Data/System/C1"; }
 };
 
-TEST_F(ACLTest, TopLevelGrantsAddingOnlyAndPassesFullRightsDown) {
+TEST_F(ACLTest, TopLevelGrantsAddingOnlyAndTheTreeBelowGetsFullRights) {
     // Applying twice replaces rather than accumulates.
-    for (int i = 0; i < 2; ++i) {
+    for (int i = 0; i < 2; ++i)
         ASSERT_TRUE(manager_.setTopLevelSystemContainerACLAtURL(container()));
-        EXPECT_EQ(aclText(container()), kTopAccess);
-    }
+    EXPECT_EQ(aclText(container()), kTopAccess);
     EXPECT_EQ(aclText(container(), ACL_TYPE_DEFAULT), "u::rwx,g::r-x,g:1501:rwx,m::rwx,o::r-x");
-    EXPECT_EQ(lstatOf(container()).st_uid, 0u);
     // A new item inherits.
     fs::create_directory(container() / "Documents");
     EXPECT_NE(aclText(container() / "Documents").find("g:1501:rwx"), std::string::npos);
-}
 
-TEST_F(ACLTest, SystemContainerTreeIsStandardized) {
     ASSERT_TRUE(manager_.standardizeACLsForSystemContainerAtURL(container()));
     EXPECT_EQ(aclText(container()), kTopAccess);
     EXPECT_EQ(lstatOf(container()).st_uid, 0u);
-
     for (auto dir : {"Library", "Library/Caches"})
         EXPECT_EQ(aclText(container() / dir, ACL_TYPE_DEFAULT), kFullBelowTop) << dir;
     // Only the mask shows in the mode.
@@ -61,12 +56,13 @@ TEST_F(ACLTest, SystemContainerTreeIsStandardized) {
         EXPECT_EQ(aclText(item), "u::rw-,g::---,o::---") << item;
         EXPECT_EQ(describe(item), "600 0:0 -") << item;
     }
-}
 
-TEST_F(ACLTest, OrdinaryTreeGetsTheDirectoryListAtItsTopToo) {
-    ASSERT_TRUE(manager_.standardizeACLsAtURL(container(), false));
-    EXPECT_EQ(aclText(container()), kFullBelowTop);
-    EXPECT_EQ(lstatOf(container()).st_uid, 65534u);
+    // An ordinary tree gets the full list at its top too.
+    const auto plain = root_ / "/plain";
+    fs::create_directory(plain);
+    ASSERT_TRUE(manager_.standardizeACLsAtURL(plain, false));
+    EXPECT_EQ(aclText(plain), kFullBelowTop);
+    EXPECT_EQ(lstatOf(plain).st_uid, 65534u);
 }
 
 TEST_F(ACLTest, AllSystemContainersOfADirectoryAndAMissingGroup) {
@@ -162,69 +158,51 @@ TEST_F(OwnershipTest, OwnerAndModeAreForcedOverTheTreeChowningOnlyWhatDiffers) {
         manager_.standardizeOwnershipAtURL(tree() / "missing", kMobileUID, kMobileUID), ENOENT));
 }
 
-class ProtectionTest : public FsTest {
-protected:
-    void SetUp() override {
-        fs::create_directories(dir());
-        writeFile(file(), "data");
+TEST_F(FsTest, ProtectionClassesAreOnlyOnFilesAndDirectoriesAndClassOneHoldsWhileLocked) {
+    const auto dir = root_ / "/private/var/containers/Data/A", file = dir / "file";
+    const auto classOf = [&](const fs::path& p) {
+        return *manager_.dataProtectionClassOfItemAtURL(p);
+    };
+    fs::create_directories(dir);
+    writeFile(file, "data");
+    fs::create_symlink(file, dir / "link");
+    ::mkfifo((dir / "fifo").c_str(), 0600);
+    ASSERT_EQ(::mknod((dir / "sock").c_str(), S_IFSOCK | 0600, 0), 0);
+    for (auto item : {dir / "link", dir / "fifo", dir / "sock"}) {
+        EXPECT_TRUE(failedWith(manager_.dataProtectionClassOfItemAtURL(item), EBADF)) << item;
+        EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(item, 2), EBADF)) << item;
     }
-    fs::path dir() { return root_ / "/private/var/containers/Data/A"; }
-    fs::path file() { return dir() / "file"; }
-    int classOf(const fs::path& p) { return *manager_.dataProtectionClassOfItemAtURL(p); }
-};
+    EXPECT_EQ(classOf(file), 0) << "none set, the link's target not touched";
+    EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(dir / "missing", 2), ENOENT));
 
-TEST_F(ProtectionTest, ClassesRoundTripAndThePredicateCanDecline) {
-    EXPECT_EQ(classOf(file()), 0) << "no class set";
-    for (auto item : {dir(), file()}) {
+    for (auto item : {dir, file}) {
         ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(item, 2));
         EXPECT_EQ(classOf(item), 2);
         EXPECT_EQ(xattrOf(item), "2");
     }
     int seen = -1;
-    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file(), 4, [&](int current) {
+    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file, 4, [&](int current) {
         seen = current;
         return false;
     }));
     EXPECT_EQ(seen, 2);
-    EXPECT_EQ(classOf(file()), 2) << "declined: nothing changed";
+    EXPECT_EQ(classOf(file), 2) << "declined: nothing changed";
     ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(
-        file(), 4, [](int current) { return current < 4; }));
-    EXPECT_EQ(classOf(file()), 4);
-}
+        file, 1, [](int current) { return current < 4; }));
+    EXPECT_EQ(classOf(file), 1);
 
-TEST_F(ProtectionTest, ItemsThatCannotHoldAClassAnswerEBADF) {
-    fs::create_symlink(file(), dir() / "link");
-    ::mkfifo((dir() / "fifo").c_str(), 0600);
-    ASSERT_EQ(::mknod((dir() / "sock").c_str(), S_IFSOCK | 0600, 0), 0);
-
-    for (auto item : {dir() / "link", dir() / "fifo", dir() / "sock"}) {
-        EXPECT_TRUE(failedWith(manager_.dataProtectionClassOfItemAtURL(item), EBADF)) << item;
-        EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(item, 2), EBADF)) << item;
-    }
-    EXPECT_EQ(classOf(file()), 0) << "the link's target was not touched";
-
-    EXPECT_TRUE(
-        failedWith(manager_.setDataProtectionClassOfItemAtURL(dir() / "missing", 2), ENOENT));
-}
-
-TEST_F(ProtectionTest, ClassOneItemsCannotChangeWhileLocked) {
-    auto other = dir() / "other";
-    writeFile(other, "x");
-    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file(), 1));
-    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(other, 2));
+    // While the device is locked a class-one item keeps its class; others change.
     auto run = Paths(root_.path()).runDirectory();
     fs::create_directories(run);
-
     writeFile(run / "lockstate", "1");
-    EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(file(), 3), EPERM));
-    EXPECT_EQ(classOf(file()), 1);
-    EXPECT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file(), 1)) << "not a change";
-    EXPECT_TRUE(manager_.setDataProtectionClassOfItemAtURL(other, 3)) << "other classes can";
-    EXPECT_EQ(classOf(other), 3);
-
+    EXPECT_TRUE(failedWith(manager_.setDataProtectionClassOfItemAtURL(file, 3), EPERM));
+    EXPECT_EQ(classOf(file), 1);
+    EXPECT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file, 1)) << "not a change";
+    EXPECT_TRUE(manager_.setDataProtectionClassOfItemAtURL(dir, 3));
+    EXPECT_EQ(classOf(dir), 3);
     writeFile(run / "lockstate", "0");
-    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file(), 3));
-    EXPECT_EQ(classOf(file()), 3);
+    ASSERT_TRUE(manager_.setDataProtectionClassOfItemAtURL(file, 3));
+    EXPECT_EQ(classOf(file), 3);
 }
 
 } // namespace

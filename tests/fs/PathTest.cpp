@@ -242,7 +242,7 @@ TEST_F(FsTest, TemporaryDirectoriesAreUniqueAndPrivateInTheDirectory) {
     EXPECT_TRUE(failedWith(manager_.createTemporaryDirectoryInDirectoryURL(in, "../x"), EINVAL));
 }
 
-TEST_F(FsTest, HomeDirectoryIsTheRealPathOfTheAccountsHomeOrMobiles) {
+TEST_F(FsTest, HomeDirectoryIsTheRealPathOfTheAccountsHomeOrMobilesAndExistenceIsOfLinks) {
     // A home reached through a link resolves to where it really is.
     fs::create_directories(root_ / "/data/real-home");
     fs::create_directory_symlink(root_ / "/data/real-home", root_ / "/private/var/linked");
@@ -254,11 +254,9 @@ TEST_F(FsTest, HomeDirectoryIsTheRealPathOfTheAccountsHomeOrMobiles) {
     // Unknown users and missing homes fall back to mobile's.
     for (uid_t uid : {601u, 4242u})
         EXPECT_EQ(QRNFileManager::homeDirectoryURLForPOSIXUID(uid), root_ / "/private/var/mobile");
-}
 
-TEST_F(FsTest, ExistenceDoesNotFollowLinks) {
-    auto dir = root_ / "/private/var/containers";
-    fs::create_directories(dir);
+    // Existence does not follow links.
+    auto dir = root_ / "/private/var";
     fs::create_symlink(dir / "gone", dir / "dangling");
     EXPECT_TRUE(manager_.itemExistsAtURL(dir / "dangling"));
     EXPECT_FALSE(manager_.itemDoesNotExistAtURL(dir / "dangling"));

@@ -71,8 +71,6 @@ TEST_F(RemoveTest, ImmutableEntriesHaveTheFlagClearedAndAreRemoved) {
         setImmutable(top / frozen, false); // let the fixture clean up if it failed
     ASSERT_TRUE(removed) << removed.error().description() << "\n" << log_.all();
     EXPECT_FALSE(existsNoFollow(top));
-    for (auto frozen : {"f1", "frozenEmpty"})
-        EXPECT_TRUE(log_.contains("Unset the immutable flag on " + (top / frozen).string()));
     auto messages = log_.messages();
     EXPECT_EQ(std::count(messages.begin(), messages.end(),
                          "Unset the immutable flag on " + (top / "frozen").string()),
@@ -183,13 +181,6 @@ protected:
     std::string data_;
 };
 
-TEST_F(MoveCopyTest, CopyCarriesDataAndEveryKindOfMetadata) {
-    auto src = makeRichTree();
-    ASSERT_TRUE(manager_.copyItemAtURL(src, dir() / "dst"));
-    expectRichTree(dir() / "dst");
-    expectRichTree(src); // the source is untouched
-}
-
 TEST_F(MoveCopyTest, MoveIsARenameOrACopyAcrossDevicesThatSucceedsEvenWhenTheSourceStays) {
     auto src = makeRichTree();
     auto inode = lstatOf(src / "data").st_ino;
@@ -231,13 +222,25 @@ TEST_F(MoveCopyTest, MissingSourcesAndTheirMessages) {
                            "stat of [" + missing.string() + "] failed: Input/output error"));
 }
 
-TEST_F(MoveCopyTest, CopyNeverOverwritesOrFollowsAtTheDestination) {
+TEST_F(MoveCopyTest, CopyCarriesEverythingNeverOverwritesOrFollowsAndRemovesWhatAFailureMade) {
     auto src = makeRichTree();
+    // Data is cloned, or copied by copy_file_range, or read and written:
+    // make all three fail on the second file.
+    env_->failCallsFrom(EnvCall::Clone, 2, EIO);
+    env_->failCallsFrom(EnvCall::CopyRange, 2, EIO);
+    env_->failCallsFrom(EnvCall::Write, 2, EIO);
+    env_->failCall(EnvCall::SetXattr, 3, ENOSPC);
+    ASSERT_FALSE(manager_.copyItemAtURL(src, dir() / "dst"));
+    EXPECT_FALSE(existsNoFollow(dir() / "dst"));
+    env_->clearFailures();
+    ASSERT_TRUE(manager_.copyItemAtURL(src, dir() / "dst"));
+    expectRichTree(dir() / "dst");
+    expectRichTree(src); // the source is untouched
+
     fs::create_directories(dir() / "existing");
     writeFile(dir() / "existing" / "keep", "keep");
     EXPECT_TRUE(failedWith(manager_.copyItemAtURL(src, dir() / "existing"), EEXIST));
     EXPECT_EQ(readFile(dir() / "existing" / "keep"), "keep");
-
     // A link at the destination name is not written through.
     fs::create_directories(dir() / "elsewhere");
     fs::create_directory_symlink(dir() / "elsewhere", dir() / "linkdst");
@@ -250,19 +253,6 @@ TEST_F(MoveCopyTest, CopyNeverOverwritesOrFollowsAtTheDestination) {
     ASSERT_TRUE(manager_.copyItemAtURL(src, src / "sub" / "copy"));
     EXPECT_EQ(readFile(src / "sub" / "copy" / "sub" / "small"), "small");
     EXPECT_FALSE(existsNoFollow(src / "sub" / "copy" / "sub" / "copy"));
-}
-
-TEST_F(MoveCopyTest, FailedCopyRemovesWhatItMade) {
-    auto src = makeRichTree();
-    // Data is cloned, or copied by copy_file_range, or read and written:
-    // make all three fail on the second file.
-    env_->failCallsFrom(EnvCall::Clone, 2, EIO);
-    env_->failCallsFrom(EnvCall::CopyRange, 2, EIO);
-    env_->failCallsFrom(EnvCall::Write, 2, EIO);
-    env_->failCall(EnvCall::SetXattr, 3, ENOSPC);
-    ASSERT_FALSE(manager_.copyItemAtURL(src, dir() / "dst"));
-    EXPECT_FALSE(existsNoFollow(dir() / "dst"));
-    EXPECT_TRUE(existsNoFollow(src / "sub" / "small"));
 }
 
 TEST_F(MoveCopyTest, TreesDeeperThanAPathCanBeAreCopiedWalkedAndRemoved) {
