@@ -64,14 +64,13 @@ protected:
     }
     // Runs a boot cleanup to its end: the completion, then every queued
     // block; `check` runs inside the completion. Answers the completion count.
-    static int runCleanup(bool firstBoot, std::function<void()> check = {}) {
+    static int runCleanup(
+        bool firstBoot, std::function<void()> check = [] {}) {
         std::atomic<int> calls{0};
         std::promise<void> done;
         auto completion = [&] {
             if (++calls == 1) {
-                if (check) {
-                    check();
-                }
+                check();
                 done.set_value();
             }
         };

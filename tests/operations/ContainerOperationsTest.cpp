@@ -260,11 +260,11 @@ TEST_F(ContainerOperationsTest, StagedContainersGoToDeathRowAndLeaveTheCacheVani
     EXPECT_EQ(stage({permanent->containerIdentity()}), kQRNErrorNone);
     EXPECT_FALSE(log.contains("Skipping removal of code sign mapping"));
     EXPECT_FALSE(fs::exists(permanent->url()));
-}
 
-TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIdentities) {
-    QRNMetadataPtr c = create("com.example.c", kClass);
-    ASSERT_TRUE(create("com.example.a", kClass) && create("com.example.b", kClass) && c);
+    // A failing cache removal stops the command before later identities,
+    // and the commands behind it stay queued.
+    QRNMetadataPtr later = create("com.example.c", kClass);
+    ASSERT_TRUE(create("com.example.a", kClass) && create("com.example.b", kClass) && later);
     std::vector<std::uint64_t> reported;
     queue_->insertCommand(std::make_shared<FailingRemoval>(
         std::vector{identity("com.example.a", kClass), identity("com.example.b", kClass),
@@ -276,10 +276,10 @@ TEST_F(ContainerOperationsTest, FailingCacheRemovalStopsTheCommandBeforeLaterIde
     EXPECT_EQ(error, kQRNErrorCacheRemoveFailed);
     EXPECT_EQ(reported, std::vector<std::uint64_t>{kQRNErrorCacheRemoveFailed});
     EXPECT_TRUE(ran_.empty());
-    EXPECT_EQ(queue_->count(), 1u) << "the commands behind the failed one stay queued";
+    EXPECT_EQ(queue_->count(), 1u);
     EXPECT_FALSE(cached(identity("com.example.a", kClass)));
     EXPECT_TRUE(cached(identity("com.example.c", kClass)));
-    EXPECT_TRUE(fs::exists(c->url() / QRNMetadata::kFileName)) << "later identities untouched";
+    EXPECT_TRUE(fs::exists(later->url() / QRNMetadata::kFileName)) << "later identities untouched";
 }
 
 } // namespace
