@@ -1,5 +1,7 @@
+#include "Daemon/support/Descriptor.h"
 #include "Daemon/support/PropertyList.h"
 #include "Daemon/support/ProtectionClassAttribute.h"
+#include "common/TempRoot.h"
 
 #include <gtest/gtest.h>
 
@@ -9,6 +11,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <deque>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -92,20 +95,17 @@ TEST(PropertyList, EveryTypeRoundTripsThroughTheBinaryForm) {
     Value back = valueFromPropertyListBytes(*bytes).value_or(Value());
     // Integers compare by value: signedness must survive, not just the bits.
     EXPECT_EQ(back, expected) << back.description();
-}
 
-TEST(PropertyList, IntegersUseTheFormatsSignedAndUnsignedEncodings) {
     // Other readers take an 8-byte integer as signed and a 16-byte one as
     // unsigned: check the encoding itself (the object after the header).
-    auto object = [](const Value& v, std::size_t size) {
-        auto bytes = *binaryPropertyList(v);
-        return Bytes(bytes.begin() + 8, bytes.begin() + 8 + size);
-    };
     Bytes minusOne = {0x13}, max = {0x14, 0, 0, 0, 0, 0, 0, 0, 0};
     minusOne.resize(9, 0xFF);
     max.resize(17, 0xFF);
-    EXPECT_EQ(object(Value(-1), 9), minusOne);
-    EXPECT_EQ(object(Value(UINT64_MAX), 17), max);
+    for (const auto& [value, encoded] :
+         {std::pair{Value(-1), minusOne}, {Value(UINT64_MAX), max}}) {
+        auto bytes = *binaryPropertyList(value);
+        EXPECT_EQ(Bytes(bytes.begin() + 8, bytes.begin() + 8 + encoded.size()), encoded);
+    }
 }
 
 TEST(PropertyList, ReadsXML) {
@@ -194,22 +194,12 @@ TEST(PropertyList, RefusesHostileBytesWithTheReason) {
 namespace {
 
 // A scratch directory, and the descriptors a test opened in it.
-class FileTest : public ::testing::Test {
+class FileTest : public quarn::test::TempRootTest {
 protected:
-    void SetUp() override {
-        std::string tmpl = (fs::temp_directory_path() / "quarn-support.XXXXXX").string();
-        ASSERT_NE(mkdtemp(tmpl.data()), nullptr);
-        dir_ = tmpl;
-    }
-    void TearDown() override {
-        for (int fd : fds_)
-            close(fd);
-        fs::remove_all(dir_);
-    }
+    void SetUp() override { fs::create_directory(dir_); }
     int open(const fs::path& p, int flags = O_RDWR | O_CREAT) {
-        int fd = ::open(p.c_str(), flags | O_CLOEXEC, 0600);
+        int fd = fds_.emplace_back(::open(p.c_str(), flags | O_CLOEXEC, 0600)).get();
         EXPECT_GE(fd, 0) << p;
-        fds_.push_back(fd);
         return fd;
     }
     // The class, or minus the error.
@@ -228,14 +218,14 @@ protected:
         std::ofstream(p, std::ios::binary) << text;
     }
 
-    fs::path dir_;
-    std::vector<int> fds_;
+    const fs::path dir_ = root_ / "/scratch";
+    std::deque<Descriptor> fds_;
     Value dict_ = Value::Dictionary{{"QRNMetadataVersion", "2"}, {"Class", 2u}};
 };
 
 } // namespace
 
-TEST_F(FileTest, PropertyListWritesReplaceTheFileAndLeaveNothingBehind) {
+TEST_F(FileTest, PropertyListWritesReplaceTheFileOrLeaveItAloneAndNothingBehind) {
     // Each over an older, longer file (in place: truncated); a class only when asked.
     const std::tuple<const char*, WriteOptions, int> writes[] = {
         {"atomic", {.atomic = true, .lowestProtection = true, .fsync = true}, P::kLowestClass},
@@ -250,9 +240,8 @@ TEST_F(FileTest, PropertyListWritesReplaceTheFileAndLeaveNothingBehind) {
         EXPECT_EQ(QRN_dictionaryWithContentsOfURL(dir_ / name).value_or(Value()), dict_);
     }
     EXPECT_EQ(entryCount(), 3) << "a staging file was left";
-}
 
-TEST_F(FileTest, PropertyListFailedWritesLeaveTheOldFileAlone) {
+    // Failed writes leave the old file alone.
     fs::path file = dir_ / "keep.plist";
     write(file, "old");
     Value unwritable = Value::Dictionary{{"bad", std::string("a\0b", 3)}};
@@ -272,7 +261,7 @@ TEST_F(FileTest, PropertyListFailedWritesLeaveTheOldFileAlone) {
     auto r = QRN_writeToURL(dict_, dir_ / "occupied", {.atomic = true});
     ASSERT_FALSE(r);
     EXPECT_EQ(r.error().domain, Error::Domain::POSIX);
-    EXPECT_EQ(entryCount(), 2) << "a staging file was left";
+    EXPECT_EQ(entryCount(), 5) << "a staging file was left";
 }
 
 // The Value reader and the tree reader refuse the same files with the same
@@ -324,7 +313,7 @@ TEST_F(FileTest, PropertyListReadingReportsWhatIsWrong) {
     }
 }
 
-TEST_F(FileTest, ProtectionClassRoundTripsOnFilesAndDirectoriesInTheRightNamespace) {
+TEST_F(FileTest, ProtectionClassRoundTripsOnlyOnFilesAndDirectoriesInTheRightNamespace) {
     ASSERT_EQ(geteuid(), 0u) << "these tests run as root";
     fs::create_directory(dir_ / "d");
     for (int fd : {open(dir_ / "f"), open(dir_ / "d", O_RDONLY | O_DIRECTORY)}) {
@@ -344,9 +333,8 @@ TEST_F(FileTest, ProtectionClassRoundTripsOnFilesAndDirectoriesInTheRightNamespa
     std::string name = P::attributeName();
     ASSERT_EQ(seteuid(0), 0);
     EXPECT_EQ(name, "user.quarn.protection_class");
-}
 
-TEST_F(FileTest, ProtectionClassRefusesItemsThatCannotHoldOneBadClassesAndCorruptValues) {
+    // Items that cannot hold a class, bad classes and corrupt stored values are refused.
     open(dir_ / "target");
     fs::create_symlink(dir_ / "target", dir_ / "link");
     ASSERT_EQ(mkfifo((dir_ / "fifo").c_str(), 0600), 0);
