@@ -3,58 +3,17 @@
 // identity, entitlements as booleans, the lookup entitlement per class and
 // the protection class asked for.
 
-#include "Daemon/model/QRNUserIdentitySharedCache.h"
-#include "Daemon/operations/QRNClientIdentity.h"
+#include "CreateFixture.h"
+
 #include "Daemon/protection/QRNDataProtectionManager.h"
-#include "Daemon/support/PropertyList.h"
-
-#include "common/TempRoot.h"
-#include "common/shared/RequestValues.h"
-
-#include <gtest/gtest.h>
-
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 using namespace quarn;
 using namespace quarn::test;
 
 namespace {
 
-// A forked copy of this process, alive until the object goes: the same
-// executable, another audit token.
-struct ChildProcess {
-    ChildProcess() {
-        if (pid == 0) {
-            ::pause();
-            ::_exit(0);
-        }
-    }
-    ~ChildProcess() {
-        if (pid > 0) {
-            ::kill(pid, SIGKILL);
-            ::waitpid(pid, nullptr, 0);
-        }
-    }
-    const pid_t pid = ::fork();
-};
-
-class ClientIdentityTest : public TempRootTest {
+class ClientIdentityTest : public CreateFixture {
 protected:
-    void registerSelf(const std::string& identifier, std::optional<Value> entitlements,
-                      bool sandboxed = false) {
-        Value plist = dictionaryOf(
-            {{"Program", Value(std::filesystem::read_symlink("/proc/self/exe").string())},
-             {"Identifier", Value(identifier)},
-             {"Sandboxed", Value(sandboxed)}});
-        if (entitlements) {
-            plist.set("Entitlements", *entitlements);
-        }
-        const auto directory = root_ / "/etc/quarnd/codesign.d";
-        std::filesystem::create_directories(directory);
-        ASSERT_TRUE(QRN_writeToURL(plist, directory / "self.plist", {.atomic = true}));
-    }
     static QRNClientIdentityPtr identityOf(pid_t pid) {
         auto peer = IpcPeer::fromPID(pid);
         EXPECT_TRUE(peer);
@@ -62,9 +21,8 @@ protected:
     }
     static QRNClientIdentityPtr client(Value entitlements) {
         return QRNClientIdentity::initWithBundleIdentifier(
-            "com.example.client", kMobileUID, kMobileUID, 77,
-            QRNUserIdentitySharedCache::sharedCache().defaultUserIdentity(),
-            std::move(entitlements), true, QRNClientIdentity::AuditToken{}, false);
+            kClientBundle, kMobileUID, kMobileUID, 77, user(), std::move(entitlements), true,
+            QRNClientIdentity::AuditToken{}, false);
     }
 };
 
@@ -98,11 +56,11 @@ TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntryAndOnlyTheInstallers
     auto first = identityOf(::getpid());
     ASSERT_TRUE(first);
     EXPECT_EQ(identityOf(::getpid()), first);
-    ChildProcess child;
-    auto childIdentity = identityOf(child.pid);
+    ForkedChild child;
+    auto childIdentity = identityOf(child.pid());
     ASSERT_TRUE(childIdentity);
-    EXPECT_EQ(childIdentity->posixPID(), child.pid);
-    EXPECT_EQ(identityOf(child.pid), childIdentity);
+    EXPECT_EQ(childIdentity->posixPID(), child.pid());
+    EXPECT_EQ(identityOf(child.pid()), childIdentity);
     EXPECT_NE(identityOf(::getpid()), first);
 }
 

@@ -11,6 +11,7 @@
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/operations/QRNClientConnection.h"
 #include "Daemon/operations/QRNClientIdentity.h"
+#include "Daemon/support/PropertyList.h"
 
 #include "common/LogCapture.h"
 #include "common/TempRoot.h"
@@ -18,15 +19,61 @@
 
 #include <gtest/gtest.h>
 
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 namespace quarn::test {
 
 inline constexpr const char* kClientBundle = "com.example.client";
+
+// A fork of this process (same executable, another audit token) that execs
+// `sleep` when told, and is killed when reaped.
+class ForkedChild {
+public:
+    static constexpr const char* kSleep = "/usr/bin/sleep";
+    ForkedChild() {
+        EXPECT_EQ(::pipe(pipe_), 0);
+        if ((pid_ = ::fork()) == 0) {
+            ::close(pipe_[1]);
+            char byte = 0;
+            if (::read(pipe_[0], &byte, 1) == 1) {
+                ::execl(kSleep, kSleep, "60", nullptr);
+            }
+            ::_exit(0);
+        }
+        ::close(pipe_[0]);
+    }
+    ~ForkedChild() { reap(); }
+    pid_t pid() const { return pid_; }
+    void exec() {
+        ASSERT_EQ(::write(pipe_[1], "x", 1), 1);
+        const auto exe = "/proc/" + std::to_string(pid_) + "/exe";
+        std::error_code error;
+        for (int i = 0; i < 2000 && std::filesystem::read_symlink(exe, error) != kSleep; ++i) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(5));
+        }
+        ASSERT_EQ(std::filesystem::read_symlink(exe, error), kSleep);
+    }
+    void reap() {
+        if (pid_ > 0) {
+            ::kill(pid_, SIGKILL);
+            ::close(pipe_[1]);
+            ::waitpid(pid_, nullptr, 0);
+            pid_ = -1;
+        }
+    }
+
+private:
+    int pipe_[2] = {-1, -1};
+    pid_t pid_ = -1;
+};
 
 class CreateFixture : public ::testing::Test {
 protected:
@@ -63,6 +110,20 @@ protected:
     }
     std::shared_ptr<QRNClientConnection> privileged() {
         return connectionFor(kClientBundle, false, {}, true);
+    }
+    // Registers this test program with the code-signing registry.
+    void registerSelf(const std::string& identifier, std::optional<Value> entitlements,
+                      bool sandboxed = false) {
+        Value plist = dictionaryOf(
+            {{"Program", Value(std::filesystem::read_symlink("/proc/self/exe").string())},
+             {"Identifier", Value(identifier)},
+             {"Sandboxed", Value(sandboxed)}});
+        if (entitlements) {
+            plist.set("Entitlements", *entitlements);
+        }
+        std::filesystem::create_directories(root_ / "/etc/quarnd/codesign.d");
+        ASSERT_TRUE(
+            QRN_writeToURL(plist, root_ / "/etc/quarnd/codesign.d/self.plist", {.atomic = true}));
     }
     static QRNClientConnection& shared() { return QRNClientConnection::sharedClientConnection(); }
     static QRNGlobalConfiguration& configuration() {

@@ -3,26 +3,14 @@
 // registry change. Who an identity says the writer is is tested in
 // tests/operations.
 
+#include "operations/CreateFixture.h"
+
 #include "Daemon/service/QRNClientIdentityCache.h"
-#include "Daemon/support/PropertyList.h"
-
-#include "common/TempRoot.h"
-
-#include <gtest/gtest.h>
-
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <chrono>
-#include <thread>
 
 using namespace quarn;
 using namespace quarn::test;
 
 namespace {
-
-constexpr const char* kSleep = "/usr/bin/sleep";
 
 // A connection of this process whose current message was written by `sender`.
 class WrittenConnection final : public IpcConnection {
@@ -40,71 +28,25 @@ private:
     IpcPeer peer_;
 };
 
-// A fork of this process that execs `sleep` when told, and is killed when reaped.
-class Child {
-public:
-    Child() {
-        EXPECT_EQ(::pipe(pipe_), 0);
-        if ((pid_ = ::fork()) == 0) {
-            ::close(pipe_[1]);
-            char byte = 0;
-            if (::read(pipe_[0], &byte, 1) == 1) {
-                ::execl(kSleep, kSleep, "60", nullptr);
-            }
-            ::_exit(0);
-        }
-        ::close(pipe_[0]);
-    }
-    ~Child() { reap(); }
-    IpcConnection::Sender sender() const { return {pid_, ::getuid(), ::getgid()}; }
-    void exec() {
-        ASSERT_EQ(::write(pipe_[1], "x", 1), 1);
-        const auto exe = "/proc/" + std::to_string(pid_) + "/exe";
-        std::error_code error;
-        for (int i = 0; i < 2000 && std::filesystem::read_symlink(exe, error) != kSleep; ++i) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(5));
-        }
-        ASSERT_EQ(std::filesystem::read_symlink(exe, error), kSleep);
-    }
-    void reap() {
-        if (pid_ > 0) {
-            ::kill(pid_, SIGKILL);
-            ::close(pipe_[1]);
-            ::waitpid(pid_, nullptr, 0);
-            pid_ = -1;
-        }
-    }
-
-private:
-    int pipe_[2] = {-1, -1};
-    pid_t pid_ = -1;
-};
-
-class ClientIdentityCacheTest : public TempRootTest {
+class ClientIdentityCacheTest : public CreateFixture {
 protected:
-    void registerSelf(bool allowed) {
-        Value plist = Value::dictionary();
-        plist.set("Program", std::filesystem::read_symlink("/proc/self/exe").string());
-        plist.set("Identifier", "com.orvex.tests");
-        plist.set("Entitlements", Value::Dictionary{{"com.orvex.private.Quarn.allowed", allowed}});
-        std::filesystem::create_directories(root_ / "/etc/quarnd/codesign.d");
-        ASSERT_TRUE(
-            QRN_writeToURL(plist, root_ / "/etc/quarnd/codesign.d/self.plist", {.atomic = true}));
-    }
     QRNClientIdentityPtr identityOf(std::optional<IpcConnection::Sender> sender) {
         connection_.sender = sender;
         return cache_.identityFor(connection_);
     }
-    static IpcConnection::Sender self() { return {::getpid(), ::getuid(), ::getgid()}; }
+    static IpcConnection::Sender writer(pid_t pid) { return {pid, ::getuid(), ::getgid()}; }
+    static IpcConnection::Sender self() { return writer(::getpid()); }
 
     WrittenConnection connection_{*IpcPeer::fromPID(::getpid())};
     QRNClientIdentityCache cache_;
 };
 
+const Value kAllowed = Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}};
+
 } // namespace
 
 TEST_F(ClientIdentityCacheTest, AWriterKeepsItsIdentityUntilItsProcessIdsOrTheRegistryChange) {
-    registerSelf(true);
+    registerSelf("com.orvex.tests", kAllowed);
     const auto parent = identityOf(self());
     ASSERT_TRUE(parent);
     EXPECT_EQ(identityOf(self()), parent) << "a writer is identified once";
@@ -112,14 +54,14 @@ TEST_F(ClientIdentityCacheTest, AWriterKeepsItsIdentityUntilItsProcessIdsOrTheRe
 
     // A child sharing the connection writes as itself, and an exec after its
     // first message (to a program the registry does not know) changes nothing.
-    Child forked;
-    const auto child = identityOf(forked.sender());
+    ForkedChild forked;
+    const auto child = identityOf(writer(forked.pid()));
     ASSERT_TRUE(child);
     EXPECT_NE(child, parent);
-    EXPECT_EQ(child->posixPID(), forked.sender().pid);
+    EXPECT_EQ(child->posixPID(), forked.pid());
     forked.exec();
-    EXPECT_EQ(identityOf(forked.sender()), child);
-    const IpcConnection::Sender gone = forked.sender();
+    EXPECT_EQ(identityOf(writer(forked.pid())), child);
+    const IpcConnection::Sender gone = writer(forked.pid());
     forked.reap();
     EXPECT_FALSE(identityOf(gone)) << "an exited writer is not answered from the cache";
 
@@ -132,7 +74,7 @@ TEST_F(ClientIdentityCacheTest, AWriterKeepsItsIdentityUntilItsProcessIdsOrTheRe
     EXPECT_FALSE(identityOf(IpcConnection::Sender{0, 0, 0}))
         << "a writer the kernel could not name has no identity";
 
-    registerSelf(false);
+    registerSelf("com.orvex.tests", Value::dictionary());
     const auto after = identityOf(self());
     ASSERT_TRUE(after);
     EXPECT_FALSE(after->boolValueOfEntitlement("com.orvex.private.Quarn.allowed"))
