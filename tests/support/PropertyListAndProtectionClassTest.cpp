@@ -129,7 +129,7 @@ TEST(PropertyList, ReadsXML) {
     EXPECT_EQ(*v, Value(expected));
 }
 
-TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
+TEST(PropertyList, RefusesValuesWithoutAFormAndBytesThatAreCorruptOrHostile) {
     Value deep = 1u;
     for (int i = 0; i < 300; ++i)
         deep = Value::Array{deep};
@@ -143,9 +143,8 @@ TEST(PropertyList, RefusesValuesWithoutAPropertyListForm) {
                     r.error().code == kGeneralErrorPropertyListWriteInvalid)
             << bad.description();
     }
-}
 
-TEST(PropertyList, TruncatedOrCorruptBytesGiveErrorsNotCrashes) {
+    // Truncated or corrupt bytes give errors, not crashes.
     auto good = *binaryPropertyList(Value::Dictionary{
         {"a", Value::Array{1u, "two", 3.0, Date{k2001}}}, {"b", Value::Data{1, 2, 3}}});
     for (std::size_t n = 0; n < good.size(); ++n)
@@ -162,9 +161,8 @@ TEST(PropertyList, TruncatedOrCorruptBytesGiveErrorsNotCrashes) {
                 b[random() % b.size()] = static_cast<std::uint8_t>(random());
             (void)valueFromPropertyListBytes(b);
         }
-}
 
-TEST(PropertyList, RefusesHostileBytesWithTheReason) {
+    // Hostile bytes are refused with the reason.
     EXPECT_TRUE(valueFromPropertyListBytes(nested(100)));
     std::string deepXML = "<plist>";
     for (int i = 0; i < 100000; ++i)
@@ -207,16 +205,12 @@ protected:
         auto r = P::getProtectionClass(fd);
         return r ? *r : -r.error();
     }
-    std::ptrdiff_t entryCount() const {
-        return std::distance(fs::directory_iterator(dir_), fs::directory_iterator());
+    auto entryCount() const { return std::ranges::distance(fs::directory_iterator(dir_)); }
+    static std::string contents(const fs::path& p) {
+        std::ifstream in(p);
+        return {std::istreambuf_iterator<char>(in), {}};
     }
-    std::string contents(const fs::path& p) const {
-        std::ifstream in(p, std::ios::binary);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
-    void write(const fs::path& p, std::string_view text) const {
-        std::ofstream(p, std::ios::binary) << text;
-    }
+    static void write(const fs::path& p, std::string_view s) { std::ofstream(p) << s; }
 
     const fs::path dir_ = root_ / "/scratch";
     std::deque<Descriptor> fds_;

@@ -16,7 +16,7 @@ struct Counter {
     static inline int made = 0;
 };
 
-TEST(QRNDaemonContextTest, MakesEachInstanceOncePerContext) {
+TEST(QRNDaemonContextTest, MakesEachInstanceOncePerContextUnlessReplacedAndFollowsSetCurrent) {
     Counter::made = 0;
     QRNDaemonContext first("/a"), second("/b");
     std::vector<Counter*> seen(8);
@@ -28,25 +28,19 @@ TEST(QRNDaemonContextTest, MakesEachInstanceOncePerContext) {
     EXPECT_EQ(first.instance<Counter>().root, "/a");
     EXPECT_EQ(second.instance<Counter>().root, "/b");
     EXPECT_EQ(Counter::made, 2);
-}
 
-TEST(QRNDaemonContextTest, InstallAfterFirstUseReplacesTheInstance) {
-    // Tests put fault-injecting pieces in place of ones already used.
-    struct Knob {
-        int value = 1;
-    };
-    QRNDaemonContext context;
-    EXPECT_FALSE(context.has<Knob>());
-    EXPECT_EQ(context.instance<Knob>().value, 1);
-    context.install(std::make_shared<Knob>(2));
-    EXPECT_EQ(context.instance<Knob>().value, 2);
-    EXPECT_EQ(context.sharedInstance<Knob>()->value, 2);
-}
+    // Install after first use replaces the instance: tests put fault-injecting
+    // pieces in place of ones already used.
+    EXPECT_FALSE(second.has<std::string>());
+    EXPECT_EQ(second.instance<std::string>(), "");
+    second.install(std::make_shared<std::string>("knob"));
+    EXPECT_EQ(second.instance<std::string>(), "knob");
+    EXPECT_EQ(*second.sharedInstance<std::string>(), "knob");
 
-TEST(QRNDaemonContextTest, CurrentFollowsSetCurrent) {
-    auto first = std::make_shared<QRNDaemonContext>("/first");
-    QRNDaemonContext::setCurrent(first);
-    EXPECT_EQ(&QRNDaemonContext::current(), first.get());
+    // The current context follows setCurrent, and a default one is made when none is set.
+    auto shared = std::make_shared<QRNDaemonContext>("/first");
+    QRNDaemonContext::setCurrent(shared);
+    EXPECT_EQ(&QRNDaemonContext::current(), shared.get());
     QRNDaemonContext::setCurrent(std::make_shared<QRNDaemonContext>("/second"));
     EXPECT_EQ(QRNDaemonContext::current().rootPrefix(), "/second");
     QRNDaemonContext::setCurrent(nullptr);

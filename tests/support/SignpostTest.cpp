@@ -18,7 +18,7 @@ std::string tag(const Signpost& s) {
 
 } // namespace
 
-TEST(Signpost, LogsBeginAndEndWithDurationOnce) {
+TEST(Signpost, LogsBeginAndEndWithDurationOnceAndMovesEndOnce) {
     LogCapture log;
     std::string id;
     {
@@ -32,10 +32,8 @@ TEST(Signpost, LogsBeginAndEndWithDurationOnce) {
     ASSERT_EQ(log.count(id + " end"), 1u) << log.all();
     EXPECT_TRUE(std::regex_search(log.all(), std::regex(R"( end after \d+\.\d{3} ms: 12 nodes)")))
         << log.all();
-}
 
-TEST(Signpost, IntervalsAreToldApartAndMovesEndOnce) {
-    LogCapture log;
+    // Intervals are told apart, and a moved one ends once.
     Signpost a(LogCategory::Vell, "VellEventProcessing");
     Signpost b(LogCategory::Vell, "VellEventProcessing");
     std::string aTag = tag(a), bTag = tag(b);

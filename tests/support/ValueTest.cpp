@@ -11,7 +11,7 @@
 
 using namespace quarn;
 
-TEST(Value, TypedAccessorsAnswerNoneOnWrongType) {
+TEST(Value, TypedAccessorsEqualityHashAndCopies) {
     Value s("text");
     EXPECT_FALSE(s.asUInt64() || s.asBool() || s.asDictionary() || s.asArray() || s.get("key"));
     EXPECT_EQ(*s.asString(), "text");
@@ -23,9 +23,8 @@ TEST(Value, TypedAccessorsAnswerNoneOnWrongType) {
     EXPECT_EQ(Value(true).asUInt64(), std::nullopt);
     EXPECT_EQ(Value(3u).asDouble(), 3.0);
     EXPECT_TRUE(Value(3u).isNumber() && !Value(true).isNumber());
-}
 
-TEST(Value, EqualityAndHashAgreeAndCopiesAreIndependent) {
+    // Equality and hash agree; copies are independent.
     EXPECT_NE(Value(5), Value(5.0));
     EXPECT_NE(Value(1), Value(true));
     EXPECT_NE(Value("a"), Value(Value::Data{'a'}));
@@ -45,9 +44,8 @@ TEST(Value, EqualityAndHashAgreeAndCopiesAreIndependent) {
     EXPECT_EQ(a, b);
     EXPECT_TRUE(c.erase("y"));
     EXPECT_FALSE(c.erase("y"));
-}
 
-TEST(Value, DescriptionIsDeterministicAndReadable) {
+    // The description is deterministic and readable.
     Value v =
         Value::Dictionary{{"b", Value::Array{1, "s"}}, {"a", true}, {"c", Value::Dictionary{}}};
     EXPECT_EQ(v.description(),
@@ -83,10 +81,8 @@ TEST(UUID, ParseAgreesWithLibuuidAndCanonicalFormIsUpperCase) {
         EXPECT_FALSE(UUID::parse(text + "0"));
         EXPECT_FALSE(UUID::parse(text.substr(1)));
     }
-    EXPECT_FALSE(UUID::parse(""));
     EXPECT_NE(UUID::random(), UUID::random());
-    EXPECT_TRUE(UUID().isNil());
-    EXPECT_FALSE(UUID::random().isNil());
+    EXPECT_TRUE(UUID().isNil() && !UUID::random().isNil());
 }
 
 TEST(QRNError, CarriesFunctionLineAndLogsOnce) {
@@ -104,9 +100,7 @@ TEST(QRNError, CarriesFunctionLineAndLogsOnce) {
     EXPECT_EQ(capture.count("Failed to move dir: /a to: /b"), 1u) << capture.all();
     EXPECT_TRUE(capture.contains(std::to_string(outer.line) + ": Failed to move dir: /a to: /b ("));
     EXPECT_NE(outer.description().find("QRNErrorDomain"), std::string::npos);
-}
 
-TEST(QRNError, QualifiedFunctionName) {
     EXPECT_EQ(qualifiedFunctionName("quarn::Result<int> quarn::A::f(int, std::map<int, int>)"),
               "quarn::A::f");
     EXPECT_EQ(qualifiedFunctionName("void f()"), "f");
