@@ -19,11 +19,6 @@ protected:
         EXPECT_TRUE(peer);
         return peer ? QRNClientIdentity::clientIdentityWithPeer(*peer) : nullptr;
     }
-    static QRNClientIdentityPtr client(Value entitlements) {
-        return QRNClientIdentity::initWithBundleIdentifier(
-            kClientBundle, kMobileUID, kMobileUID, 77, user(), std::move(entitlements), true,
-            QRNClientIdentity::AuditToken{}, false);
-    }
 };
 
 } // namespace
@@ -34,7 +29,8 @@ TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntryAndOnlyTheInstallers
     auto identity = identityOf(::getpid());
     ASSERT_TRUE(identity);
     EXPECT_EQ(identity->entitlements(), Value::dictionary()) << "missing entitlements";
-    EXPECT_EQ(client(Value("not a dictionary"))->entitlements(), Value::dictionary());
+    EXPECT_EQ(clientIdentity(kClientBundle, Value("not a dictionary"))->entitlements(),
+              Value::dictionary());
 
     const Value entitlements = Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}};
     registerSelf("com.orvex.tests", entitlements, true);
@@ -66,13 +62,14 @@ TEST_F(ClientIdentityTest, IdentityCarriesTheRegisteredEntryAndOnlyTheInstallers
 
 TEST_F(ClientIdentityTest,
        OnlyBooleansAndNumbersGrantAnEntitlementAndTheFirstProtectionKeyDecides) {
-    auto identity = client(dictionaryOf({{"flag", Value(true)},
-                                         {"off", Value(false)},
-                                         {"one", Value(1)},
-                                         {"zero", Value(0)},
-                                         {"text", Value("true")},
-                                         {"dict", dictionaryOf({{"x", Value(true)}})},
-                                         {"list", arrayOf({Value(true)})}}));
+    auto identity =
+        clientIdentity(kClientBundle, dictionaryOf({{"flag", Value(true)},
+                                                    {"off", Value(false)},
+                                                    {"one", Value(1)},
+                                                    {"zero", Value(0)},
+                                                    {"text", Value("true")},
+                                                    {"dict", dictionaryOf({{"x", Value(true)}})},
+                                                    {"list", arrayOf({Value(true)})}}));
     ASSERT_TRUE(identity);
     for (const char* name : {"flag", "off", "one", "zero", "text", "dict", "list", "absent"}) {
         const std::string_view granted(name);

@@ -98,15 +98,18 @@ protected:
         drainBackground();
     }
 
+    static QRNClientIdentityPtr clientIdentity(const std::string& bundle,
+                                               Value entitlements = Value::dictionary()) {
+        return QRNClientIdentity::initWithBundleIdentifier(bundle, kMobileUID, kMobileUID, 4242,
+                                                           user(), std::move(entitlements), false,
+                                                           QRNClientIdentity::AuditToken{}, false);
+    }
     std::shared_ptr<QRNClientConnection> connectionFor(const std::string& bundle,
                                                        bool otherIds = false,
                                                        std::optional<Value> lookup = {},
                                                        bool unrestricted = false) {
-        auto client = QRNClientIdentity::initWithBundleIdentifier(
-            bundle, kMobileUID, kMobileUID, 4242, user(), Value::dictionary(), false,
-            QRNClientIdentity::AuditToken{}, false);
-        return std::make_shared<QRNClientConnection>(client, unrestricted, otherIds, unrestricted,
-                                                     lookup, std::nullopt, nullptr);
+        return std::make_shared<QRNClientConnection>(clientIdentity(bundle), unrestricted, otherIds,
+                                                     unrestricted, lookup, std::nullopt, nullptr);
     }
     std::shared_ptr<QRNClientConnection> privileged() {
         return connectionFor(kClientBundle, false, {}, true);

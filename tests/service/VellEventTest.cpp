@@ -109,10 +109,9 @@ TEST_F(VellEventTest, RightsHandedToTheClientConnection) {
         for (const auto& [name, value] : granted) {
             entitlements.set(std::string("com.orvex.private.Quarn.") + name, value);
         }
-        auto identity = QRNClientIdentity::initWithBundleIdentifier(
-            kVellClient, kMobileUID, kMobileUID, 7, user(), entitlements, false, {}, false);
-        return checkEntitlementsAndInitClientObject(identity, QRNCommandTable::entries()[command],
-                                                    queue, error);
+        return checkEntitlementsAndInitClientObject(clientIdentity(kVellClient, entitlements),
+                                                    QRNCommandTable::entries()[command], queue,
+                                                    error);
     };
     auto full = admit({{"allowed", Value(1u)}, {"lookup", Value::dictionary()}}, 0);
     ASSERT_TRUE(full);
