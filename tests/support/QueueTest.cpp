@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <future>
 #include <latch>
 #include <memory>
@@ -29,7 +30,7 @@ struct Gate {
 
 } // namespace
 
-TEST(Queue, SerialKeepsEachProducersOrder) {
+TEST(Queue, SerialKeepsEachProducersOrderAndSyncReturnsOrThrowsFromQueuesAndThreads) {
     constexpr int kProducers = 8, kEach = 500;
     Queue q("serial");
     std::vector<int> next(kProducers, 0); // touched only on the queue
@@ -44,9 +45,7 @@ TEST(Queue, SerialKeepsEachProducersOrder) {
     // sync sees all earlier work.
     EXPECT_EQ(q.sync([&] { return next; }), std::vector<int>(kProducers, kEach));
     EXPECT_EQ(reordered.load(), 0);
-}
 
-TEST(Queue, SyncReturnsOrThrowsFromOtherQueuesAndPlainThreads) {
     Queue a("a"), b("b");
     // The caller's queue stays current inside a nested sync.
     auto both = [&] { return a.isCurrent() && b.isCurrent(); };
@@ -123,7 +122,7 @@ TEST(Queue, BarrierWaitsForEarlierRunsAloneAndHoldsLater) {
 
 // A manual queue holds its blocks while suspended (as often as suspended) and
 // runs them on the thread that drives it.
-TEST(Queue, ManualQueueRunsOnTheDrivingThreadUnlessSuspended) {
+TEST(Queue, ManualQueueRunsOnTheDrivingThreadAndSuspendedQueuesHoldTheirWork) {
     Queue main("main", Queue::Kind::Manual);
     std::vector<int> order;
     main.async([&] { order.push_back(1); });
@@ -149,9 +148,8 @@ TEST(Queue, ManualQueueRunsOnTheDrivingThreadUnlessSuspended) {
     main.runUntil([&] { return stop; });
     other.join();
     EXPECT_EQ(onDriver.load(), 10);
-}
 
-TEST(Queue, SuspendFromInsideLetsTheRunningBlockFinish) {
+    // Suspending from inside lets the running block finish.
     Queue q("suspended");
     Gate suspended;
     std::atomic<bool> firstFinished{false}, secondRan{false};
@@ -201,21 +199,16 @@ TEST(Queue, DestructionRunsQueuedWorkUnlessSuspended) {
 
 TEST(QueueDeathTest, MisuseStopsTheProcess) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
-    auto misuse = [](int which) {
-        Log::addStderr(); // the fault line is the last word before the abort
-        Queue a("a"), b("b");
-        if (which == 0)
-            a.sync([&] { a.sync([] {}); });
-        if (which == 1)
-            a.sync([&] { b.sync([&] { a.sync([] {}); }); });
-        if (which == 2)
-            a.suspend(), a.resume(), a.resume();
-        QRN_ASSERT_ON_QUEUE(a);
-    };
-    const char* faults[] = {"sync onto a queue the caller is already running on",
-                            "already running on", "not suspended", "must run on queue a"};
-    for (int which = 0; which < 4; ++which)
-        EXPECT_DEATH(misuse(which), faults[which]);
+    Queue a("a"), b("b");
+    // The fault line is the last word before the abort.
+    const std::pair<std::function<void()>, const char*> misuses[] = {
+        {[&] { a.sync([&] { a.sync([] {}); }); },
+         "sync onto a queue the caller is already running on"},
+        {[&] { a.sync([&] { b.sync([&] { a.sync([] {}); }); }); }, "already running on"},
+        {[&] { a.suspend(), a.resume(), a.resume(); }, "not suspended"},
+        {[&] { QRN_ASSERT_ON_QUEUE(a); }, "must run on queue a"}};
+    for (const auto& [misuse, fault] : misuses)
+        EXPECT_DEATH((Log::addStderr(), misuse()), fault);
 }
 
 TEST(ProcessTransaction, CountsOpenTransactionsOnceAndDrainsWithTheWorkOwningThem) {
