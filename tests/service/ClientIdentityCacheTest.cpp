@@ -3,7 +3,7 @@
 // registry change. Who an identity says the writer is is tested in
 // tests/operations.
 
-#include "operations/CreateFixture.h"
+#include "VellEventFixture.h"
 
 #include "Daemon/service/QRNClientIdentityCache.h"
 
@@ -11,22 +11,6 @@ using namespace quarn;
 using namespace quarn::test;
 
 namespace {
-
-// A connection of this process whose current message was written by `sender`.
-class WrittenConnection final : public IpcConnection {
-public:
-    explicit WrittenConnection(IpcPeer peer) : peer_(std::move(peer)) {}
-    const IpcPeer& peer() const override { return peer_; }
-    std::optional<Sender> messageSender() const override { return sender; }
-    void setEventHandler(EventHandler) override {}
-    void resume() override {}
-    void sendReply(const Value&) override {}
-    void cancel() override {}
-    std::optional<Sender> sender;
-
-private:
-    IpcPeer peer_;
-};
 
 class ClientIdentityCacheTest : public CreateFixture {
 protected:
@@ -37,7 +21,7 @@ protected:
     static IpcConnection::Sender writer(pid_t pid) { return {pid, ::getuid(), ::getgid()}; }
     static IpcConnection::Sender self() { return writer(::getpid()); }
 
-    WrittenConnection connection_{*IpcPeer::fromPID(::getpid())};
+    FakeIpcConnection connection_{*IpcPeer::fromPID(::getpid())};
     QRNClientIdentityCache cache_;
 };
 

@@ -24,9 +24,14 @@ namespace quarn::test {
 
 inline constexpr const char* kVellClient = "com.example.vellclient";
 
+// Records replies and the cancel; the writer of the current message is
+// `sender`, the peer's own process when none.
 class FakeIpcConnection : public IpcConnection {
 public:
+    FakeIpcConnection() = default;
+    explicit FakeIpcConnection(IpcPeer peer) : peer_(std::move(peer)) {}
     const IpcPeer& peer() const override { return peer_; }
+    std::optional<Sender> messageSender() const override { return sender; }
     void setEventHandler(EventHandler) override {}
     void resume() override {}
     void sendReply(const Value& reply) override {
@@ -39,6 +44,7 @@ public:
         return replies_;
     }
     std::atomic<bool> cancelled{false};
+    std::optional<Sender> sender;
 
 private:
     IpcPeer peer_{
