@@ -296,91 +296,63 @@ TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
     }
 }
 
-// Where each directory is, and that asking for it made it with mode 0755 and
-// the right owner (-1: handed out but not made). Bundles are installed by
-// the installer, which owns their homes; transient system containers live in
-// the daemon's caches.
+// Where each directory is, its protection class, and that asking for it made
+// it with mode 0755 and the right owner (-1: handed out but not made). One
+// row per way a directory is made; bundles belong to the installer.
 TEST_F(QRNGlobalConfigurationTest, DirectoriesPathsModesOwners) {
     LogCapture log;
     auto& c = config();
     auto user = c.getPerUserConfigurationForUserIdentity(mobile());
     ASSERT_NE(user, nullptr);
-    const auto in = [&](std::optional<std::filesystem::path> p) { return p.value_or("none"); };
     const auto cls = [&](std::uint64_t k, bool transient) {
-        return in(c.containerDirectoryURLForUserIdentity(mobile(), k, transient));
+        return c.containerDirectoryURLForUserIdentity(mobile(), k, transient).value_or("none");
     };
-    const std::string caches = "/private/var/root/Library/Caches/com.orvex.quarnd";
-    const std::string lib = "/private/var/root/Library/Quarn",
-                      containers = "/private/var/containers";
-    const std::tuple<std::filesystem::path, std::filesystem::path, int> dirs[] = {
-        {c.sharedContainersDirectory(), root_ / containers, 0},
-        {c.logDirectory(), root_ / "/private/var/root/Library/Logs/Quarn", 0},
-        {c.cachesDirectory(), root_ / caches, 0},
-        {c.libraryDirectory(), root_ / lib, 0},
-        {c.transientDirectory(), root_ / (caches + "/Temp"), 0},
-        {c.transientBundleDirectory(), root_ / (containers + "/Temp"), 33},
-        {c.stagingDirectory(), root_ / (caches + "/Staging"), 0},
-        {c.deathrowDirectory(), root_ / (caches + "/Dead"), 0},
-        {c.replaceDirectory(), root_ / (lib + "/Replace"), 0},
-        {c.pendingUpdatesDirectory(), root_ / (lib + "/PendingUpdates"), 0},
-        {c.bundleDirectory(), root_ / (containers + "/Bundle"), 0},
+    const auto h = home(), lib = root_ / "/private/var/root/Library",
+               caches = lib / "Caches/com.orvex.quarnd", ctr = root_ / "/private/var/containers";
+    const std::tuple<std::filesystem::path, std::filesystem::path, int, const char*> dirs[] = {
+        {c.sharedContainersDirectory(), ctr, 0, ""},
+        {c.cachesDirectory(), caches, 0, "4"},
+        {c.libraryDirectory(), lib / "Quarn", 0, "4"},
+        {c.transientBundleDirectory(), ctr / "Temp", 33, ""},
+        {c.stagingDirectory(), caches / "Staging", 0, ""},
+        {c.replaceDirectory(), lib / "Quarn/Replace", 0, ""},
+        {c.bundleDirectory(), ctr / "Bundle", 0, ""},
         {c.legacyTransientBundleDirectory(),
-         root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd", -1},
-        {user->libraryDirectory(), home() / "Library/Quarn", 501},
-        {user->userBaseDirectory(), home() / "Containers", 501},
-        {user->transientDirectory(), home() / "Containers/Temp", 501},
-        {user->stagingDirectory(), home() / "Containers/Staging", 501},
-        {user->oldLoggingPath(), home() / "Library/Logs/Quarn", -1},
-        {user->systemContainerBackupBaseDirectory(), home() / "Library/Backup/SystemContainers",
-         -1},
-        {user->systemContainerBackupDirectory(), home() / "Library/Backup/SystemContainers/Data",
-         -1},
-        {user->systemGroupContainerBackupDirectory(),
-         home() / "Library/Backup/SystemContainers/Shared", -1},
-        {cls(2, false), home() / "Containers/Data/Application", 501},
-        {cls(7, true), home() / "Containers/Temp/Shared/AppGroup", 501},
-        {cls(1, false), root_ / (containers + "/Bundle/Application"), 33},
-        {cls(8, true), root_ / (containers + "/Temp/Bundle/Framework"), 33},
-        {cls(12, false), root_ / (containers + "/Data/System"), 0},
-        {cls(13, true), root_ / (caches + "/Temp/Shared/SystemGroup"), 0},
+         root_ / "/private/var/installer/Library/Caches/com.orvex.quarnd", -1, ""},
+        {user->libraryDirectory(), h / "Library/Quarn", 501, ""},
+        {user->userBaseDirectory(), h / "Containers", 501, ""},
+        {user->systemContainerBackupDirectory(), h / "Library/Backup/SystemContainers/Data", -1,
+         ""},
+        {cls(2, false), h / "Containers/Data/Application", 501, ""},
+        {cls(7, true), h / "Containers/Temp/Shared/AppGroup", 501, ""},
+        {cls(1, false), ctr / "Bundle/Application", 33, ""},
+        {cls(8, true), ctr / "Temp/Bundle/Framework", 33, ""},
+        {cls(12, false), ctr / "Data/System", 0, ""},
+        {cls(13, true), caches / "Temp/Shared/SystemGroup", 0, ""},
     };
-    for (const auto& [got, path, owner] : dirs) {
+    for (const auto& [got, path, owner, protection] : dirs) {
         SCOPED_TRACE(path);
         EXPECT_EQ(got, path);
+        EXPECT_EQ(protectionClassOf(path), protection);
         if (owner < 0) {
             EXPECT_FALSE(std::filesystem::exists(path));
         } else {
             expectDirectory(path, static_cast<uid_t>(owner));
         }
     }
-    // The daemon's own directories stay readable when the device is locked.
-    for (const auto& dir : {c.logDirectory(), c.cachesDirectory(), c.libraryDirectory()}) {
-        EXPECT_EQ(protectionClassOf(dir), "4") << dir;
-    }
-    for (const auto& dir : {c.sharedContainersDirectory(), c.transientDirectory(),
-                            c.stagingDirectory(), c.deathrowDirectory(), c.bundleDirectory()}) {
-        EXPECT_EQ(protectionClassOf(dir), "") << dir;
-    }
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 0, false));
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(mobile(), 14, false));
     EXPECT_FALSE(c.containerDirectoryURLForUserIdentity(nullptr, 2, false));
     EXPECT_TRUE(log.contains("Invalid class for a per user container directory: 14"));
-
     // Each configuration answers only for its own kind of class.
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(2, true));
     EXPECT_FALSE(c.globalContainerBaseURLWithContentClass(0, false));
-    EXPECT_EQ(c.globalContainerBaseURLWithContentClass(5, false),
-              root_ / (containers + "/Bundle/VPNPlugin"));
-    log.clear();
-    EXPECT_FALSE(
-        c.getPerUserConfigurationForUserIdentity(mobile())->containerDirectoryURLForContentClass(
-            1, false));
-    EXPECT_TRUE(log.contains("Invalid class for a per user container directory: 1"));
+    EXPECT_FALSE(user->containerDirectoryURLForContentClass(1, false));
 
     // Per-user classes stage in the user's home, all others globally.
     for (std::uint64_t cls = 0; cls <= 15; ++cls) {
         EXPECT_EQ(c.stagingDirectoryURLForUserIdentity(mobile(), cls),
-                  QRNContainerClass::usesPerUserStaging(cls) ? home() / "Containers/Staging"
+                  QRNContainerClass::usesPerUserStaging(cls) ? h / "Containers/Staging"
                                                              : c.stagingDirectory())
             << cls;
     }

