@@ -129,8 +129,6 @@ TEST_F(ContainerOperationsTest, InfoValuesRecordedProtectionClassAndListing) {
     const auto absent = identity("com.absent", kClass);
     EXPECT_EQ(connection_->setInfoValue(Value("x"), &key, absent, true).error(),
               kQRNErrorContainerNotFound);
-    EXPECT_EQ(connection_->metadataWithContainerIdentity(absent).error(),
-              kQRNErrorContainerNotFound);
 
     // The default structure made again uses the recorded protection class.
     const Value classKey("com.orvex.Brevon.ContentProtectionClass");
