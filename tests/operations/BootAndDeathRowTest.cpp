@@ -19,7 +19,6 @@
 #include <atomic>
 #include <future>
 #include <map>
-#include <sstream>
 
 using namespace quarn;
 using namespace quarn::test;
@@ -32,9 +31,8 @@ std::size_t entriesIn(const fs::path& directory) {
 }
 
 std::string read(const fs::path& file) {
-    std::stringstream contents;
-    contents << std::ifstream(file).rdbuf();
-    return contents.str();
+    std::ifstream in(file);
+    return {std::istreambuf_iterator<char>(in), {}};
 }
 
 void write(const fs::path& file, const std::string& contents) {

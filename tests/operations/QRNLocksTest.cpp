@@ -127,9 +127,9 @@ TEST_F(QRNLocksTest, ArraysAreLockedInAscendingOrderAndDuplicatesOnce) {
     EXPECT_FALSE(h.acquired());
     locks.unlock_identifier("b");
     waitUntil("array locker gets both", [&] { return h.acquired(); });
-}
+    h.release();
 
-TEST_F(QRNLocksTest, HoldsAreMarkedFromLockToUnlock) {
+    // Holds are marked in the log from lock to unlock.
     test::LogCapture log;
     auto ends = [&](std::string_view name) {
         auto lines = log.messages();
