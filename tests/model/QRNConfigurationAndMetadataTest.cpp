@@ -241,7 +241,6 @@ TEST_F(QRNMetadataTest, AcceptedOwnerEntriesAndRepeatedKeys) {
     auto read = QRNMetadata::readAndValidateMetadataAtFileUrl(
         fileWith(other, [](Value& d) { d.erase("QRNMetadataUserIdentity"); }), other, true);
     ASSERT_TRUE(read);
-    EXPECT_EQ((*read)->userIdentity(), other);
     EXPECT_EQ((*read)->containerIdentity()->userIdentity(), other);
     const auto persona = [&](Value v, const QRNUserIdentityPtr& u) {
         return QRNMetadata::readAndValidateMetadataAtFileUrl(
@@ -264,7 +263,6 @@ TEST_F(QRNMetadataTest, AcceptedOwnerEntriesAndRepeatedKeys) {
     read = QRNMetadata::readAndValidateMetadataAtFileUrl(url, mobile(), true);
     ASSERT_TRUE(read);
     EXPECT_EQ((*read)->identifier(), "com.example.later");
-    EXPECT_EQ((*read)->url(), url.parent_path());
 }
 
 TEST_F(QRNMetadataTest, ClassPathMustMatchTheLayout) {
@@ -370,8 +368,6 @@ TEST_F(QRNGlobalConfigurationTest, CreationFailuresMigrationFilesAndInternalImag
     EXPECT_TRUE(log.contains("Failed to create shared container dir at \"" +
                              (root_ / "/private/var/containers").string() + "\": "))
         << log.all();
-    EXPECT_EQ(c.bundleDirectory(), root_ / "/private/var/containers/Bundle");
-    EXPECT_TRUE(log.contains("Failed to create bundle dir at \""));
     auto dir = c.containerDirectoryURLForUserIdentity(mobile(), 2, false);
     EXPECT_EQ(*dir, home() / "Containers/Data/Application");
     EXPECT_TRUE(log.contains("Failed to create user base dir at \""));
@@ -380,7 +376,6 @@ TEST_F(QRNGlobalConfigurationTest, CreationFailuresMigrationFilesAndInternalImag
     EXPECT_FALSE(c.migrationFileExistsWithName("Migrated"));
     std::ofstream(c.libraryDirectory() / "Migrated") << "x";
     EXPECT_TRUE(c.migrationFileExistsWithName("Migrated"));
-    EXPECT_TRUE(std::filesystem::exists(c.libraryDirectory() / ".."));
     EXPECT_FALSE(c.migrationFileExistsWithName(".."));
     EXPECT_FALSE(c.migrationFileExistsWithName("../Quarn/Migrated"));
     EXPECT_FALSE(c.migrationFileExistsWithName(""));

@@ -164,26 +164,15 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromTheKernelOrOneBuildPerEntry) {
     auto impostor = makeContainer(kData, "com.example.impostor");
     const auto bare = classDirectory(kData) / "bare";
     std::filesystem::create_directories(bare);
-    const std::vector<std::pair<std::filesystem::path, std::string>> cases = {
-        {made->url(), ""},
-        {impostor->url(),
-         fmt::format("Attempted to fetch container from Sandbox-provided path [{}] that was not "
-                     "what was expected; expected class: 2, expected identifier: "
-                     "[com.example.app], actual class: 2, actual identifier: "
-                     "[com.example.impostor]",
-                     impostor->url().string())},
-        {bare, fmt::format("Could not validate container from Sandbox-provided path [{}]",
-                           bare.string())},
-    };
     const auto id = identity(kData, "com.example.app");
-    for (const auto& [path, logged] : cases) {
+    // The impostor's path and a directory without metadata fall back to the scan.
+    for (const auto& path : {made->url(), impostor->url(), bare}) {
         SCOPED_TRACE(path);
         sandbox().setContainerMapping(501, {1, "com.example.app", kData, 501, path.string()});
         auto found = cache().containerForContainerIdentity(id, false, false, true);
         ASSERT_TRUE(found) << log_.all();
         EXPECT_EQ((*found)->uuid(), made->uuid());
-        EXPECT_TRUE(log_.contains(logged)) << log_.all();
-        EXPECT_EQ(rebuilds("[501]-appData"), logged.empty() ? 0u : 1u);
+        EXPECT_EQ(rebuilds("[501]-appData"), path == made->url() ? 0u : 1u);
         // Without the kernel's word the entry is built from disk.
         ASSERT_TRUE(cache().containerForContainerIdentity(id, false, false, false));
         EXPECT_EQ(rebuilds("[501]-appData"), 1u);
@@ -292,14 +281,7 @@ TEST_F(QRNContainerCacheTest, TheSandboxMappingFollowsTheCache) {
         std::uint64_t cls, itemType; // item type 0: never mapped
         std::uint32_t uid;
     };
-    for (const Case& c : std::vector<Case>{{1, 0, 0},
-                                           {2, 1, 501},
-                                           {4, 1, 501},
-                                           {7, 2, 501},
-                                           {8, 0, 0},
-                                           {11, 1, 501},
-                                           {12, 4, 0},
-                                           {13, 8, 0}}) {
+    for (const Case& c : {Case{1, 0, 0}, {2, 1, 501}, {7, 2, 501}, {12, 4, 0}, {13, 8, 0}}) {
         SCOPED_TRACE(c.cls);
         const std::string id = fmt::format("com.example.c{}", c.cls);
         auto made = makeContainer(c.cls, id);

@@ -50,43 +50,34 @@ TEST_F(QRNContainerIdentityTest, ChecksInOrderWithCodesAndMessages) {
         const Value* identifier;
         std::uint64_t cls;
         std::uint64_t code;
-        const char* logged; // null: "uuid" must not be mentioned
+        const char* logged; // after "Invalid object: "; null: "uuid" not mentioned
     };
+    const auto bad = kQRNErrorInvalidArgument, noId = kQRNErrorMissingIdentifier;
     const Case cases[] = {
-        {false, nullptr, nullptr, nullptr, 99, kQRNErrorInvalidArgument,
-         "Invalid object: no user identity"},
-        {false, nullptr, u, nullptr, 99, kQRNErrorMissingIdentifier,
-         "Invalid object: missing identifier"},
-        {false, nullptr, u, &none, 2, kQRNErrorMissingIdentifier,
-         "Invalid object: missing identifier"},
-        {false, nullptr, u, &number, 99, kQRNErrorInvalidArgument,
-         "Invalid object: identifier = [7]"},
-        {false, nullptr, u, &str, 0, kQRNErrorInvalidArgument,
-         "Invalid object: container class = 0"},
-        {false, nullptr, u, &str, 14, kQRNErrorInvalidArgument,
-         "Invalid object: container class = 14"},
-        {false, nullptr, u, &str, ~std::uint64_t{0}, kQRNErrorInvalidArgument,
-         "Invalid object: container class = 18446744073709551615"},
-        {true, &uuidString, u, nullptr, 2, kQRNErrorMissingIdentifier, nullptr},
-        {true, &uuidString, u, &str, 2, kQRNErrorInvalidArgument, "Invalid object: uuid = ["},
-        {true, nullptr, u, &str, 2, kQRNErrorInvalidArgument, "Invalid object: uuid = ["},
+        {false, nullptr, nullptr, nullptr, 99, bad, "no user identity"},
+        {false, nullptr, u, nullptr, 99, noId, "missing identifier"},
+        {false, nullptr, u, &none, 2, noId, "missing identifier"},
+        {false, nullptr, u, &number, 99, bad, "identifier = [7]"},
+        {false, nullptr, u, &str, 0, bad, "container class = 0"},
+        {false, nullptr, u, &str, 14, bad, "container class = 14"},
+        {false, nullptr, u, &str, ~std::uint64_t{0}, bad, "container class = 18446744073709551615"},
+        {true, &uuidString, u, nullptr, 2, noId, nullptr},
+        {true, &uuidString, u, &str, 2, bad, "uuid = ["},
+        {true, nullptr, u, &str, 2, bad, "uuid = ["},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.logged ? c.logged : "uuid not checked");
         log_.clear();
-        const auto failure = [&]() -> std::optional<std::uint64_t> {
-            if (c.concrete) {
-                auto r = QRNConcreteContainerIdentity::containerIdentityWithUUID(
-                    c.uuid, c.user, c.identifier, c.cls);
-                return r ? std::nullopt : std::optional(r.error());
-            }
-            auto r = QRNContainerIdentity::containerIdentityWithUserIdentity(c.user, c.identifier,
-                                                                             c.cls);
-            return r ? std::nullopt : std::optional(r.error());
-        }();
-        EXPECT_EQ(failure, c.code);
+        const auto code = [](const auto& r) { return r ? std::uint64_t{0} : r.error(); };
+        EXPECT_EQ(c.concrete ? code(QRNConcreteContainerIdentity::containerIdentityWithUUID(
+                                   c.uuid, c.user, c.identifier, c.cls))
+                             : code(QRNContainerIdentity::containerIdentityWithUserIdentity(
+                                   c.user, c.identifier, c.cls)),
+                  c.code);
         EXPECT_EQ(log_.messages().size(), 1u) << log_.all();
-        EXPECT_TRUE(c.logged ? log_.contains(c.logged) : !log_.contains("uuid")) << log_.all();
+        EXPECT_TRUE(c.logged ? log_.contains(std::string("Invalid object: ") + c.logged)
+                             : !log_.contains("uuid"))
+            << log_.all();
     }
     for (std::uint64_t cls = 1; cls <= 13; ++cls) {
         EXPECT_TRUE(QRNContainerIdentity::containerIdentityWithUserIdentity(u, &str, cls)) << cls;
