@@ -35,7 +35,8 @@ protected:
     }
 };
 
-TEST_F(HandlerGroupsTest, GroupsOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingBadOnes) {
+TEST_F(HandlerGroupsTest,
+       GroupsAndSystemGroupsOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingBadOnes) {
     const Value identifiers = groupRequest(14, "ignored");
     setClient(kVellClient, allowed());
     EXPECT_EQ(*send(identifiers).get("ReplyGroupIdentifiersArray"), Value::array());
@@ -75,9 +76,8 @@ TEST_F(HandlerGroupsTest, GroupsOfAnOwnerAreMadeUnderTheGlobalWriteLockSkippingB
         dictionaryOf({{"com.orvex.private.Quarn.lookup",
                        dictionaryOf({{"appGroup", arrayOf({Value("com.example.owner")})}})}}));
     EXPECT_FALSE(pathIn(send(groupRequest(13, "com.example.owner")), "group.o").empty());
-}
 
-TEST_F(HandlerGroupsTest, SystemGroupsOfAnOwnerAndOneByEntitlementOrWhenOpenToAll) {
+    // System groups of an owner, and one by entitlement or when open to all.
     mapping_->systemGroups[kVellClient] = arrayOf({Value("systemgroup.com.example.one")});
     EXPECT_EQ(pathIn(send(groupRequest(16, kVellClient)), "systemgroup.com.example.one")
                   .parent_path()
@@ -166,9 +166,8 @@ TEST_F(SandboxTokenTest, OnlySandboxedEnterpriseClientsGetTokensAndPersonas) {
 
     extensions_->failing = true;
     EXPECT_EQ(createIn(2, *sandboxed).get("ReplySandboxToken"), nullptr);
-}
 
-TEST_F(SandboxTokenTest, ClientsWithoutAPersonaKeepTheirOwnWhenNoneHoldsTheBundle) {
+    // Clients without a persona keep their own when none holds the bundle.
     auto unspecific =
         client(QRNUserIdentity::initWithUID(kMobileUID, kMobileUID, root_ / "/private/var/mobile",
                                             std::nullopt, kQRNPersonaTypeUnspecific, kMobileUID),
