@@ -17,8 +17,7 @@ using namespace quarn;
 namespace {
 
 Value ids(std::initializer_list<const char*> list) {
-    Value::Array array(list.begin(), list.end());
-    return Value(std::move(array));
+    return Value(Value::Array(list.begin(), list.end()));
 }
 
 enum class Kind { Read, Write, GlobalRead, GlobalWrite };
@@ -238,12 +237,11 @@ TEST_F(QRNLocksTest, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
             drop(locks, op.kind, op.identifiers);
         }
     };
-    std::vector<std::thread> threads;
-    for (unsigned t = 1; t <= 4; ++t) {
-        threads.emplace_back(work, t);
-    }
-    for (auto& t : threads) {
-        t.join();
+    {
+        std::vector<std::jthread> threads;
+        for (unsigned t = 1; t <= 4; ++t) {
+            threads.emplace_back(work, t);
+        }
     }
     EXPECT_EQ(violations, 0);
 }
