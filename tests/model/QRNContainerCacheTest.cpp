@@ -104,7 +104,7 @@ protected:
 // containers without valid metadata are reported. Files of one directory
 // share the work of reading their stored user identity; one that stores
 // another user's is still refused wherever it comes in the listing.
-TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
+TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersReportsTheRestAndFailsWhenUnlistable) {
     auto real = makeContainer(kData, "com.example.uuid");
     makeContainer(kData, "com.orvex.devicesettings", "com.orvex.devicesettings");
     // A link under a container's name is never taken for one.
@@ -137,11 +137,11 @@ TEST_F(QRNContainerCacheTest, ListingKeepsValidContainersAndReportsTheRest) {
     EXPECT_EQ(log_.count("INCONSISTENT"), reported); // nothing in the system classes
     EXPECT_TRUE(log_.contains(fmt::format("INCONSISTENT-No Metadata at: {} for id: {}, class: 2",
                                           empty.string(), empty.filename().string())));
-}
 
-TEST_F(QRNContainerCacheTest, AnUnlistableClassDirectoryFailsTheRebuildAndKeepsNothing) {
+    // A class directory that cannot be listed fails the rebuild and keeps nothing.
+    cache().invalidateUserIdentity(mobile());
     const auto dir = classDirectory(kData);
-    std::filesystem::remove(dir);
+    std::filesystem::remove_all(dir);
     std::ofstream(dir) << "a file where the class directory belongs";
     auto all = cache().allContainersForUserIdentity(mobile(), kData, false);
     ASSERT_FALSE(all);
