@@ -205,8 +205,6 @@ TEST_F(ContainerOperationsTest, QueuedCommandsRunInOrderWhenTheRequestCompletes)
     EXPECT_TRUE(request->completeWithError(error));
     EXPECT_EQ(error, kQRNErrorNone);
     EXPECT_FALSE(fs::exists(made->url()));
-    EXPECT_EQ(connection_->metadataWithContainerIdentity(identity(kClientBundle, kClass)).error(),
-              kQRNErrorContainerNotFound);
     EXPECT_EQ(request->deleteContainerWithContainerIdentity(identity(kClientBundle, kClass), false)
                   .error(),
               kQRNErrorContainerNotFound);

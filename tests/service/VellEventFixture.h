@@ -100,11 +100,6 @@ private:
     }
 };
 
-// An event of `kind` from the connection's peer.
-inline IpcConnection::Event eventOf(IpcConnection::Event::Kind kind, Value body, bool reply) {
-    return {kind, std::move(body), reply};
-}
-
 class VellEventFixture : public CreateFixture {
 protected:
     VellEventFixture() : CreateFixture(false) {
@@ -125,8 +120,7 @@ protected:
     // on the connection for it.
     std::vector<Value> dispatch(const Value& request) {
         const std::size_t before = connection_->replies().size();
-        QRNProcessVellEvent(connection_,
-                            eventOf(IpcConnection::Event::Kind::Message, request, true));
+        QRNProcessVellEvent(connection_, {IpcConnection::Event::Kind::Message, request, true});
         std::vector<Value> replies = connection_->replies();
         return {replies.begin() + static_cast<std::ptrdiff_t>(before), replies.end()};
     }
