@@ -14,7 +14,6 @@
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <future>

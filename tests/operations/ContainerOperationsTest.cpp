@@ -15,7 +15,6 @@
 #include <functional>
 #include <set>
 #include <stdexcept>
-#include <thread>
 
 using namespace quarn;
 using namespace quarn::test;

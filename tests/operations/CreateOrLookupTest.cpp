@@ -16,7 +16,6 @@
 #include <latch>
 #include <set>
 #include <stdexcept>
-#include <thread>
 
 using namespace quarn;
 using namespace quarn::test;

@@ -206,33 +206,31 @@ TEST_F(QRNLocksTest, MixedTrafficKeepsExclusionAndNeverDeadlocks) {
     struct Op {
         Kind kind;
         Value identifiers;
-        std::vector<int> indexes;
+        std::vector<int> slots;
     };
-    const std::vector<Op> ops = {
-        {Kind::Write, ids({"b", "a"}), {0, 1}}, {Kind::Write, ids({"a", "c", "b"}), {0, 1, 2}},
-        {Kind::Read, ids({"c", "a"}), {0, 2}},  {Kind::Write, "c", {2}},
-        {Kind::GlobalRead, {}, {0, 1, 2}},      {Kind::GlobalWrite, {}, {0, 1, 2}}};
+    const std::vector<Op> ops = {{Kind::Write, ids({"b", "a"}), {0, 1, 3}},
+                                 {Kind::Write, ids({"a", "c", "b"}), {0, 1, 2, 3}},
+                                 {Kind::Read, ids({"c", "a"}), {0, 2, 3}},
+                                 {Kind::Write, "c", {2, 3}},
+                                 {Kind::GlobalRead, {}, {0, 1, 2, 3}},
+                                 {Kind::GlobalWrite, {}, {0, 1, 2, 3}}};
     std::array<std::atomic<int>, 4> readers{}, writers{};
     std::atomic<int> violations{0};
     auto work = [&](unsigned seed) {
         std::mt19937 random(seed);
         for (int n = 0; n < 3000; ++n) {
             const Op& op = ops[random() % ops.size()];
-            const bool global = op.kind == Kind::GlobalRead || op.kind == Kind::GlobalWrite;
-            const bool writing = op.kind == Kind::Write || op.kind == Kind::GlobalWrite;
-            std::vector<std::pair<int, bool>> slots; // slot, writing
-            for (int i : op.indexes) {
-                slots.emplace_back(i, writing);
-            }
-            slots.emplace_back(3, global && writing);
+            auto writes = [&op](int slot) {
+                return op.kind == Kind::GlobalWrite || (op.kind == Kind::Write && slot != 3);
+            };
             take(locks, op.kind, op.identifiers);
-            for (auto [slot, w] : slots) {
-                int mine = ++(w ? writers : readers)[slot];
-                violations += w ? mine != 1 || readers[slot] != 0 : writers[slot] != 0;
+            for (int slot : op.slots) {
+                int mine = ++(writes(slot) ? writers : readers)[slot];
+                violations += writes(slot) ? mine != 1 || readers[slot] != 0 : writers[slot] != 0;
             }
             std::this_thread::yield();
-            for (auto [slot, w] : slots) {
-                --(w ? writers : readers)[slot];
+            for (int slot : op.slots) {
+                --(writes(slot) ? writers : readers)[slot];
             }
             drop(locks, op.kind, op.identifiers);
         }

@@ -11,10 +11,6 @@
 #include "Daemon/service/QRNCommandTable.h"
 #include "Daemon/service/QRNVellReply.h"
 
-#include "common/LogCapture.h"
-
-#include <filesystem>
-
 using namespace quarn;
 using namespace quarn::test;
 

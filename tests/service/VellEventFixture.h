@@ -13,8 +13,6 @@
 #include "Daemon/platform/SandboxExtensions.h"
 #include "Daemon/service/QRNVellEvent.h"
 
-#include <unistd.h>
-
 #include <atomic>
 #include <functional>
 #include <map>

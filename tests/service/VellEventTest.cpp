@@ -5,13 +5,9 @@
 #include "VellEventFixture.h"
 
 #include "Daemon/model/QRNContainerClass.h"
-#include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/operations/QRNCommandQueue.h"
 #include "Daemon/service/QRNCommandTable.h"
 #include "Daemon/service/QRNVellReply.h"
-
-#include <filesystem>
-#include <fstream>
 
 using namespace quarn;
 using namespace quarn::test;

@@ -11,7 +11,7 @@ using namespace quarn;
 
 namespace {
 
-TEST(DaemonOptionsTest, DefaultsAndAcceptedValues) {
+TEST(DaemonOptionsTest, DefaultsAcceptedValuesAndWhatStopsAtOnce) {
     auto parsed = QRNDaemonOptions::parse({});
     ASSERT_FALSE(parsed.exitStatus) << parsed.output;
     EXPECT_EQ(parsed.options.root, "/");
@@ -34,9 +34,7 @@ TEST(DaemonOptionsTest, DefaultsAndAcceptedValues) {
         ASSERT_FALSE(parsed.exitStatus) << name << ": " << parsed.output;
         EXPECT_EQ(parsed.options.logLevel, level) << name;
     }
-}
 
-TEST(DaemonOptionsTest, HelpVersionAndBadArgumentsStopAtOnce) {
     auto help = QRNDaemonOptions::parse({"--help"});
     EXPECT_EQ(help.exitStatus, 0);
     EXPECT_NE(help.output.find("--root"), std::string::npos) << help.output;
