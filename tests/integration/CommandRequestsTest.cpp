@@ -13,18 +13,7 @@ namespace {
 using namespace program;
 using Requests = QRNClientRequests;
 
-class CommandRequests : public SharedDaemonTest {
-protected:
-    // Runs `program` and expects one reply per request.
-    static std::vector<Value> repliesOf(std::string_view program,
-                                        const std::vector<Value>& requests) {
-        DaemonHarness::ClientRun run = daemon().runClient(program, requests);
-        EXPECT_EQ(run.replies.size(), requests.size()) << program << ": " << run.failure;
-        EXPECT_TRUE(run.exit && run.exit->exitedWith(0)) << program;
-        run.replies.resize(requests.size());
-        return run.replies;
-    }
-};
+using CommandRequests = SharedDaemonTest;
 
 Value command(std::uint64_t number, Value::Dictionary keys = {}) {
     keys.emplace("Command", number);
@@ -57,7 +46,7 @@ TEST_F(CommandRequests, CreateThenLookUpFindsTheSameContainerWithItsSubdirectori
     for (const auto& c : cases) {
         SCOPED_TRACE(c.containerClass);
         const std::string identifier = "com.orvex.test.created." + std::to_string(c.containerClass);
-        const auto replies = repliesOf(
+        const auto replies = daemon().replies(
             kAllowed, {create(identifier, c.containerClass), create(identifier, c.containerClass)});
         ASSERT_EQ(replyError(replies[0]), kQRNErrorNone) << replies[0].description();
         EXPECT_EQ(at(replies[0], "ReplyExisted"), Value(false));
@@ -104,15 +93,15 @@ TEST_F(CommandRequests, EntitlementsFromTheRegistryAdmitClientsToCommands) {
         {kBadDigest, Requests::containersOfClass(2, false), kQRNErrorNotEntitled},
     };
     for (const auto& c : cases) {
-        const Value reply = repliesOf(c.program, {c.request})[0];
+        const Value reply = daemon().replies(c.program, {c.request})[0];
         EXPECT_EQ(replyError(reply), c.expected)
             << c.program << " " << c.request.description() << " -> " << reply.description();
     }
     EXPECT_TRUE(std::filesystem::is_directory(daemon() / "/private/var/containers/Data/System" /
                                               kWellKnown));
     // No "Identifier": the client's own, as the registry names it.
-    const Value own =
-        repliesOf(kNone, {command(0, {{"ContainerClass", 2u}, {"CreateIfNecessary", true}})})[0];
+    const Value own = daemon().replies(
+        kNone, {command(0, {{"ContainerClass", 2u}, {"CreateIfNecessary", true}})})[0];
     EXPECT_EQ(at(own, "ReplyIdentifier"), Value(identifierOf(kNone))) << own.description();
 }
 
@@ -120,7 +109,7 @@ TEST_F(CommandRequests, CommandsReplyingFromTheirCompletionReplyOnce) {
     const std::string identifier = "com.orvex.test.death-row";
     // Deleted, so that death row holds something when the pass runs; a
     // second reply to 4 or 21 would show up as the reply to the next request.
-    const auto replies = repliesOf(
+    const auto replies = daemon().replies(
         kAllowed, {create(identifier), Requests::deleteContainer(identifier, 2, false),
                    Requests::deleteContainersOnDeathRow(), command(32),
                    command(21, {{"Identifier", identifier}, {"ContainerClass", 2u}}), command(32)});

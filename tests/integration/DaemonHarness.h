@@ -55,30 +55,29 @@ constexpr std::chrono::seconds kWaitLimit{30};
 // Polls `condition` until it holds or the limit has passed; answers its last value.
 inline bool waitUntil(const std::function<bool()>& condition) {
     const auto deadline = std::chrono::steady_clock::now() + kWaitLimit;
-    while (!condition()) {
+    for (; !condition(); std::this_thread::sleep_for(std::chrono::milliseconds(10))) {
         if (std::chrono::steady_clock::now() >= deadline) {
             return condition();
         }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return true;
 }
 
 class DaemonHarness {
 public:
-    // What one run of a client copy printed.
-    struct ClientRun {
-        std::vector<Value> replies;
-        std::string failure; // the client's "!" line, or why its output was unreadable
-        std::optional<ChildProcess::Exit> exit; // none: it did not end
-    };
-
     DaemonHarness() {
         root_.writeFile("/etc/os-release", "ID=quarnos\nVERSION_ID=1.0\nBUILD_ID=1A100\n"
                                            "VARIANT_ID=internal\n");
         writeRegistry(Paths(root()).configDirectory() / "codesign.d");
     }
     DaemonHarness(const DaemonHarness&) = delete;
+    // A daemon still running must stop cleanly; a failed test shows the run's log.
+    ~DaemonHarness() {
+        expectCleanStop();
+        if (::testing::Test::HasFailure()) {
+            std::cerr << "---- quarnd stderr ----\n" << log() << "----\n";
+        }
+    }
 
     const std::filesystem::path& root() const { return root_.path(); }
     std::filesystem::path operator/(std::string_view absolute) const { return root_ / absolute; }
@@ -108,17 +107,15 @@ public:
                daemon_->isRunning();
     }
     bool isRunning() const { return daemon_ && daemon_->isRunning(); }
-    // SIGTERM, then fails the calling test unless the daemon exits with status 0.
+    // SIGTERM to a running daemon, which must then exit with status 0.
     void expectCleanStop() {
-        if (!daemon_) {
+        if (!isRunning()) {
             return;
         }
         daemon_->signal(SIGTERM);
         const auto exit = daemon_->waitFor(kWaitLimit);
         EXPECT_TRUE(exit && exit->exitedWith(0))
-            << "quarnd did not stop cleanly on SIGTERM: "
-            << (exit ? exit->description() : "still running") << "\n"
-            << log();
+            << "quarnd did not stop cleanly: " << (exit ? exit->description() : "running");
     }
 
     // The daemon's stderr of the current run (debug level), from byte `from` on.
@@ -129,34 +126,31 @@ public:
     }
     std::size_t logSize() const { return log().size(); }
 
-    // Runs the client copy `program` with `requests` on one connection.
-    ClientRun runClient(std::string_view program, const std::vector<Value>& requests) const {
-        ChildProcess::Launch launch{.program = clients() / program,
-                                    .arguments = {"--socket", socketPath().string()},
-                                    .environment = {},
-                                    .stdoutFile =
-                                        clients() / ("run-" + std::to_string(++clientRuns_)),
-                                    .stderrFile = {}};
+    // Runs the client copy `program` with `requests` on one connection;
+    // fails the calling test unless it answers each and exits with 0.
+    std::vector<Value> replies(std::string_view program, const std::vector<Value>& requests) const {
+        const std::filesystem::path out = clients() / ("run-" + std::to_string(++clientRuns_));
+        std::vector<std::string> arguments{"--socket", socketPath().string()};
         for (const Value& request : requests) {
-            launch.arguments.push_back(HexCbor::encode(request));
+            arguments.push_back(HexCbor::encode(request));
         }
-        ClientRun run;
-        auto child = ChildProcess::spawn(launch);
-        if (!child) {
-            run.failure = child.error().description();
-            return run;
-        }
-        run.exit = child->waitFor(kWaitLimit);
-        std::ifstream out(launch.stdoutFile);
-        for (std::string line; run.failure.empty() && std::getline(out, line);) {
+        auto child = ChildProcess::spawn({.program = clients() / program,
+                                          .arguments = arguments,
+                                          .environment = {},
+                                          .stdoutFile = out,
+                                          .stderrFile = {}});
+        const auto exit = child ? child->waitFor(kWaitLimit) : std::nullopt;
+        EXPECT_TRUE(exit && exit->exitedWith(0)) << program;
+        std::vector<Value> replies;
+        std::ifstream in(out);
+        for (std::string line; std::getline(in, line);) {
             auto reply = HexCbor::decode(line);
-            if (line.starts_with('!') || !reply) {
-                run.failure = line;
-            } else {
-                run.replies.push_back(std::move(*reply));
-            }
+            EXPECT_TRUE(reply) << program << ": " << line;
+            replies.push_back(reply ? *reply : Value());
         }
-        return run;
+        EXPECT_EQ(replies.size(), requests.size()) << program;
+        replies.resize(requests.size());
+        return replies;
     }
     // A connection of the test binary, which the registry grants "allowed".
     Result<QRNClient> connect() const {
@@ -190,7 +184,8 @@ private:
         sodium_bin2hex(hex, sizeof hex, digest, sizeof digest);
         using namespace program;
         const Value lookup(Value::Dictionary{{"appData", Value::Array{identifierOf(kAllowed)}}});
-        // Name, entitlements (none: no entry) and digest (empty: no entry).
+        // Name, entitlements (none: no entry) and digest (empty: no entry);
+        // the test binary itself too, so that the test's threads can talk to the daemon.
         const std::tuple<std::string_view, Value, std::string> programs[] = {
             {kAllowed, grant("allowed", true), hex},
             {kNone, Value(), ""},
@@ -199,15 +194,16 @@ private:
             {kWipeArray, grant("wipeContainer", Value::Array{identifierOf(kWipeArray)}), ""},
             {kTestability, grant("testability", true), ""},
             {kBadDigest, grant("allowed", true), std::string(64, '0')},
+            {"integration", grant("allowed", true), ""},
         };
         for (const auto& [name, entitlements, sha256] : programs) {
-            const std::filesystem::path copy = clients() / name;
-            if (::link(QUARN_TEST_CLIENT_PATH, copy.c_str()) != 0) {
-                // Another file system: a copy is a program of its own path just as well.
-                std::filesystem::copy_file(QUARN_TEST_CLIENT_PATH, copy);
-                std::filesystem::permissions(copy, std::filesystem::perms::owner_all);
+            std::filesystem::path program = std::filesystem::read_symlink("/proc/self/exe");
+            if (name != "integration") {
+                program = clients() / name;
+                std::filesystem::create_hard_link(QUARN_TEST_CLIENT_PATH, program);
             }
-            Value::Dictionary entry{{"Program", copy.string()}, {"Identifier", identifierOf(name)}};
+            Value::Dictionary entry{{"Program", program.string()},
+                                    {"Identifier", identifierOf(name)}};
             if (!entitlements.isNone()) {
                 entry.emplace("Entitlements", entitlements);
             }
@@ -217,13 +213,6 @@ private:
             EXPECT_TRUE(
                 QRN_writeToURL(Value(std::move(entry)), registry / (std::string(name) + ".plist")));
         }
-        // The test binary itself, so that the test's threads can talk to the daemon directly.
-        EXPECT_TRUE(QRN_writeToURL(
-            Value(Value::Dictionary{
-                {"Program", std::filesystem::read_symlink("/proc/self/exe").string()},
-                {"Identifier", "com.orvex.test.integration"},
-                {"Entitlements", grant("allowed", true)}}),
-            registry / "test-binary.plist"));
     }
 
     ScratchRoot root_{{.withMobileUser = true, .installContext = false}, "quarn-it"};
@@ -234,19 +223,15 @@ private:
 };
 
 // A test suite sharing one daemon: started before the suite's first test,
-// stopped after its last, when it must exit with status 0. Each test fails
-// when the daemon is gone at its end, and shows the daemon's log of that
-// test when it failed.
+// stopped (cleanly) after its last. Each test fails when the daemon is gone
+// at its end, and shows the daemon's log of that test when it failed.
 class SharedDaemonTest : public ::testing::Test {
 protected:
     static void SetUpTestSuite() {
         harness_ = std::make_unique<DaemonHarness>();
-        EXPECT_TRUE(harness_->start()) << "quarnd did not start\n" << harness_->log();
+        EXPECT_TRUE(harness_->start()) << "quarnd did not start";
     }
-    static void TearDownTestSuite() {
-        harness_->expectCleanStop();
-        harness_.reset();
-    }
+    static void TearDownTestSuite() { harness_.reset(); }
     void SetUp() override {
         ASSERT_TRUE(harness_->isRunning()) << "quarnd is not running";
         logStart_ = harness_->logSize();
