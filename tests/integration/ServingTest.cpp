@@ -81,33 +81,26 @@ TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
         std::string name;
         std::vector<std::uint8_t> bytes;
         After after;
-        std::vector<std::uint64_t> replies; // the expected codes, in order
-        const char* closesWith;             // null: the daemon keeps the connection
+        std::vector<std::uint64_t> replies; // the expected codes, in order; none: closed
     } cases[] = {
-        {"truncated header", {0x10, 0x00, 0x00}, kShutdownWrite, {}, ""},
-        {"truncated body, gone", raw(100, kReply, {0xa1, 0x67}), kHangUp, {}, nullptr},
-        {"over 1 MiB", raw((1u << 20) + 1, kReply, {}), kWait, {}, "over the limit"},
-        {"reserved flag bits", raw(size, 0x03, body), kWait, {}, "reserved bits"},
-        {"not CBOR", raw(3, kReply, {0xff, 0xfe, 0x13}), kWait, {}, "does not decode"},
-        {"not a map", frame(Value(Value::Array{0u})), kWait, {}, "not a dictionary"},
-        {"nesting 33 deep", frame(nested(33)), kWait, {}, "nest deeper than 32"},
-        {"reply flag clear",
-         FrameSocket::frame(normal, 0),
-         kWait,
-         {},
-         "does not have reply context"},
-        {"exactly 1 MiB", frame(padded(1u << 20)), kWait, {kQRNErrorNone}, nullptr},
-        {"nesting 32 deep", frame(nested(32)), kWait, {kQRNErrorNone}, nullptr},
-        {"unknown keys", frame(unknownKeys), kWait, {kQRNErrorNone}, nullptr},
+        {"truncated header", {0x10, 0x00, 0x00}, kShutdownWrite, {}},
+        {"truncated body, gone", raw(100, kReply, {0xa1, 0x67}), kHangUp, {}},
+        {"over 1 MiB", raw((1u << 20) + 1, kReply, {}), kWait, {}},
+        {"reserved flag bits", raw(size, 0x03, body), kWait, {}},
+        {"not CBOR", raw(3, kReply, {0xff, 0xfe, 0x13}), kWait, {}},
+        {"not a map", frame(Value(Value::Array{0u})), kWait, {}},
+        {"nesting 33 deep", frame(nested(33)), kWait, {}},
+        {"reply flag clear", FrameSocket::frame(normal, 0), kWait, {}},
+        {"exactly 1 MiB", frame(padded(1u << 20)), kWait, {kQRNErrorNone}},
+        {"nesting 32 deep", frame(nested(32)), kWait, {kQRNErrorNone}},
+        {"unknown keys", frame(unknownKeys), kWait, {kQRNErrorNone}},
         {"two requests in one write",
          twoRequests,
          kWait,
-         {kQRNErrorNone, kQRNErrorUnexpectedContainerType},
-         nullptr},
+         {kQRNErrorNone, kQRNErrorUnexpectedContainerType}},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
-        const std::size_t logStart = daemon().logSize();
         Descriptor connection(FrameSocket::connectTo(daemon().socketPath()));
         // Every read ends by the limit: a silent daemon fails the test, not hangs it.
         const timeval limit{.tv_sec = kWaitLimit.count(), .tv_usec = 0};
@@ -124,11 +117,11 @@ TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
             ASSERT_TRUE(reply && reply->message) << "no reply";
             EXPECT_EQ(replyError(*reply->message), expected) << reply->message->description();
         }
-        if (c.closesWith) {
+        // Refused frames end their connection; a hang-up has none left.
+        if (c.replies.empty() && c.after != kHangUp) {
             std::uint8_t byte = 0;
             const ssize_t n = ::recv(connection.get(), &byte, 1, 0);
             EXPECT_TRUE(n == 0 || (n < 0 && errno == ECONNRESET)) << "still open";
-            EXPECT_NE(daemon().log(logStart).find(c.closesWith), std::string::npos);
         }
         // Whatever that connection did, the next client is served.
         expectServed();
