@@ -4,7 +4,8 @@
 // the root-owned directory "<root>/etc/quarnd/codesign.d" of property lists
 // with the keys "Program" (absolute path of the executable as the kernel
 // reports it), "SHA256" (optional hex digest of it), "Identifier",
-// "Entitlements" (dictionary) and "Sandboxed" (boolean).
+// "Entitlements" (dictionary), "EntitledUsers" and "EntitledGroups" (who may
+// hold them; root only without either) and "Sandboxed" (boolean).
 
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/support/Value.h"
@@ -19,7 +20,8 @@ namespace quarn {
 
 struct CodeSigningInfo {
     std::string identifier;
-    // None when the entry has no "Entitlements" or they are no dictionary.
+    // None when the entry has no "Entitlements"; an empty dictionary when
+    // they are no dictionary or the process may not hold them.
     std::optional<Value> entitlements;
     bool sandboxed = false;
 };

@@ -104,12 +104,21 @@ bool readOptionalKeys(const Value& plist, CodeSigningRegistryEntry& entry, std::
         }
     }
     if (const Value* entitlements = plist.get("Entitlements")) {
+        // The program is still the one named: it keeps its identifier, without rights.
         if (!entitlements->isDictionary()) {
-            problem = "\"Entitlements\" is not a dictionary";
-            return false;
+            QRN_LOG_ERROR(LogCategory::Unspecified,
+                          "Code-signing entry {}: \"Entitlements\" is a {}, not a dictionary; "
+                          "the program gets none",
+                          entry.fileName, entitlements->kindName());
         }
-        entry.info.entitlements = *entitlements;
+        entry.info.entitlements =
+            entitlements->isDictionary() ? *entitlements : Value::dictionary();
     }
+    auto holders = EntitlementHolders::fromPropertyList(plist, problem);
+    if (!holders) {
+        return false;
+    }
+    entry.holders = std::move(*holders);
     if (const Value* sandboxed = plist.get("Sandboxed")) {
         if (!sandboxed->asBool()) {
             problem = "\"Sandboxed\" is not a boolean";

@@ -5,6 +5,7 @@
 // later file wins.
 
 #include "Daemon/platform/CodeSigningRegistry.h"
+#include "Daemon/platform/EntitlementHolders.h"
 #include "Daemon/platform/ExecutableDigestCache.h"
 
 #include <filesystem>
@@ -21,6 +22,7 @@ struct CodeSigningRegistryEntry {
     std::string program;
     std::optional<ExecutableDigestCache::Digest> sha256;
     CodeSigningInfo info;
+    EntitlementHolders holders;
     std::string fileName; // for log lines
 };
 

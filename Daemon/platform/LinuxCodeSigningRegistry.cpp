@@ -1,5 +1,6 @@
 #include "Daemon/platform/LinuxCodeSigningRegistry.h"
 
+#include "Daemon/platform/ProcessInfo.h"
 #include "Daemon/support/Descriptor.h"
 #include "Daemon/support/Log.h"
 
@@ -9,6 +10,7 @@
 #include <unistd.h>
 
 #include <climits>
+#include <cstring>
 
 namespace quarn {
 
@@ -37,11 +39,28 @@ bool isSameProcess(pid_t pid, std::uint32_t startTime) {
     return now && static_cast<std::uint32_t>(*now) == startTime;
 }
 
+Expected<EntitlementHolders::Process, int> processOf(pid_t pid) {
+    auto process = ProcessInfo::open(pid);
+    if (!process) {
+        return Unexpected<int>(process.error());
+    }
+    auto standing = process->standing();
+    if (!standing) {
+        return Unexpected<int>(standing.error());
+    }
+    auto injection = process->loaderInjection();
+    if (!injection) {
+        return Unexpected<int>(injection.error());
+    }
+    return EntitlementHolders::Process{std::move(*standing), std::move(*injection)};
+}
+
 } // namespace
 
-LinuxCodeSigningRegistry::LinuxCodeSigningRegistry(const Paths& paths)
-    : directory_(paths.configDirectory() / "codesign.d"), monitor_(directory_),
-      table_(std::make_shared<const CodeSigningRegistryLoader::Table>()) {
+LinuxCodeSigningRegistry::LinuxCodeSigningRegistry(const Paths& paths,
+                                                   std::shared_ptr<const Accounts> accounts)
+    : directory_(paths.configDirectory() / "codesign.d"), accounts_(std::move(accounts)),
+      monitor_(directory_), table_(std::make_shared<const CodeSigningRegistryLoader::Table>()) {
     // The library wants this before any other call; repeating it is harmless.
     [[maybe_unused]] static const int sodiumReady = sodium_init();
 }
@@ -121,6 +140,29 @@ bool LinuxCodeSigningRegistry::digestMatches(const CodeSigningRegistryEntry& ent
     return true;
 }
 
+// Read only for entries that grant something: most clients are apps
+// without entitlements, and /proc reads are the dearest part of identifying one.
+Value LinuxCodeSigningRegistry::entitlementsFor(const CodeSigningRegistryEntry& entry,
+                                                pid_t pid) const {
+    const std::optional<Value>& granted = entry.info.entitlements;
+    if (!granted || granted->size() == 0) {
+        return granted ? *granted : Value();
+    }
+    std::string why;
+    if (auto process = processOf(pid); !process) {
+        why = fmt::format("its /proc entries cannot be read ({})", std::strerror(process.error()));
+    } else if (auto refused = entry.holders.refusal(*process, *accounts_)) {
+        why = std::move(*refused);
+    } else {
+        return *granted;
+    }
+    QRN_LOG_NOTICE(LogCategory::Vell,
+                   "pid {} runs {} of code-signing entry {} without its "
+                   "entitlements: {}",
+                   pid, entry.program, entry.fileName, why);
+    return Value::dictionary();
+}
+
 std::optional<CodeSigningInfo>
 LinuxCodeSigningRegistry::infoForAuditToken(const IpcPeer::AuditToken& token) {
     const IpcPeer::TokenFields fields = IpcPeer::fieldsOfAuditToken(token);
@@ -148,10 +190,14 @@ LinuxCodeSigningRegistry::infoForAuditToken(const IpcPeer::AuditToken& token) {
     // still match now is the one whose executable was read, since a pid is
     // never given back to a process that has ended. (Each check reads
     // /proc/<pid>/stat, the dearest step of a request.)
+    CodeSigningInfo info = entry.info;
+    if (info.entitlements) {
+        info.entitlements = entitlementsFor(entry, pid);
+    }
     if (!isSameProcess(pid, fields.startTime)) {
         return std::nullopt;
     }
-    return entry.info;
+    return info;
 }
 
 } // namespace quarn

@@ -4,8 +4,10 @@
 // the host, whatever the root prefix), which must be the very file at that
 // path in the daemon's view, and, when the entry carries a digest, by the
 // SHA-256 of that file. The directory is reread when it changes;
-// the check is a non-blocking poll at each lookup.
+// the check is a non-blocking poll at each lookup. An entry's entitlements
+// go only to the processes its holders admit (see EntitlementHolders).
 
+#include "Daemon/platform/Accounts.h"
 #include "Daemon/platform/CodeSigningRegistry.h"
 #include "Daemon/platform/CodeSigningRegistryLoader.h"
 #include "Daemon/platform/DirectoryChangeMonitor.h"
@@ -20,7 +22,8 @@ namespace quarn {
 
 class LinuxCodeSigningRegistry final : public CodeSigningRegistry {
 public:
-    explicit LinuxCodeSigningRegistry(const Paths& paths);
+    // `accounts` names the entries' entitled users and groups.
+    LinuxCodeSigningRegistry(const Paths& paths, std::shared_ptr<const Accounts> accounts);
 
     std::optional<CodeSigningInfo> infoForAuditToken(const IpcPeer::AuditToken& token) override;
     // Bumped by every reread of the directory.
@@ -40,10 +43,13 @@ private:
     TablePtr currentTable();
     // `exe` is an open descriptor of the process's running executable.
     static bool isRegisteredFile(const CodeSigningRegistryEntry& entry, pid_t pid, int exe);
+    // The entry's entitlements, or none when the process may not hold them.
+    Value entitlementsFor(const CodeSigningRegistryEntry& entry, pid_t pid) const;
     bool digestMatches(const CodeSigningRegistryEntry& entry, pid_t pid, std::uint32_t startTime,
                        int exe);
 
     std::filesystem::path directory_;
+    const std::shared_ptr<const Accounts> accounts_;
     ExecutableDigestCache digests_;
 
     // Serialises rereading: guards monitor_'s consumption and the reads of

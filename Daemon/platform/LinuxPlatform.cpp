@@ -21,7 +21,8 @@ namespace quarn {
 void installLinuxPlatform(QRNDaemonContext& context) {
     const Paths paths(context.rootPrefix());
     context.install(std::make_shared<Paths>(paths));
-    context.install<Accounts>(std::make_shared<LinuxAccounts>(paths));
+    const auto accounts = std::make_shared<LinuxAccounts>(paths);
+    context.install<Accounts>(accounts);
     context.install<OsVariant>(std::make_shared<LinuxOsVariant>(paths));
     context.install<Features>(std::make_shared<LinuxFeatures>(paths));
     context.install<HostConfig>(std::make_shared<LinuxHostConfig>(paths));
@@ -29,7 +30,8 @@ void installLinuxPlatform(QRNDaemonContext& context) {
     context.install<ContainerLibrary>(std::make_shared<LinuxContainerLibrary>());
     context.install<SandboxKernel>(std::make_shared<InMemorySandboxKernel>());
     context.install<Notifications>(std::make_shared<LinuxNotifications>(paths));
-    context.install<CodeSigningRegistry>(std::make_shared<LinuxCodeSigningRegistry>(paths));
+    context.install<CodeSigningRegistry>(
+        std::make_shared<LinuxCodeSigningRegistry>(paths, accounts));
     context.install<SandboxExtensions>(std::make_shared<LinuxSandboxExtensions>(paths));
     context.install(std::make_shared<FirstBootMarker>(paths.rootPrefix()));
 }

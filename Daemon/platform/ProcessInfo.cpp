@@ -12,8 +12,12 @@ namespace quarn {
 
 namespace {
 
-// "status" grows with the supplementary groups; the lines read here come first.
-constexpr std::size_t kMaxFileBytes = 64 * 1024;
+// The kernel caps argument and environment strings together near a quarter
+// of the stack limit; a larger environment is not read to its end.
+constexpr std::size_t kMaxEnvironmentBytes = 4 * 1024 * 1024;
+// Each makes the dynamic loader map code of the caller's choice into a
+// program before its main runs.
+constexpr std::string_view kLoaderVariables[] = {"LD_PRELOAD=", "LD_AUDIT=", "LD_LIBRARY_PATH="};
 // Fields after the ')' that ends the command name start with field 3 (state).
 constexpr std::size_t kStartTimeIndexAfterName = 22 - 3;
 
@@ -89,14 +93,14 @@ Expected<ProcessInfo, int> ProcessInfo::open(pid_t pid) {
     return ProcessInfo(std::make_shared<Descriptor>(fd));
 }
 
-Expected<std::string, int> ProcessInfo::read(const char* name) const {
+Expected<std::string, int> ProcessInfo::read(const char* name, std::size_t maxBytes) const {
     Descriptor file(::openat(directory_->get(), name, O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
     if (!file.valid()) {
         return Unexpected<int>(errno);
     }
     std::string contents;
     char chunk[4096];
-    while (contents.size() < kMaxFileBytes) {
+    while (contents.size() < maxBytes) {
         const ssize_t n = ::read(file.get(), chunk, sizeof chunk);
         if (n < 0 && errno == EINTR) {
             continue;
@@ -141,6 +145,26 @@ Expected<std::uint32_t, int> ProcessInfo::loginUID() const {
     return parsed ? Expected<std::uint32_t, int>(*parsed) : Unexpected<int>(EPROTO);
 }
 
+Expected<ProcessInfo::Standing, int> ProcessInfo::standing() const {
+    auto status = read("status");
+    if (!status) {
+        return Unexpected<int>(status.error());
+    }
+    const auto parsed = parseStanding(*status);
+    return parsed ? Expected<Standing, int>(*parsed) : Unexpected<int>(EPROTO);
+}
+
+Expected<std::string, int> ProcessInfo::loaderInjection() const {
+    auto environ = read("environ", kMaxEnvironmentBytes + 1);
+    if (!environ) {
+        return Unexpected<int>(environ.error());
+    }
+    if (environ->size() > kMaxEnvironmentBytes) {
+        return Unexpected<int>(EFBIG);
+    }
+    return findLoaderInjection(*environ);
+}
+
 std::optional<std::uint64_t> ProcessInfo::parseStartTime(std::string_view stat) {
     // The command name may hold blanks and parentheses; it ends at the last ')'.
     const auto close = stat.rfind(')');
@@ -168,6 +192,58 @@ std::optional<std::uint32_t> ProcessInfo::parseLoginUID(std::string_view text) {
         text.remove_suffix(1);
     }
     return parseDecimal<std::uint32_t>(text);
+}
+
+std::optional<ProcessInfo::Standing> ProcessInfo::parseStanding(std::string_view status) {
+    const auto ids = parseIds(status);
+    if (!ids) {
+        return std::nullopt;
+    }
+    Standing standing;
+    standing.effectiveUID = ids->effectiveUID;
+    standing.effectiveGID = ids->effectiveGID;
+    bool sawTracer = false;
+    bool sawGroups = false;
+    for (std::size_t at = 0; at < status.size();) {
+        const auto end = std::min(status.find('\n', at), status.size());
+        const auto line = status.substr(at, end - at);
+        at = end + 1;
+        if (line.starts_with("TracerPid:")) {
+            const auto fields = splitWhitespace(line.substr(10));
+            const auto tracer = fields.size() == 1 ? parseDecimal<pid_t>(fields[0]) : std::nullopt;
+            if (!tracer) {
+                return std::nullopt;
+            }
+            standing.tracer = *tracer;
+            sawTracer = true;
+        } else if (line.starts_with("Groups:")) {
+            for (const auto field : splitWhitespace(line.substr(7))) {
+                const auto gid = parseDecimal<std::uint32_t>(field);
+                if (!gid) {
+                    return std::nullopt;
+                }
+                standing.groups.push_back(*gid);
+            }
+            sawGroups = true;
+        }
+    }
+    // Without either line nothing tells whether the process may be trusted.
+    return sawTracer && sawGroups ? std::optional<Standing>(std::move(standing)) : std::nullopt;
+}
+
+std::string ProcessInfo::findLoaderInjection(std::string_view environ) {
+    for (std::size_t at = 0; at < environ.size();) {
+        const auto end = std::min(environ.find('\0', at), environ.size());
+        const auto variable = environ.substr(at, end - at);
+        at = end + 1;
+        for (const std::string_view name : kLoaderVariables) {
+            // An empty value loads nothing.
+            if (variable.starts_with(name) && variable.size() > name.size()) {
+                return std::string(name.substr(0, name.size() - 1));
+            }
+        }
+    }
+    return {};
 }
 
 } // namespace quarn

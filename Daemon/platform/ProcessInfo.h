@@ -16,6 +16,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace quarn {
 
@@ -26,6 +27,13 @@ public:
         std::uint32_t effectiveUID = 0;
         std::uint32_t realGID = 0;
         std::uint32_t effectiveGID = 0;
+    };
+    // What decides whether a process may hold entitlements, from "status".
+    struct Standing {
+        std::uint32_t effectiveUID = 0;
+        std::uint32_t effectiveGID = 0;
+        std::vector<std::uint32_t> groups; // supplementary
+        pid_t tracer = 0;                  // 0 when nothing traces it
     };
     // The login uid of a process no login session owns.
     static constexpr std::uint32_t kNoLoginUID = 0xFFFFFFFF;
@@ -39,16 +47,28 @@ public:
     Expected<Ids, int> ids() const;
     // "loginuid"; kNoLoginUID when the kernel keeps none.
     Expected<std::uint32_t, int> loginUID() const;
+    Expected<Standing, int> standing() const;
+    // The first variable of the initial environment that makes the dynamic
+    // loader run code the program did not name ("LD_PRELOAD=..."), or ""
+    // when there is none. An environment too large to read whole counts as
+    // one (EFBIG).
+    Expected<std::string, int> loaderInjection() const;
 
     // Parsers of the file contents; none for anything malformed.
     static std::optional<std::uint64_t> parseStartTime(std::string_view stat);
     static std::optional<Ids> parseIds(std::string_view status);
     static std::optional<std::uint32_t> parseLoginUID(std::string_view text);
+    static std::optional<Standing> parseStanding(std::string_view status);
+    // Over the NUL-separated "environ".
+    static std::string findLoaderInjection(std::string_view environ);
 
 private:
     explicit ProcessInfo(std::shared_ptr<Descriptor> directory)
         : directory_(std::move(directory)) {}
-    Expected<std::string, int> read(const char* name) const;
+    Expected<std::string, int> read(const char* name, std::size_t maxBytes = kMaxFileBytes) const;
+
+    // "status" grows with the supplementary groups; the lines read first come first.
+    static constexpr std::size_t kMaxFileBytes = 64 * 1024;
 
     std::shared_ptr<Descriptor> directory_;
 };

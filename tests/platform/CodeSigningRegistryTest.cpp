@@ -1,5 +1,8 @@
 #include "Daemon/platform/CodeSigningRegistryLoader.h"
+#include "Daemon/platform/EntitlementHolders.h"
+#include "Daemon/platform/LinuxAccounts.h"
 #include "Daemon/platform/LinuxCodeSigningRegistry.h"
+#include "Daemon/platform/ProcessInfo.h"
 #include "Daemon/support/Descriptor.h"
 #include "Daemon/support/PropertyList.h"
 
@@ -55,7 +58,7 @@ protected:
     const std::string self_ = std::filesystem::read_symlink("/proc/self/exe").string();
     Paths paths_{root_.path()};
     std::filesystem::path directory_ = paths_.configDirectory() / "codesign.d";
-    LinuxCodeSigningRegistry registry_{paths_};
+    LinuxCodeSigningRegistry registry_{paths_, std::make_shared<LinuxAccounts>(paths_)};
 
     void write(const std::string& name, const Value& plist) const {
         std::filesystem::create_directories(directory_);
@@ -169,6 +172,7 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     write("c-short-digest.plist", with(entry("/bin/c", "c"), "SHA256", std::string(63, 'a')));
     write("d-bad-digest.plist", with(entry("/bin/d", "d"), "SHA256", std::string(64, 'g')));
     write("e-entitlements.plist", with(entry("/bin/e", "e"), "Entitlements", Value::array()));
+    write("e-holders.plist", with(entry("/bin/e2", "e2"), "EntitledUsers", "root"));
     write("f-sandboxed.plist", with(entry("/bin/f", "f"), "Sandboxed", "true"));
     write("g-group-writable.plist", entry("/bin/g", "g"));
     ::chmod((directory_ / "g-group-writable.plist").c_str(), 0664);
@@ -182,10 +186,12 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     std::filesystem::create_symlink(directory_ / "good-2.plist", directory_ / "j-link.plist");
 
     const auto table = CodeSigningRegistryLoader::load(directory_, true);
-    ASSERT_EQ(table.size(), 1u);
+    ASSERT_EQ(table.size(), 2u);
     EXPECT_EQ(table.at("/bin/good")->info.identifier, "com.orvex.good"); // the later file
+    // Entitlements of the wrong type still name the program, with no rights.
+    EXPECT_EQ(table.at("/bin/e")->info.entitlements, Value::dictionary());
     // Not as root, ownership and mode do not matter.
-    EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 3u);
+    EXPECT_EQ(CodeSigningRegistryLoader::load(directory_, false).size(), 4u);
 }
 
 TEST_F(CodeSigningRegistryTest, DigestCacheHashesARewrittenFileAgain) {
@@ -207,4 +213,141 @@ TEST_F(CodeSigningRegistryTest, DigestCacheHashesARewrittenFileAgain) {
     const timespec times[2] = {before.st_atim, before.st_mtim};
     ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
     EXPECT_EQ(digestNow(), sha256Hex("other version"));
+}
+
+namespace {
+
+// Accounts of a test: "mobile" 501/501, group "staff" 20.
+class TestAccounts final : public Accounts {
+public:
+    std::optional<User> userByName(std::string_view name) const override {
+        return name == "mobile" ? std::optional<User>(User{"mobile", 501, 501, {}}) : std::nullopt;
+    }
+    std::optional<User> userByUID(std::uint32_t uid) const override {
+        return uid == 501 ? userByName("mobile") : std::nullopt;
+    }
+    std::optional<Group> groupByName(std::string_view name) const override {
+        return name == "staff" ? std::optional<Group>(Group{"staff", 20, {}}) : std::nullopt;
+    }
+    std::optional<Group> groupByGID(std::uint32_t gid) const override {
+        return gid == 20 ? groupByName("staff") : std::nullopt;
+    }
+};
+
+ProcessInfo::Standing standing(std::uint32_t uid, std::uint32_t gid,
+                               std::vector<std::uint32_t> groups = {}, pid_t tracer = 0) {
+    return {uid, gid, std::move(groups), tracer};
+}
+
+} // namespace
+
+TEST(EntitlementHolders, AdmitRootOnlyUnlessNamedAndNeverATracedOrPreloadedProcess) {
+    const Value none = Value::dictionary();
+    const Value users = Value(Value::Dictionary{{"EntitledUsers", Value::Array{"mobile", 0u}}});
+    const Value groups = Value(Value::Dictionary{{"EntitledGroups", Value::Array{"staff"}}});
+    const Value byNumber = Value(Value::Dictionary{{"EntitledUsers", Value::Array{502u}}});
+    const struct {
+        const char* what;
+        const Value& keys;
+        ProcessInfo::Standing standing;
+        std::string injection;
+        bool admitted;
+    } rows[] = {
+        {"root by default", none, standing(0, 0), "", true},
+        {"a user by default", none, standing(501, 501), "", false},
+        {"a root group is no root user", none, standing(501, 0, {0}), "", false},
+        {"a named user", users, standing(501, 501), "", true},
+        {"root when named", users, standing(0, 0), "", true},
+        {"a user not named", users, standing(502, 502), "", false},
+        {"a user by number", byNumber, standing(502, 502), "", true},
+        {"named groups replace root", groups, standing(0, 0), "", false},
+        {"a supplementary group", groups, standing(501, 501, {7, 20}), "", true},
+        {"the effective group", groups, standing(501, 20), "", true},
+        {"traced root", none, standing(0, 0, {}, 4242), "", false},
+        {"preloaded root", none, standing(0, 0), "LD_PRELOAD", false},
+        {"audited named user", users, standing(501, 501), "LD_AUDIT", false},
+    };
+    const TestAccounts accounts;
+    for (const auto& row : rows) {
+        std::string problem;
+        const auto holders = EntitlementHolders::fromPropertyList(row.keys, problem);
+        ASSERT_TRUE(holders) << row.what << ": " << problem;
+        const auto refusal = holders->refusal({row.standing, row.injection}, accounts);
+        EXPECT_EQ(!refusal, row.admitted) << row.what << ": " << refusal.value_or("");
+    }
+    for (const Value& bad : {Value(Value::Dictionary{{"EntitledUsers", "mobile"}}),
+                             Value(Value::Dictionary{{"EntitledGroups", Value::Array{-1}}}),
+                             Value(Value::Dictionary{{"EntitledUsers", Value::Array{""}}})}) {
+        std::string problem;
+        EXPECT_FALSE(EntitlementHolders::fromPropertyList(bad, problem)) << bad.description();
+        EXPECT_NE(problem, "");
+    }
+}
+
+TEST(ProcessInfoParsing, StandingAndLoaderInjection) {
+    const auto parsed = ProcessInfo::parseStanding(
+        "Name:\tx\nUid:\t0\t501\t0\t0\nGid:\t1\t20\t1\t1\nGroups:\t4 24 \nTracerPid:\t77\n");
+    ASSERT_TRUE(parsed);
+    EXPECT_EQ(parsed->effectiveUID, 501u);
+    EXPECT_EQ(parsed->effectiveGID, 20u);
+    EXPECT_EQ(parsed->groups, (std::vector<std::uint32_t>{4, 24}));
+    EXPECT_EQ(parsed->tracer, 77);
+    for (const char* bad : {"Uid:\t0\t0\t0\t0\nGid:\t0\t0\t0\t0\nGroups:\n",
+                            "Uid:\t0\t0\t0\t0\nGid:\t0\t0\t0\t0\nTracerPid:\t0\n",
+                            "Uid:\t0\t0\t0\t0\nGid:\t0\t0\t0\t0\nGroups:\tx\nTracerPid:\t0\n"}) {
+        EXPECT_FALSE(ProcessInfo::parseStanding(bad)) << bad;
+    }
+    using namespace std::string_view_literals;
+    const struct {
+        std::string_view environ;
+        const char* found;
+    } rows[] = {
+        {"HOME=/\0LD_PRELOAD=/tmp/x.so\0"sv, "LD_PRELOAD"},
+        {"LD_AUDIT=a.so"sv, "LD_AUDIT"},
+        {"A=1\0LD_LIBRARY_PATH=/tmp\0"sv, "LD_LIBRARY_PATH"},
+        {"LD_PRELOAD=\0PATH=/bin\0"sv, ""}, // empty: nothing loaded
+        {"XLD_PRELOAD=/tmp/x.so\0"sv, ""},
+        {"A=LD_PRELOAD=/tmp/x.so\0"sv, ""},
+        {""sv, ""},
+    };
+    for (const auto& row : rows) {
+        EXPECT_EQ(ProcessInfo::findLoaderInjection(row.environ), row.found) << row.environ;
+    }
+}
+
+// The registry withholds the entitlements of a registered program from a
+// process that runs it with preloaded code or as a user the entry does not name.
+TEST_F(CodeSigningRegistryTest, EntitlementsOnlyForAdmittedProcesses) {
+    ::chmod(root_.path().c_str(), 0755);
+    const auto program = root_.path() / "registered";
+    std::filesystem::copy_file("/bin/sleep", program);
+    const Value rights(Value::Dictionary{{"com.orvex.private.Quarn.allowed", true}});
+    write("registered.plist",
+          with(entry(program.string(), "com.orvex.registered"), "Entitlements", rights));
+    // Runs the program (through setpriv when `asUser` is set) and answers
+    // the entitlements the registry gives it.
+    const auto entitlementsOf = [&](std::vector<std::string> environment,
+                                    std::vector<std::string> asUser) {
+        std::filesystem::path launcher = program;
+        std::vector<std::string> arguments{"60"};
+        if (!asUser.empty()) {
+            launcher = "/usr/bin/setpriv";
+            arguments = asUser;
+            arguments.insert(arguments.end(), {program.string(), "60"});
+        }
+        auto child = quarn::test::ChildProcess::spawn(
+            {launcher, std::move(arguments), std::move(environment), {}, {}});
+        EXPECT_TRUE(child && runs(child->pid(), program));
+        const auto info = child ? registry_.infoForAuditToken(tokenOf(child->pid())) : std::nullopt;
+        EXPECT_TRUE(info && info->identifier == "com.orvex.registered");
+        return info && info->entitlements ? *info->entitlements : Value();
+    };
+    EXPECT_EQ(entitlementsOf({}, {}), rights);
+    EXPECT_EQ(entitlementsOf({"LD_PRELOAD=/nonexistent/quarn-test.so"}, {}), Value::dictionary());
+    const std::vector<std::string> asMobile{"--reuid=501", "--regid=501", "--clear-groups"};
+    EXPECT_EQ(entitlementsOf({}, asMobile), Value::dictionary());
+    write("registered.plist",
+          with(with(entry(program.string(), "com.orvex.registered"), "Entitlements", rights),
+               "EntitledUsers", Value::Array{501u}));
+    EXPECT_EQ(entitlementsOf({}, asMobile), rights);
 }
