@@ -8,7 +8,7 @@ const char* envCallName(EnvCall call) {
         "readlink",  "realpath", "symlink",  "mknod",    "chown",     "chmod",
         "getflags",  "setflags", "getxattr", "setxattr", "listxattr", "removexattr",
         "copyrange", "clone",    "read",     "write",    "opendir",   "readdir",
-        "closedir",  "mkdtemp",  "utimens",  "aclget",   "aclset"};
+        "closedir",  "mkdtemp",  "utimens",  "aclget",   "aclset",    "openat2"};
     static_assert(std::size(kNames) == static_cast<std::size_t>(EnvCall::Count_));
     auto index = static_cast<std::size_t>(call);
     return index < std::size(kNames) ? kNames[index] : "unknown";

@@ -64,6 +64,7 @@ enum class EnvCall : std::size_t {
     Utimens,
     AclGet,
     AclSet,
+    Openat2,
     Count_
 };
 
@@ -75,6 +76,10 @@ public:
 
     // Descriptors. O_CLOEXEC is always added.
     virtual SysResult<int> openat(int dirfd, const char* path, int flags, mode_t mode = 0) = 0;
+    // openat2(2): `resolve` holds RESOLVE_* flags restricting how the path
+    // is walked (e.g. no symbolic link anywhere in it).
+    virtual SysResult<int> openat2(int dirfd, const char* path, int flags, mode_t mode,
+                                   std::uint64_t resolve) = 0;
     // The descriptor is released even when this reports an error.
     virtual SysStatus close(int fd) = 0;
 

@@ -73,6 +73,11 @@ SysResult<int> FaultInjectingEnv::openat(int dirfd, const char* path, int flags,
     QRN_FORWARD(Open, openat(dirfd, path, flags, mode));
 }
 
+SysResult<int> FaultInjectingEnv::openat2(int dirfd, const char* path, int flags, mode_t mode,
+                                          std::uint64_t resolve) {
+    QRN_FORWARD(Openat2, openat2(dirfd, path, flags, mode, resolve));
+}
+
 SysStatus FaultInjectingEnv::close(int fd) {
     if (auto err = enter(EnvCall::Close)) {
         (void)inner_->close(fd); // a failed close still releases the descriptor

@@ -34,6 +34,8 @@ public:
     void setHook(Hook hook);
 
     SysResult<int> openat(int dirfd, const char* path, int flags, mode_t mode) override;
+    SysResult<int> openat2(int dirfd, const char* path, int flags, mode_t mode,
+                           std::uint64_t resolve) override;
     SysStatus close(int fd) override;
 
     SysResult<struct stat> fstatat(int dirfd, const char* path, int flags) override;

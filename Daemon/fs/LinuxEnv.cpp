@@ -4,7 +4,9 @@
 #include <cstdlib>
 #include <fcntl.h>
 #include <linux/fs.h>
+#include <linux/openat2.h>
 #include <sys/ioctl.h>
+#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -51,6 +53,17 @@ template <class T> SysResult<std::size_t> size(const SysResult<T>& result) {
 
 SysResult<int> LinuxEnv::openat(int dirfd, const char* path, int flags, mode_t mode) {
     return retrying([&] { return ::openat(dirfd, path, flags | O_CLOEXEC, mode); });
+}
+
+SysResult<int> LinuxEnv::openat2(int dirfd, const char* path, int flags, mode_t mode,
+                                 std::uint64_t resolve) {
+    struct open_how how {};
+    how.flags = static_cast<std::uint64_t>(flags | O_CLOEXEC);
+    // The kernel refuses a mode without O_CREAT or O_TMPFILE.
+    how.mode = (flags & (O_CREAT | O_TMPFILE)) != 0 ? mode : 0;
+    how.resolve = resolve;
+    return retrying(
+        [&] { return static_cast<int>(::syscall(SYS_openat2, dirfd, path, &how, sizeof how)); });
 }
 
 SysStatus LinuxEnv::close(int fd) {

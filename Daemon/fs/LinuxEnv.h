@@ -9,6 +9,8 @@ namespace quarn {
 class LinuxEnv final : public Env {
 public:
     SysResult<int> openat(int dirfd, const char* path, int flags, mode_t mode) override;
+    SysResult<int> openat2(int dirfd, const char* path, int flags, mode_t mode,
+                           std::uint64_t resolve) override;
     SysStatus close(int fd) override;
 
     SysResult<struct stat> fstatat(int dirfd, const char* path, int flags) override;

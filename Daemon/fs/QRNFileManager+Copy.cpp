@@ -18,28 +18,28 @@ constexpr int kParentFlags = O_PATH | O_DIRECTORY;
 
 // Copies src to dst by descriptor; a partial copy is removed again so a
 // failed copy leaves the destination as it was. Answers 0 or an errno.
-int copyTree(Env& env, const std::filesystem::path& src, const std::filesystem::path& dst) {
+// Both parents are opened without following a link below the root prefix.
+int copyTree(Env& env, const PathResolver& resolver, const std::filesystem::path& src,
+             const std::filesystem::path& dst) {
     auto from = ParentAndName::of(src);
     auto to = ParentAndName::of(dst);
     if (!from || !to) {
         return EINVAL;
     }
-    auto srcParent = env.openat(AT_FDCWD, from->parent.c_str(), kParentFlags);
-    if (!srcParent) {
-        return srcParent.error();
+    auto srcParentFd = resolver.open(from->parent, kParentFlags);
+    if (!srcParentFd) {
+        return srcParentFd.error();
     }
-    EnvFd srcParentFd(env, *srcParent);
-    auto dstParent = env.openat(AT_FDCWD, to->parent.c_str(), kParentFlags);
-    if (!dstParent) {
-        return dstParent.error();
+    auto dstParentFd = resolver.open(to->parent, kParentFlags);
+    if (!dstParentFd) {
+        return dstParentFd.error();
     }
-    EnvFd dstParentFd(env, *dstParent);
     TreeCopier copier(env);
     int err =
-        copier.copy(srcParentFd.get(), from->name.c_str(), dstParentFd.get(), to->name.c_str());
+        copier.copy(srcParentFd->get(), from->name.c_str(), dstParentFd->get(), to->name.c_str());
     if (err != 0 && copier.madeDestination()) {
         TreeRemover remover(env);
-        remover.removeTree(dstParentFd.get(), to->parent.string(), to->name.c_str());
+        remover.removeTree(dstParentFd->get(), to->parent.string(), to->name.c_str());
     }
     return err;
 }
@@ -68,7 +68,7 @@ Status QRNFileManager::_copyItemAtURL(const std::filesystem::path& src,
                                                   std::strerror(st.error())));
         }
     }
-    if (int err = copyTree(*env_, src, dst)) {
+    if (int err = copyTree(*env_, resolver(), src, dst)) {
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "copy of {} to {} failed: {}", src.string(),
                                               dst.string(), std::strerror(err)));
     }

@@ -37,41 +37,45 @@ struct Leaf {
     }
 };
 
-// mkdir -p by descriptor: every level that has to be made is made with
-// `mode`; existing levels (links among them, as for mkdir -p) are entered
-// as they are. Answers the mkdir of the leaf's errno (0 when it was made,
-// EEXIST when it was there) or the errno of the failing step before it.
-int makePath(Env& env, const fs::path& url, mode_t mode, Leaf& leaf) {
+// mkdir -p by descriptor from the root prefix: every level that has to be
+// made is made with `mode`; existing levels are entered, but never through
+// a link below the root prefix (ELOOP). Answers the mkdir of the leaf's
+// errno (0 when it was made, EEXIST when it was there) or the errno of the
+// failing step before it.
+int makePath(Env& env, const PathResolver& resolver, const fs::path& url, mode_t mode, Leaf& leaf) {
     // Usually only the leaf is missing: its parent is entered in one step
     // then, instead of a walk of every level. A missing parent is left to
     // the walk.
-    if (auto opened = env.openat(AT_FDCWD, url.parent_path().c_str(), kDirectoryPathFlags)) {
-        leaf.setParent(EnvFd(env, *opened));
+    auto parent = resolver.open(url.parent_path(), kDirectoryPathFlags);
+    if (parent) {
+        leaf.setParent(std::move(*parent));
         auto made = env.mkdirat(leaf.parent, leaf.name.c_str(), mode);
         if (made || made.error() != ENOENT) {
             return made ? 0 : made.error();
         }
+    } else if (parent.error() != ENOENT) {
+        return parent.error();
     }
-    auto start = env.openat(AT_FDCWD, url.is_absolute() ? "/" : ".", kDirectoryPathFlags);
-    if (!start) {
-        return start.error();
+    auto from = resolver.anchor(url.parent_path());
+    if (!from) {
+        return from.error();
     }
-    EnvFd dir(env, *start);
-    const fs::path relative = url.relative_path().parent_path();
-    for (const fs::path& component : relative) {
+    EnvFd dir = std::move(from->start);
+    for (const fs::path& component : fs::path(from->relative)) {
         const std::string name = component.string();
         if (name.empty() || name == ".") {
             continue;
         }
-        auto next = env.openat(dir.get(), name.c_str(), kDirectoryPathFlags);
+        auto next = env.openat2(dir.get(), name.c_str(), kDirectoryPathFlags, 0, from->resolve);
         if (!next && next.error() == ENOENT) {
             auto made = env.mkdirat(dir.get(), name.c_str(), mode);
             if (!made && made.error() != EEXIST) {
                 return made.error();
             }
-            next = env.openat(dir.get(), name.c_str(), kDirectoryPathFlags);
+            next = env.openat2(dir.get(), name.c_str(), kDirectoryPathFlags, 0, from->resolve);
         }
         if (!next) {
+            PathResolver::logRefusal(url, next.error());
             return next.error();
         }
         dir = EnvFd(env, *next);
@@ -82,12 +86,12 @@ int makePath(Env& env, const fs::path& url, mode_t mode, Leaf& leaf) {
 }
 
 // The parent must exist already.
-int makeLeaf(Env& env, const fs::path& url, mode_t mode, Leaf& leaf) {
-    auto opened = env.openat(AT_FDCWD, url.parent_path().c_str(), kDirectoryPathFlags);
+int makeLeaf(Env& env, const PathResolver& resolver, const fs::path& url, mode_t mode, Leaf& leaf) {
+    auto opened = resolver.open(url.parent_path(), kDirectoryPathFlags);
     if (!opened) {
         return opened.error();
     }
-    leaf.setParent(EnvFd(env, *opened));
+    leaf.setParent(std::move(*opened));
     auto made = env.mkdirat(leaf.parent, leaf.name.c_str(), mode);
     return made ? 0 : made.error();
 }
@@ -158,6 +162,13 @@ Made<void> applyClassAndOwner(Env& env, int fd, const Where& where, const Finish
     return {};
 }
 
+// An existing directory is taken over only from root or from the owner it
+// is to have: one of anybody else (reached, say, through a link a user
+// planted in a directory of theirs) is left as it is and refused.
+bool mayTakeOver(const struct stat& st, uid_t owner) {
+    return st.st_uid == 0 || st.st_uid == owner;
+}
+
 // `made`: the mkdir's errno. A directory that was there already must be a
 // directory itself, not a link to one; it is given an owner only when its
 // own differs.
@@ -167,9 +178,17 @@ Made<EnvFd> finishLeaf(Env& env, const Leaf& leaf, const Where& where, int made,
     if (made == EEXIST) {
         auto st = env.fstatat(leaf.parent, leaf.name.c_str(), AT_SYMLINK_NOFOLLOW);
         made = !st ? st.error() : S_ISDIR(st->st_mode) ? 0 : ENOTDIR;
+        if (st && S_ISLNK(st->st_mode)) {
+            PathResolver::logRefusal(where.url(), ELOOP);
+        }
         ownerNeeded =
             ownerNeeded && st &&
             (st->st_uid != finish.owner || st->st_gid != static_cast<gid_t>(finish.owner));
+        if (ownerNeeded && !mayTakeOver(*st, finish.owner)) {
+            QRN_LOG_ERROR(LogCategory::Fs, "Refusing to give {} (owner {}) to {}",
+                          where.url().string(), st->st_uid, finish.owner);
+            made = EPERM;
+        }
     }
     if (made != 0) {
         return creationError(where, finish.verb, made);
@@ -191,8 +210,8 @@ Made<EnvFd> finishLeaf(Env& env, const Leaf& leaf, const Where& where, int made,
     return dir;
 }
 
-Made<EnvFd> createDirectory(Env& env, const fs::path& url, bool withIntermediateDirectories,
-                            mode_t mode, Finish finish) {
+Made<EnvFd> createDirectory(Env& env, const PathResolver& resolver, const fs::path& url,
+                            bool withIntermediateDirectories, mode_t mode, Finish finish) {
     Leaf leaf{AT_FDCWD, EnvFd(), url.filename().string()};
     if (url.empty() || !isPlainName(leaf.name)) {
         // "/", "a/.." and the like: nothing to make but the whole path itself.
@@ -204,9 +223,9 @@ Made<EnvFd> createDirectory(Env& env, const fs::path& url, bool withIntermediate
     }
     int made = 0;
     if (withIntermediateDirectories) {
-        made = makePath(env, url, mode, leaf);
+        made = makePath(env, resolver, url, mode, leaf);
     } else {
-        made = makeLeaf(env, url, mode, leaf);
+        made = makeLeaf(env, resolver, url, mode, leaf);
         finish.verb = "mkdir";
     }
     return finishLeaf(env, leaf, Where{url}, made, finish);
@@ -250,7 +269,7 @@ Result<EnvFd> QRNFileManager::createAndOpenDirectoryAtURL(const fs::path& url,
                                                           mode_t mode, uid_t owner,
                                                           int protectionClass) {
     auto made =
-        createDirectory(*env_, url, withIntermediateDirectories, mode,
+        createDirectory(*env_, resolver(), url, withIntermediateDirectories, mode,
                         Finish{owner, protectionClass, true, "mkpath", protectionAttribute_});
     if (!made) {
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(made.error().err, "{}", made.error().message));
@@ -282,7 +301,7 @@ Result<EnvFd> QRNFileManager::createAndOpenDirectoryInDirectory(const EnvFd& par
 Status QRNFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories,
                                             mode_t mode, uid_t owner, int protectionClass) {
     auto made =
-        createDirectory(*env_, url, withIntermediateDirectories, mode,
+        createDirectory(*env_, resolver(), url, withIntermediateDirectories, mode,
                         Finish{owner, protectionClass, false, "mkpath", protectionAttribute_});
     if (!made) {
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(made.error().err, "{}", made.error().message));

@@ -11,10 +11,15 @@ namespace quarn {
 
 namespace {
 
-// Reads the directory's entries into `items`. Answers 0 or an errno.
+// Reads the entries of the open directory into `items`, through a stream
+// of its own so that `dirFd` stays open. Answers 0 or an errno.
 int listDirectory(Env& env, int dirFd, const std::filesystem::path& url,
                   std::vector<QRNFileManager::Item>& items) {
-    EnvFd dir(env, dirFd);
+    auto again = env.openat(dirFd, ".", O_RDONLY | O_DIRECTORY | O_NONBLOCK);
+    if (!again) {
+        return again.error();
+    }
+    EnvFd dir(env, *again);
     if (auto stream = dir.openDirectoryStream(); !stream) {
         return stream.error();
     }
@@ -32,7 +37,7 @@ int listDirectory(Env& env, int dirFd, const std::filesystem::path& url,
         }
         unsigned char type = (*read)->d_type;
         if (type == DT_UNKNOWN) {
-            auto st = env.fstatat(dirfd(dir.dir()), name, AT_SYMLINK_NOFOLLOW);
+            auto st = env.fstatat(dirFd, name, AT_SYMLINK_NOFOLLOW);
             if (!st && st.error() == ENOENT) {
                 continue; // removed since it was read
             }
@@ -49,11 +54,10 @@ int listDirectory(Env& env, int dirFd, const std::filesystem::path& url,
 
 } // namespace
 
-Result<std::vector<QRNFileManager::Item>>
-QRNFileManager::urlsForItemsInDirectoryAtURL(const std::filesystem::path& url) {
-    std::vector<Item> items;
-    auto opened =
-        env_->openat(AT_FDCWD, url.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK);
+Result<QRNFileManager::Listing>
+QRNFileManager::listDirectoryAtURL(const std::filesystem::path& url) {
+    Listing listing{EnvFd(), url, {}};
+    auto opened = resolver().open(url, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK);
     int err = 0;
     if (!opened) {
         err = opened.error();
@@ -62,13 +66,23 @@ QRNFileManager::urlsForItemsInDirectoryAtURL(const std::filesystem::path& url) {
                           std::strerror(err));
         }
     } else {
-        err = listDirectory(*env_, *opened, url, items);
+        listing.directory = std::move(*opened);
+        err = listDirectory(*env_, listing.directory.get(), url, listing.items);
     }
     if (err != 0) {
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(err, "_IterateDirectory for {} returned {}",
                                               url.string(), std::strerror(err)));
     }
-    return items;
+    return listing;
+}
+
+Result<std::vector<QRNFileManager::Item>>
+QRNFileManager::urlsForItemsInDirectoryAtURL(const std::filesystem::path& url) {
+    auto listing = listDirectoryAtURL(url);
+    if (!listing) {
+        return QRN_UNEXPECTED(listing.error());
+    }
+    return std::move(listing->items);
 }
 
 } // namespace quarn

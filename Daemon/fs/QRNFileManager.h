@@ -16,6 +16,7 @@
 // +Ownership, +Protection, +DiskUsage.
 
 #include "Daemon/fs/EnvFd.h"
+#include "Daemon/fs/PathResolver.h"
 #include "Daemon/support/QRNError.h"
 
 #include <fcntl.h>
@@ -26,7 +27,9 @@
 #include <filesystem>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -86,6 +89,17 @@ public:
 
     Env& env() const { return *env_; }
 
+    // --- Resolution by descriptor ------------------------------------------
+
+    // Resolves paths below the context's root prefix without following links.
+    const PathResolver& resolver() const;
+    // The directory itself, opened for reading (never through a link);
+    // a refusal or failure is logged.
+    Result<EnvFd> openDirectoryAtURL(const std::filesystem::path& url);
+    // Whether `relative` exists below the open directory, no link followed
+    // on the way (a link as the last name counts as existing).
+    bool itemExistsInDirectory(const EnvFd& dir, const std::string& relative);
+
     // --- Removal, creation, moves and copies -------------------------------
 
     // Recursive removal; a missing item is success.
@@ -113,7 +127,21 @@ public:
                                                     const std::filesystem::path& relative,
                                                     mode_t mode, uid_t owner, int protectionClass);
 
+    // Both parents are opened by descriptor (never through a link below the
+    // root prefix) and the item is renamed by name.
     Status moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst);
+    // `srcName` of the open directory `srcDir` to `dstName` of `dstDir`; the
+    // URLs name the directories in messages only. Across file systems the
+    // item is copied and removed, by descriptor as well.
+    Status moveItemInDirectory(const EnvFd& srcDir, const std::filesystem::path& srcDirURL,
+                               const std::string& srcName, const EnvFd& dstDir,
+                               const std::filesystem::path& dstDirURL, const std::string& dstName);
+    // Moves `name` of the open directory into a new, uniquely named
+    // directory in the root-only `directory` (checked and repaired first),
+    // keeping its name. Answers the item's new path; ENOENT when it is gone.
+    Result<std::filesystem::path> moveItemInDirectoryToNewUniqueDirectory(
+        const EnvFd& srcDir, const std::filesystem::path& srcDirURL, const std::string& name,
+        const std::filesystem::path& directory);
     Status moveItemIfExistsAtURL(const std::filesystem::path& src,
                                  const std::filesystem::path& dst);
     Status _moveItemAtURL(const std::filesystem::path& src, const std::filesystem::path& dst,
@@ -132,12 +160,48 @@ public:
     Result<std::filesystem::path>
     createTemporaryDirectoryInDirectoryURL(const std::filesystem::path& directory);
 
+    // --- Root-only directories and temporary files ----------------------------
+
+    // Opens (making it when missing) a directory of the daemon's own, and
+    // checks it on the descriptor: owner root, and no write for group and
+    // others (no access at all when `mode` grants them none). A wrong owner
+    // or mode is logged and repaired.
+    Result<EnvFd> openRootOnlyDirectoryAtURL(const std::filesystem::path& url, mode_t mode);
+    // A new file `name` (O_CREAT | O_EXCL | O_NOFOLLOW) in the open directory,
+    // which must be owned by root and writable by nobody else: an existing
+    // name, link or not, is refused (EEXIST), as is a directory others may
+    // write to (EPERM).
+    Result<EnvFd> createTemporaryFileInDirectory(const EnvFd& dir,
+                                                 const std::filesystem::path& dirURL,
+                                                 const std::string& name);
+    // Replaces `name` in the open `directory` with a file holding `bytes`:
+    // written as `temporaryName` in the root-only `scratchDirectory` (a
+    // leftover of that name is removed first), given `protectionClass`
+    // (none when negative) and renamed into place by descriptors.
+    struct FileReplacement {
+        const std::filesystem::path& scratchDirectory;
+        const std::string& temporaryName;
+        int protectionClass = kProtectionClassUnchanged;
+    };
+    Status replaceFileInDirectory(const EnvFd& directory, const std::filesystem::path& directoryURL,
+                                  const std::string& name, std::span<const std::uint8_t> bytes,
+                                  const FileReplacement& replacement);
+
     // --- Walking and listing ------------------------------------------------
 
     Status _traverseDirectory(const std::filesystem::path& url, const TraversalBlock& block);
 
     // The entries of one directory; names beginning with "." are left out.
     Result<std::vector<Item>> urlsForItemsInDirectoryAtURL(const std::filesystem::path& url);
+    // The same, with the listed directory kept open: its entries are then
+    // moved by name from this descriptor, never by their paths, so a swap
+    // of the directory after the listing cannot redirect them.
+    struct Listing {
+        EnvFd directory;
+        std::filesystem::path url;
+        std::vector<Item> items;
+    };
+    Result<Listing> listDirectoryAtURL(const std::filesystem::path& url);
 
     // lstat-based: a dangling link exists.
     bool itemExistsAtURL(const std::filesystem::path& url);
@@ -189,6 +253,9 @@ public:
 private:
     QRNDaemonContext* context_;
     std::shared_ptr<Env> env_;
+    // Made on first use: the root prefix is only known once the context is.
+    mutable std::once_flag resolverOnce_;
+    mutable std::unique_ptr<PathResolver> resolver_;
     // The attribute holding a protection class: the daemon's effective user,
     // which picks its namespace, does not change while it runs.
     const char* protectionAttribute_;
