@@ -80,7 +80,13 @@ QRNFileManager::createTemporaryDirectoryInDirectoryURL(const std::filesystem::pa
 
 Result<EnvFd> QRNFileManager::openRootOnlyDirectoryAtURL(const std::filesystem::path& url,
                                                          mode_t mode) {
-    auto made = createAndOpenDirectoryAtURL(url, true, mode, 0, kProtectionClassUnchanged);
+    // Usually there already: made only when missing.
+    auto opened = resolver().open(url, kRootOnlyDirectoryFlags);
+    Result<EnvFd> made =
+        opened ? Result<EnvFd>(std::move(*opened))
+        : opened.error() == ENOENT
+            ? createAndOpenDirectoryAtURL(url, true, mode, 0, kProtectionClassUnchanged)
+            : posixError(opened.error(), "open of", url);
     if (!made) {
         return made;
     }

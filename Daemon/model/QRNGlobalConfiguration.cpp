@@ -10,6 +10,15 @@
 
 namespace quarn {
 
+namespace {
+
+// Private directories others only traverse (containers below them are
+// theirs), and those nobody else may enter at all.
+constexpr mode_t kSharedPrivateMode = 0755;
+constexpr mode_t kRootOnlyMode = 0700;
+
+} // namespace
+
 QRNGlobalConfiguration::QRNGlobalConfiguration(QRNDaemonContext& context)
     : context_(context), fileManager_(context.instance<QRNFileManager>()),
       home_(context.instance<Paths>().resolve("/private/var/root/")) {
@@ -49,6 +58,24 @@ const std::filesystem::path& QRNGlobalConfiguration::directory(QRNLazyDirectory&
     return lazy.url([&] { return parent / relative; }, fileManager_, &creation);
 }
 
+const std::filesystem::path& QRNGlobalConfiguration::privateDirectory(
+    QRNLazyDirectory& lazy, std::string_view what, const std::filesystem::path& parent,
+    std::string_view relative, mode_t mode, int protectionClass) {
+    return lazy.url(
+        [&] {
+            auto url = parent / relative;
+            if (protectionClass >= 0) {
+                QRNLazyDirectory::create(fileManager_, url, {what, 0, protectionClass});
+            }
+            if (auto checked = fileManager_.openRootOnlyDirectoryAtURL(url, mode); !checked) {
+                QRN_LOG_ERROR(LogCategory::Unspecified, "Failed to create {} at \"{}\": {}", what,
+                              url.string(), checked.error().description());
+            }
+            return url;
+        },
+        fileManager_, nullptr);
+}
+
 const std::filesystem::path& QRNGlobalConfiguration::sharedContainersDirectory() {
     QRNLazyDirectory::Creation creation{"shared container dir"};
     return sharedContainers_.url(
@@ -57,22 +84,23 @@ const std::filesystem::path& QRNGlobalConfiguration::sharedContainersDirectory()
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::logDirectory() {
-    return directory(log_, "log directory", home_, "Library/Logs/Quarn", 0,
-                     kDaemonDirectoryProtectionClass);
+    return privateDirectory(log_, "log directory", home_, "Library/Logs/Quarn", kSharedPrivateMode,
+                            kDaemonDirectoryProtectionClass);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::cachesDirectory() {
-    return directory(caches_, "cache dir", home_, "Library/Caches/com.orvex.quarnd", 0,
-                     kDaemonDirectoryProtectionClass);
+    return privateDirectory(caches_, "cache dir", home_, "Library/Caches/com.orvex.quarnd",
+                            kSharedPrivateMode, kDaemonDirectoryProtectionClass);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::libraryDirectory() {
-    return directory(library_, "library dir", home_, "Library/Quarn", 0,
-                     kDaemonDirectoryProtectionClass);
+    return privateDirectory(library_, "library dir", home_, "Library/Quarn", kSharedPrivateMode,
+                            kDaemonDirectoryProtectionClass);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::transientDirectory() {
-    return directory(transient_, "transient dir", cachesDirectory(), "Temp");
+    return privateDirectory(transient_, "transient dir", cachesDirectory(), "Temp",
+                            kSharedPrivateMode);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::transientBundleDirectory() {
@@ -91,19 +119,26 @@ const std::filesystem::path& QRNGlobalConfiguration::legacyTransientBundleDirect
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::stagingDirectory() {
-    return directory(staging_, "staging dir", cachesDirectory(), "Staging");
+    return privateDirectory(staging_, "staging dir", cachesDirectory(), "Staging",
+                            kSharedPrivateMode);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::deathrowDirectory() {
-    return directory(deathrow_, "deathrow dir", cachesDirectory(), "Dead");
+    return privateDirectory(deathrow_, "deathrow dir", cachesDirectory(), "Dead", kRootOnlyMode);
+}
+
+const std::filesystem::path& QRNGlobalConfiguration::scratchDirectory() {
+    return privateDirectory(scratch_, "scratch dir", cachesDirectory(), "Scratch", kRootOnlyMode);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::replaceDirectory() {
-    return directory(replace_, "replace dir", libraryDirectory(), "Replace");
+    return privateDirectory(replace_, "replace dir", libraryDirectory(), "Replace",
+                            kSharedPrivateMode);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::pendingUpdatesDirectory() {
-    return directory(pendingUpdates_, "updates dir", libraryDirectory(), "PendingUpdates");
+    return privateDirectory(pendingUpdates_, "updates dir", libraryDirectory(), "PendingUpdates",
+                            kSharedPrivateMode);
 }
 
 const std::filesystem::path& QRNGlobalConfiguration::bundleDirectory() {

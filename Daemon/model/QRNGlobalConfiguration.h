@@ -51,7 +51,11 @@ public:
     const std::filesystem::path& transientBundleDirectory();
     const std::filesystem::path& legacyTransientBundleDirectory(); // never created
     const std::filesystem::path& stagingDirectory();
+    // Root-only (0700), checked whenever an item is moved there.
     const std::filesystem::path& deathrowDirectory();
+    // Root-only (0700): temporary files are written here and renamed into
+    // place, out of reach of any user.
+    const std::filesystem::path& scratchDirectory();
     const std::filesystem::path& replaceDirectory();
     const std::filesystem::path& pendingUpdatesDirectory();
     const std::filesystem::path& bundleDirectory();
@@ -82,6 +86,12 @@ private:
                                            const std::filesystem::path& parent,
                                            std::string_view relative, uid_t owner = 0,
                                            int protectionClass = -1);
+    // A directory of the daemon's own: owned by root, writable by nobody
+    // else (with `mode`), repaired when found otherwise.
+    const std::filesystem::path& privateDirectory(QRNLazyDirectory& lazy, std::string_view what,
+                                                  const std::filesystem::path& parent,
+                                                  std::string_view relative, mode_t mode,
+                                                  int protectionClass = -1);
 
     QRNDaemonContext& context_;
     QRNFileManager& fileManager_;
@@ -94,7 +104,7 @@ private:
     std::optional<bool> internalImage_;
 
     QRNLazyDirectory sharedContainers_, log_, caches_, library_, transient_, transientBundle_,
-        legacyTransientBundle_, staging_, deathrow_, replace_, pendingUpdates_, bundle_;
+        legacyTransientBundle_, staging_, deathrow_, scratch_, replace_, pendingUpdates_, bundle_;
 
     // Serialises containerDirectoryURLForUserIdentity.
     std::mutex containerDirectoryMutex_;

@@ -3,6 +3,7 @@
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/support/PropertyList.h"
+#include "Daemon/support/ProtectionClassAttribute.h"
 
 namespace quarn {
 
@@ -27,31 +28,42 @@ Value QRNMetadata::dictionary() const {
     return dict;
 }
 
+namespace {
+
+Status writeFailure(const Error& cause, const std::filesystem::path& url) {
+    return QRN_UNEXPECTED(QRN_ERROR_UNDERLYING(cause, kQRNErrorWriteStateFileFailed,
+                                               "Failed to write metadata dictionary to URL {} : "
+                                               "{}:{}",
+                                               url.string(), cause.domainName(), cause.code));
+}
+
+} // namespace
+
 Status QRNMetadata::writeMetadataToFileURL(const std::filesystem::path& url) const {
-    const Value dict = dictionary();
-    // Written next to the container's staging area so the final move stays
-    // on one file system and replaces the old file in one step.
-    auto staging = QRNGlobalConfiguration::sharedInstance().stagingDirectoryURLForUserIdentity(
-        userIdentity(), containerClass());
-    const auto temporary = staging.value_or(url.parent_path()) /
-                           fmt::format("temp_metadata-{}.plist", uuid().string());
-    // Already written under a temporary name and moved: only the protection
-    // option is wanted.
-    if (auto written = QRN_writeToURL(dict, temporary, WriteOptions{.lowestProtection = true});
-        !written) {
-        const Error& e = written.error();
-        return QRN_UNEXPECTED(
-            QRN_ERROR_UNDERLYING(e, kQRNErrorWriteStateFileFailed,
-                                 "Failed to write metadata dictionary to URL {} : {}:{}",
-                                 temporary.string(), e.domainName(), e.code));
+    const std::filesystem::path container = url.parent_path();
+    auto directory = QRNFileManager::defaultManager().openDirectoryAtURL(container);
+    if (!directory) {
+        return writeFailure(directory.error(), url);
     }
-    auto& fileManager = QRNFileManager::defaultManager();
-    if (auto moved = fileManager.moveItemAtURL(temporary, url); !moved) {
-        auto error = QRN_ERROR_UNDERLYING(moved.error(), kQRNErrorWriteStateFileFailed,
-                                          "Failed to move metadata from staging: {} to final: {}",
-                                          temporary.string(), url.string());
-        (void)fileManager.removeItemAtURL(temporary);
-        return QRN_UNEXPECTED(std::move(error));
+    return writeMetadataInDirectory(*directory, container);
+}
+
+Status QRNMetadata::writeMetadataInDirectory(const EnvFd& container,
+                                             const std::filesystem::path& containerURL) const {
+    const Value dict = dictionary();
+    const auto url = containerURL / kFileName;
+    auto bytes = binaryPropertyList(dict);
+    if (!bytes) {
+        return writeFailure(bytes.error(), url);
+    }
+    const std::string temporary = fmt::format("temp_metadata-{}.plist", uuid().string());
+    const QRNFileManager::FileReplacement replacement{
+        QRNGlobalConfiguration::sharedInstance().scratchDirectory(), temporary,
+        ProtectionClassAttribute::kLowestClass};
+    if (auto replaced = QRNFileManager::defaultManager().replaceFileInDirectory(
+            container, containerURL, std::string(kFileName), *bytes, replacement);
+        !replaced) {
+        return writeFailure(replaced.error(), url);
     }
     QRN_LOG_DEBUG(LogCategory::Metadata, "[{}] Writing metadata to [{}]: {} => {}", __func__,
                   url.string(), description(), dict.description());

@@ -16,6 +16,7 @@
 
 namespace quarn {
 
+class EnvFd;
 class QRNMetadata;
 using QRNMetadataPtr = std::shared_ptr<const QRNMetadata>;
 
@@ -40,10 +41,15 @@ public:
                 std::optional<std::string> userManagedAssetsDirName);
 
     // Writes the file at `url` (the metadata file's own URL) through a
-    // temporary file in the staging directory of the record's user and
-    // class, moved over the final file. Code 34 on failure; the old file
-    // is then left as it was.
+    // temporary file in the daemon's root-only scratch directory, renamed
+    // over the final file in the container directory, which is opened
+    // without following a link. Code 34 on failure; the old file is then
+    // left as it was.
     Status writeMetadataToFileURL(const std::filesystem::path& url) const;
+    // The same into the open container directory (`containerURL` names it
+    // in messages).
+    Status writeMetadataInDirectory(const EnvFd& container,
+                                    const std::filesystem::path& containerURL) const;
 
     // Reads and validates the metadata file at `url` against the identity
     // the caller expects. With `checkClassPath` the container must also lie

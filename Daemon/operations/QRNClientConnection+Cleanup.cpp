@@ -25,35 +25,33 @@ namespace quarn {
 
 namespace {
 
-using URLs = std::vector<std::filesystem::path>;
-
 // The per-user classes whose class directories may hold orphans.
 constexpr std::uint64_t kPerUserDataClasses[] = {
     kQRNContainerClassAppData,  kQRNContainerClassPluginData,  kQRNContainerClassVPNData,
     kQRNContainerClassAppGroup, kQRNContainerClassVellService, kQRNContainerClassInternalDaemon,
     kQRNContainerClassTempDir};
 
-// Appends the directory's items; a missing directory adds nothing and logs
-// nothing. Answers the listing error otherwise.
-std::optional<Error> appendItems(const std::filesystem::path& directory, URLs& urls) {
-    auto items = QRNFileManager::defaultManager().urlsForItemsInDirectoryAtURL(directory);
-    if (!items) {
-        if (items.error().isPOSIX(ENOENT)) {
+using Listings = std::vector<QRNFileManager::Listing>;
+
+// The directory listed and kept open; a missing directory adds nothing and
+// logs nothing. Answers the listing error otherwise.
+std::optional<Error> appendListing(const std::filesystem::path& directory, Listings& listings) {
+    auto listing = QRNFileManager::defaultManager().listDirectoryAtURL(directory);
+    if (!listing) {
+        if (listing.error().isPOSIX(ENOENT)) {
             return std::nullopt;
         }
-        return items.error();
+        return listing.error();
     }
-    for (QRNFileManager::Item& item : *items) {
-        urls.push_back(std::move(item.url));
-    }
+    listings.push_back(std::move(*listing));
     return std::nullopt;
 }
 
-URLs stagingLeftovers() {
+Listings stagingLeftovers() {
     QRNGlobalConfiguration& configuration = QRNGlobalConfiguration::sharedInstance();
-    URLs urls;
+    Listings listings;
     const std::filesystem::path& global = configuration.stagingDirectory();
-    if (auto failed = appendItems(global, urls)) {
+    if (auto failed = appendListing(global, listings)) {
         QRN_LOG_ERROR(LogCategory::Lifecycle, "Failed to get items at global staging URL: {} : {}",
                       global.string(), failed->description());
     }
@@ -65,27 +63,34 @@ URLs stagingLeftovers() {
                 if (!staging) {
                     return;
                 }
-                if (auto failed = appendItems(*staging, urls)) {
+                if (auto failed = appendListing(*staging, listings)) {
                     QRN_LOG_ERROR(LogCategory::Lifecycle,
                                   "Failed to get items at per-user staging URL: {} : {}",
                                   staging->string(), failed->description());
                 }
             });
-    return urls;
+    return listings;
+}
+
+std::string nameOf(const QRNFileManager::Item& item) {
+    return item.url.filename().string();
 }
 
 } // namespace
 
 void QRNClientConnection::quarnManagerCleanupWithCompletion(std::function<void()> completion) {
-    URLs leftovers = stagingLeftovers();
+    Listings leftovers = stagingLeftovers();
     // The cleanups run on the shared connection, which lives as long as its
     // daemon context.
     backgroundQueue_->async([this, leftovers = std::move(leftovers),
                              completion = std::move(completion),
                              transaction = ProcessTransaction("quarnManagerCleanup")]() mutable {
-        for (const std::filesystem::path& url : leftovers) {
-            // A failed move is logged where its error is made; the others go on.
-            (void)_moveItemAtURLToDeathRow(url, true, false);
+        for (const QRNFileManager::Listing& listing : leftovers) {
+            for (const QRNFileManager::Item& item : listing.items) {
+                // A failed move is logged where its error is made; the others go on.
+                (void)_moveItemInDirectoryToDeathRow(listing.directory, listing.url, nameOf(item),
+                                                     true, false);
+            }
         }
         deleteContainersOnDeathRowWithCompletion(
             [completion = std::move(completion)](const std::optional<Error>&) {
@@ -142,18 +147,21 @@ void QRNClientConnection::rebootQuarnManagerCleanupWithCompletion(
     for (std::uint64_t cls : kPerUserDataClasses) {
         auto directory =
             configuration.containerDirectoryURLForUserIdentity(userIdentity, cls, false);
-        URLs urls;
+        Listings listings;
         if (!directory) {
             continue;
         }
-        if (auto failed = appendItems(*directory, urls)) {
+        if (auto failed = appendListing(*directory, listings)) {
             QRN_LOG_ERROR(LogCategory::Lifecycle, "Failed to get items : {}",
                           failed->description());
             continue;
         }
-        backgroundQueue_->async([this, urls = std::move(urls), cls,
+        if (listings.empty()) {
+            continue;
+        }
+        backgroundQueue_->async([this, listing = std::move(listings.front()), cls,
                                  transaction = ProcessTransaction("orphanedDataCleanup")] {
-            _cleanupOrphanedDataForDirectories(urls, cls);
+            _cleanupOrphanedDataForDirectories(listing, cls);
         });
     }
     backgroundQueue_->async([this, transaction = ProcessTransaction("codeSigningCleanup")] {
@@ -167,20 +175,25 @@ void QRNClientConnection::rebootQuarnManagerCleanupWithCompletion(
     });
 }
 
-void QRNClientConnection::_cleanupOrphanedDataForDirectories(const URLs& urls,
+void QRNClientConnection::_cleanupOrphanedDataForDirectories(const QRNFileManager::Listing& listing,
                                                              std::uint64_t containerClass) {
     QRNFileManager& fileManager = QRNFileManager::defaultManager();
     const QRNContainerCache& cache = QRNContainerCache::sharedInstance();
     const bool internal = QRNGlobalConfiguration::sharedInstance().isInternalImage();
-    for (const std::filesystem::path& url : urls) {
+    const std::string metadataFile(QRNMetadata::kFileName);
+    for (const QRNFileManager::Item& item : listing.items) {
+        const std::filesystem::path& url = item.url;
+        const std::string name = nameOf(item);
         const bool validName = cache.containerURL(url, containerClass);
-        if (!fileManager.itemExistsAtURL(url)) {
+        if (!fileManager.itemExistsInDirectory(listing.directory, name)) {
             QRN_LOG_DEBUG(LogCategory::Lifecycle,
                           "Ignoring deleted container path during cleanup: [{}]", url.string());
             continue;
         }
         if (validName) {
-            if (fileManager.itemExistsAtURL(url / QRNMetadata::kFileName)) {
+            // Asked below the listed directory: an entry that is a link has
+            // no metadata of its own and goes.
+            if (fileManager.itemExistsInDirectory(listing.directory, name + "/" + metadataFile)) {
                 continue;
             }
             QRN_LOG_NOTICE(LogCategory::Lifecycle,
@@ -194,7 +207,7 @@ void QRNClientConnection::_cleanupOrphanedDataForDirectories(const URLs& urls,
             QRN_LOG_NOTICE(LogCategory::Lifecycle, "***END INTERNAL BUILD REQUEST");
         }
         // A failed move is logged where its error is made.
-        (void)_moveItemAtURLToDeathRow(url, true, false);
+        (void)_moveItemInDirectoryToDeathRow(listing.directory, listing.url, name, true, false);
     }
 }
 

@@ -18,6 +18,7 @@
 #include "Daemon/support/UUID.h"
 
 #include <cerrno>
+#include <cstring>
 #include <exception>
 #include <typeinfo>
 #include <utility>
@@ -111,34 +112,46 @@ std::shared_ptr<Queue> QRNClientConnection::_sharedBackgroundQueue() {
 
 Status QRNClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
                                                      bool startDeletionThread) {
+    // The item's directory is opened without following a link, and the
+    // item is then moved by name from it.
+    auto parent = QRNFileManager::defaultManager().resolver().openParent(url);
+    if (!parent) {
+        if (parent.error() == ENOENT) {
+            return {};
+        }
+        return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorMoveItemFailed,
+                                        "Failed to open the directory of {} : {}", url.string(),
+                                        std::strerror(parent.error())));
+    }
+    return _moveItemInDirectoryToDeathRow(parent->directory,
+                                          withoutTrailingSeparator(url).parent_path(), parent->name,
+                                          isDir, startDeletionThread);
+}
+
+Status QRNClientConnection::_moveItemInDirectoryToDeathRow(
+    const EnvFd& directory, const std::filesystem::path& directoryURL, const std::string& name,
+    bool isDir, bool startDeletionThread) {
     QRNFileManager& fileManager = QRNFileManager::defaultManager();
     const std::filesystem::path& deathrow =
         QRNGlobalConfiguration::sharedInstance().deathrowDirectory();
+    const std::filesystem::path url = directoryURL / name;
     bool moved = false;
     Status status = deathrowQueue_->sync([&]() -> Status {
-        auto unique = fileManager.createTemporaryDirectoryInDirectoryURL(deathrow);
-        if (!unique) {
-            return QRN_UNEXPECTED(QRN_ERROR_UNDERLYING(unique.error(), kQRNErrorMoveItemFailed,
-                                                       "Failed to create unique directory at: {}",
-                                                       deathrow.string()));
-        }
         // Keeping the name tells later what the item was.
-        const std::filesystem::path target = *unique / lastComponent(url);
-        auto result = fileManager.moveItemAtURL(url, target);
-        if (result) {
+        auto target = fileManager.moveItemInDirectoryToNewUniqueDirectory(directory, directoryURL,
+                                                                          name, deathrow);
+        if (target) {
             moved = true;
             QRN_LOG_DEBUG(LogCategory::Lifecycle, "Moved {} {} to death row at {}",
-                          isDir ? "directory" : "item", url.string(), target.string());
+                          isDir ? "directory" : "item", url.string(), target->string());
             return {};
         }
-        // Nothing was parked in it.
-        (void)fileManager.removeItemAtURL(*unique);
-        if (result.error().isPOSIX(ENOENT)) {
+        if (target.error().isPOSIX(ENOENT)) {
             return {};
         }
-        return QRN_UNEXPECTED(QRN_ERROR_UNDERLYING(result.error(), kQRNErrorMoveItemFailed,
-                                                   "Failed to move item at: {} to: {}",
-                                                   url.string(), target.string()));
+        return QRN_UNEXPECTED(QRN_ERROR_UNDERLYING(target.error(), kQRNErrorMoveItemFailed,
+                                                   "Failed to move item at: {} to death row {}",
+                                                   url.string(), deathrow.string()));
     });
     if (moved && startDeletionThread) {
         deleteContainersOnDeathRowWithCompletion(nullptr);

@@ -108,8 +108,9 @@ QRNClientConnection::_buildInStaging(const QRNContainerIdentity& identity, const
         return QRN_CODE(concrete.error());
     }
     auto metadata = std::make_shared<const QRNMetadata>(*concrete, Value(), *staging, std::nullopt);
-    if (auto written = metadata->writeMetadataToFileURL(*staging / QRNMetadata::kFileName);
-        !written) {
+    // Into the directory just made, by its descriptor: its path lies in a
+    // directory the user may own.
+    if (auto written = metadata->writeMetadataInDirectory(*made, *staging); !written) {
         return QRN_CODE(written.error().qrnCode(kQRNErrorWriteStateFileFailed));
     }
     if (QRNContainerClass::isSystem(cls)) {

@@ -13,6 +13,7 @@
 // owner), +Usage (disk usage), +Boot (boot setup, restored system
 // containers), +Cleanup (boot cleanup passes).
 
+#include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNContainerIdentity.h"
 #include "Daemon/model/QRNUserIdentity.h"
 #include "Daemon/operations/QRNClientIdentity.h"
@@ -145,6 +146,13 @@ public:
     // item is success and starts nothing.
     Status _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
                                     bool startDeletionThread);
+    // The same for `name` of the open `directory` (whose path is
+    // `directoryURL`): the entry moved is the one in that directory, whatever
+    // has become of its path since it was opened.
+    Status _moveItemInDirectoryToDeathRow(const EnvFd& directory,
+                                          const std::filesystem::path& directoryURL,
+                                          const std::string& name, bool isDir,
+                                          bool startDeletionThread);
     // Destroys everything on death row in the background; the completion
     // (may be empty) hears the pass's error.
     void
@@ -205,7 +213,8 @@ public:
     void rebootQuarnManagerCleanupWithCompletion(std::function<void()> completion);
     // Sends the entries of a class directory that are no containers of the
     // class (a bad name, no metadata file) to death row.
-    void _cleanupOrphanedDataForDirectories(const std::vector<std::filesystem::path>& urls,
+    // Entries are moved from the listed directory's descriptor.
+    void _cleanupOrphanedDataForDirectories(const QRNFileManager::Listing& listing,
                                             std::uint64_t containerClass);
     void _cleanupOprhanedCodeSigningMappingData();
     // Merges one restored system container (class 12 or 13, named by its

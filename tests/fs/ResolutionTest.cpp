@@ -128,7 +128,7 @@ TEST_F(ResolutionTest, RootOnlyDirectoriesAreRepairedAndNeverReachedThroughALink
 
     fs::remove(dead);
     fs::create_directory_symlink(victim(), dead);
-    EXPECT_TRUE(failedWith(manager_.openRootOnlyDirectoryAtURL(dead, 0700), ENOTDIR));
+    EXPECT_TRUE(failedWith(manager_.openRootOnlyDirectoryAtURL(dead, 0700), ELOOP));
     EXPECT_TRUE(log_.contains("Refusing " + dead.string() + ": a symbolic link"));
     EXPECT_EQ(describe(victim()).substr(0, 3), "755");
 }

@@ -119,8 +119,9 @@ TEST_F(QRNMetadataTest, RoundTripThroughABinaryPropertyList) {
     EXPECT_EQ(m.dictionary(), written.dictionary());
 }
 
-// The temporary file goes to the staging directory of the record's user and
-// class; a failed write or move reports code 34 and leaves the old file.
+// The temporary file goes to the daemon's root-only scratch directory; a
+// failed write or move reports code 34 and leaves the old file, and a
+// container directory that became a link is never written through.
 TEST_F(QRNMetadataTest, WriteFailuresKeepTheOldFile) {
     LogCapture log;
     const UUID uuid = UUID::random();
@@ -128,31 +129,34 @@ TEST_F(QRNMetadataTest, WriteFailuresKeepTheOldFile) {
     auto url = dir / QRNMetadata::kFileName;
     ASSERT_TRUE(record(mobile(), 7, uuid, dir).writeMetadataToFileURL(url));
     const auto before = bytesOf(url);
+    const auto scratch = config().scratchDirectory();
+    EXPECT_EQ(std::filesystem::status(scratch).permissions(), std::filesystem::perms(0700));
 
-    auto temporary = home() / "Containers/Staging" / ("temp_metadata-" + uuid.string() + ".plist");
+    auto temporary = scratch / ("temp_metadata-" + uuid.string() + ".plist");
     std::filesystem::create_directories(temporary / "blocker");
     Value info = Value::dictionary();
     info.set("changed", true);
+    const auto message = "Failed to write metadata dictionary to URL " + url.string() + " : ";
     auto failed = record(mobile(), 7, uuid, dir, info).writeMetadataToFileURL(url);
     ASSERT_FALSE(failed);
     EXPECT_TRUE(failed.error().isQRN(kQRNErrorWriteStateFileFailed));
-    EXPECT_TRUE(
-        log.contains("Failed to write metadata dictionary to URL " + temporary.string() + " : "))
-        << log.all();
+    EXPECT_TRUE(log.contains(message)) << log.all();
     EXPECT_EQ(bytesOf(url), before);
+    std::filesystem::remove_all(temporary);
 
-    // A global class stages in the global staging directory; a missing
-    // destination directory makes the move fail.
-    const UUID other = UUID::random();
-    auto missing = root_ / "/private/var/containers/Bundle/Application/gone";
-    failed = record(mobile(), 1, other, missing).writeMetadataToFileURL(missing / "m.plist");
+    // The container directory swapped for a link to another container.
+    const auto elsewhere = containerDir(mobile(), 7, UUID::random());
+    ASSERT_TRUE(record(mobile(), 7, uuid, elsewhere)
+                    .writeMetadataToFileURL(elsewhere / QRNMetadata::kFileName));
+    const auto theirs = bytesOf(elsewhere / QRNMetadata::kFileName);
+    std::filesystem::rename(dir, dir.string() + ".moved");
+    std::filesystem::create_directory_symlink(elsewhere, dir);
+    failed = record(mobile(), 7, uuid, dir, info).writeMetadataToFileURL(url);
     ASSERT_FALSE(failed);
     EXPECT_TRUE(failed.error().isQRN(kQRNErrorWriteStateFileFailed));
-    const auto globalTemp =
-        config().stagingDirectory() / ("temp_metadata-" + other.string() + ".plist");
-    EXPECT_TRUE(log.contains("Failed to move metadata from staging: " + globalTemp.string() +
-                             " to final: " + (missing / "m.plist").string()));
-    EXPECT_FALSE(std::filesystem::exists(globalTemp));
+    EXPECT_TRUE(log.contains("Refusing " + dir.string() + ": a symbolic link")) << log.all();
+    EXPECT_EQ(bytesOf(elsewhere / QRNMetadata::kFileName), theirs);
+    EXPECT_FALSE(std::filesystem::exists(temporary));
 }
 
 // Each refused file gives its code and message; entries are checked in a

@@ -262,10 +262,13 @@ TEST_F(DeathRowTest, FirstBootCleanupSentencesTransientDataAndOrphansButKeepsCon
     configuration().setIsInternalImage(true);
     const fs::path groupOrphan =
         makeTree(classDirectory(kQRNContainerClassAppGroup) / UUID::random().string());
+    auto listing = QRNFileManager::defaultManager().listDirectoryAtURL(
+        classDirectory(kQRNContainerClassAppGroup));
+    ASSERT_TRUE(listing);
+    listing->items.insert(listing->items.begin(),
+                          {classDirectory(kQRNContainerClassAppGroup) / UUID::random().string()});
     LogCapture log;
-    shared()._cleanupOrphanedDataForDirectories(
-        {classDirectory(kQRNContainerClassAppGroup) / UUID::random().string(), groupOrphan},
-        kQRNContainerClassAppGroup);
+    shared()._cleanupOrphanedDataForDirectories(*listing, kQRNContainerClassAppGroup);
     EXPECT_TRUE(log.contains("Here are the invalid files:")) << log.all();
     EXPECT_FALSE(fs::exists(groupOrphan));
 }
