@@ -77,7 +77,7 @@ Result<QRNClient> QRNClient::connect(const std::filesystem::path& socketPath, Op
         return QRN_UNEXPECTED(
             QRN_POSIX_ERROR(err, "cannot connect to {}: {}", text, std::strerror(err)));
     }
-    return QRNClient(std::move(fd), options);
+    return greeted(QRNClient(std::move(fd), options));
 }
 
 Result<QRNClient> QRNClient::adopt(int socketFd, Options options) {
@@ -85,7 +85,23 @@ Result<QRNClient> QRNClient::adopt(int socketFd, Options options) {
     if (auto status = setTimeouts(socketFd, options.timeout); !status) {
         return QRN_UNEXPECTED(status.error());
     }
-    return QRNClient(std::move(fd), options);
+    return greeted(QRNClient(std::move(fd), options));
+}
+
+// The daemon speaks first; a request sent before its greeting would close
+// the connection.
+Result<QRNClient> QRNClient::greeted(QRNClient client) {
+    auto greeting = client.readFrame(false);
+    if (!greeting) {
+        return QRN_UNEXPECTED(
+            QRN_POSIX_ERROR(greeting.error().code == ECONNRESET ? ECONNRESET : EPROTO,
+                            "quarnd did not greet the connection: {}", greeting.error().message));
+    }
+    if (!IpcFrame::isGreeting(*greeting)) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(EPROTO, "quarnd greeted with {}, not protocol {}",
+                                              greeting->description(), IpcFrame::kProtocolVersion));
+    }
+    return client;
 }
 
 Result<Value> QRNClient::send(const Value& request) {
@@ -103,7 +119,7 @@ Result<Value> QRNClient::send(const Value& request) {
         close();
         return QRN_UNEXPECTED(status.error());
     }
-    auto reply = readReply();
+    auto reply = readFrame(true);
     if (!reply) {
         close();
     }
@@ -165,7 +181,8 @@ Result<std::size_t> QRNClient::readAtLeast(std::vector<std::uint8_t>& buffer, st
     return have;
 }
 
-Result<Value> QRNClient::readReply() {
+Result<Value> QRNClient::readFrame(bool isReply) {
+    const char* what = isReply ? "reply" : "greeting";
     std::vector<std::uint8_t> buffer(kFirstReadBytes);
     auto first = readSome(buffer);
     if (!first) {
@@ -176,18 +193,18 @@ Result<Value> QRNClient::readReply() {
         return QRN_UNEXPECTED(have.error());
     }
     auto header = IpcFrame::decodeHeader(std::span(buffer).first<IpcFrame::kHeaderSize>());
-    if (!header) {
-        return QRN_UNEXPECTED(QRN_POSIX_ERROR(EPROTO, "reply frame with reserved flag bits set"));
+    if (!header || header->expectsReply) {
+        return QRN_UNEXPECTED(QRN_POSIX_ERROR(EPROTO, "{} frame with flag bits set", what));
     }
     if (header->length > options_.maxMessageBytes) {
         return QRN_UNEXPECTED(QRN_POSIX_ERROR(EMSGSIZE,
-                                              "reply of {} bytes is over the limit of {} bytes",
+                                              "{} of {} bytes is over the limit of {} bytes", what,
                                               header->length, options_.maxMessageBytes));
     }
     const std::size_t total = IpcFrame::kHeaderSize + header->length;
     if (*have > total) {
         return QRN_UNEXPECTED(
-            QRN_POSIX_ERROR(EPROTO, "{} unexpected bytes after the reply", *have - total));
+            QRN_POSIX_ERROR(EPROTO, "{} unexpected bytes after the {}", *have - total, what));
     }
     buffer.resize(total);
     if (auto full = readAtLeast(buffer, *have, total); !full) {
@@ -197,11 +214,11 @@ Result<Value> QRNClient::readReply() {
     auto reply = CborCodec::decode(body, {options_.maxMessageBytes, options_.maxNesting});
     if (!reply) {
         return QRN_UNEXPECTED(
-            QRN_POSIX_ERROR(EBADMSG, "reply does not decode: {}", reply.error().message));
+            QRN_POSIX_ERROR(EBADMSG, "{} does not decode: {}", what, reply.error().message));
     }
     if (!reply->isDictionary()) {
         return QRN_UNEXPECTED(
-            QRN_POSIX_ERROR(EBADMSG, "reply is a {}, not a dictionary", reply->kindName()));
+            QRN_POSIX_ERROR(EBADMSG, "{} is a {}, not a dictionary", what, reply->kindName()));
     }
     return reply;
 }

@@ -39,7 +39,9 @@ public:
     static std::filesystem::path socketPathForRoot(const std::filesystem::path& rootPrefix);
 
     // Fails with the POSIX error of socket or connect (ENOENT, ECONNREFUSED,
-    // EACCES, ...), ENAMETOOLONG for a path a socket address cannot hold.
+    // EACCES, ...), ENAMETOOLONG for a path a socket address cannot hold,
+    // EPROTO when the daemon's first frame is no greeting of this protocol,
+    // ECONNRESET when it closed without one. Returns once greeted.
     static Result<QRNClient> connect(const std::filesystem::path& socketPath, Options options);
     static Result<QRNClient> connect(const std::filesystem::path& socketPath) {
         return connect(socketPath, Options{});
@@ -73,7 +75,9 @@ private:
     // are there; returns how many are.
     Result<std::size_t> readAtLeast(std::vector<std::uint8_t>& buffer, std::size_t have,
                                     std::size_t want);
-    Result<Value> readReply();
+    // The next frame from the daemon: a reply, or its greeting.
+    Result<Value> readFrame(bool isReply);
+    static Result<QRNClient> greeted(QRNClient client);
 
     std::unique_ptr<Descriptor> fd_;
     Options options_;

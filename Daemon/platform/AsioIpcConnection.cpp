@@ -7,6 +7,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <exception>
@@ -16,7 +17,8 @@ namespace quarn {
 namespace {
 
 constexpr std::size_t kInitialReadBuffer = 16 * 1024;
-// A buffer grown for a large frame is given back once it is drained.
+// A buffer grown for a large frame is given back once it is drained, and
+// the heap trimmed after a message this large was freed.
 constexpr std::size_t kKeptReadBuffer = 64 * 1024;
 constexpr std::size_t kKeptWriteBuffer = 64 * 1024;
 // A client that leaves this much of its replies unread is not read from
@@ -53,12 +55,24 @@ IpcConnection::Sender senderOf(msghdr& message) {
     return sender;
 }
 
+// The process as SCM_CREDENTIALS names it: pid, real uid, real gid.
+IpcConnection::Sender pinnedSender(const IpcPeer& peer) {
+    const auto fields = IpcPeer::fieldsOfAuditToken(peer.auditToken());
+    return {peer.pid(), fields.ruid, fields.rgid};
+}
+
+std::chrono::steady_clock::rep steadyNow() {
+    return std::chrono::steady_clock::now().time_since_epoch().count();
+}
+
 } // namespace
 
 AsioIpcConnection::AsioIpcConnection(std::shared_ptr<IpcServiceCore> core, Socket socket,
-                                     IpcPeer peer, Limits limits)
+                                     IpcPeer peer, IpcExecFingerprint program, Limits limits)
     : core_(std::move(core)), socket_(std::move(socket)), executor_(socket_.get_executor()),
-      fd_(socket_.native_handle()), peer_(std::move(peer)), limits_(limits) {}
+      fd_(socket_.native_handle()), peer_(std::move(peer)), program_(std::move(program)),
+      pinned_(pinnedSender(peer_)), limits_(limits), partialTimer_(executor_),
+      lastActivity_(steadyNow()) {}
 
 AsioIpcConnection::~AsioIpcConnection() {
     core_->remove(this);
@@ -109,8 +123,31 @@ void AsioIpcConnection::onResume() {
                       peer_.pid());
         return end();
     }
+    if (!greet()) {
+        return;
+    }
     readBuffer_.resize(kInitialReadBuffer);
     readMore();
+}
+
+// Bytes already waiting were written before the client could know who the
+// daemon took it for: by the program it ran before an execve, perhaps.
+bool AsioIpcConnection::greet() {
+    std::uint8_t byte;
+    ssize_t n;
+    do {
+        n = ::recv(fd_, &byte, 1, MSG_PEEK | MSG_DONTWAIT);
+    } while (n < 0 && errno == EINTR);
+    if (n > 0) {
+        refuse("it wrote before the greeting");
+        return false;
+    }
+    if (n == 0 || (errno != EAGAIN && errno != EWOULDBLOCK)) {
+        end();
+        return false;
+    }
+    sendFrame(IpcFrame::greeting());
+    return !ended_;
 }
 
 bool AsioIpcConnection::readingPaused() {
@@ -173,29 +210,28 @@ AsioIpcConnection::Received AsioIpcConnection::receive() {
         end();
         return Received::Ended;
     }
-    if (!acceptSender(senderOf(message))) {
+    // Another process (a child sharing the socket), or the same one with
+    // other real ids, would be taken for the one identified at accept.
+    if (const Sender sender = senderOf(message); sender != pinned_) {
+        refuse(fmt::format("bytes written by pid {} (uid {}, gid {}), not by the process that "
+                           "connected",
+                           sender.pid, sender.uid, sender.gid));
         return Received::Ended;
     }
     readEnd_ += static_cast<std::size_t>(n);
+    noteActivity();
     return Received::Bytes;
 }
 
-// Unread input is always the start of a frame; bytes of another writer
-// cannot complete it: the frame would be neither's request.
-bool AsioIpcConnection::acceptSender(const Sender& sender) {
-    if (readEnd_ > readStart_ && sender != unreadSender_) {
-        refuse(fmt::format("a frame holds bytes written by pid {} and by pid {}", unreadSender_.pid,
-                           sender.pid));
-        return false;
-    }
-    unreadSender_ = sender;
-    return true;
+void AsioIpcConnection::noteActivity() {
+    lastActivity_.store(steadyNow(), std::memory_order_relaxed);
 }
 
 // Hands every complete frame in the buffer to the handler, one after the
 // other, then reads on.
 void AsioIpcConnection::deliverBufferedFrames() {
     constexpr std::size_t kHeader = IpcFrame::kHeaderSize;
+    bool consumed = false;
     while (!ended_) {
         const std::size_t unread = readEnd_ - readStart_;
         if (unread < kHeader) {
@@ -221,14 +257,58 @@ void AsioIpcConnection::deliverBufferedFrames() {
         const std::span<const std::uint8_t> body(readBuffer_.data() + readStart_ + kHeader,
                                                  header->length);
         readStart_ += frameBytes;
+        consumed = true;
+        unreadBytes_.store(readEnd_ - readStart_, std::memory_order_relaxed);
         if (!deliverFrame(body, header->expectsReply)) {
             return;
         }
     }
+    if (ended_) {
+        return;
+    }
+    unreadBytes_.store(readEnd_ - readStart_, std::memory_order_relaxed);
+    notePartialFrame(consumed);
     readMore();
 }
 
-// Makes room for a frame of `frameBytes` starting at the unread input.
+// Starts the clock of a frame begun, or stops it when none is.
+void AsioIpcConnection::notePartialFrame(bool frameConsumed) {
+    if (readEnd_ == readStart_) {
+        frameBegan_.reset();
+        return;
+    }
+    if (!frameBegan_ || frameConsumed) {
+        frameBegan_ = std::chrono::steady_clock::now();
+    }
+    armPartialTimer();
+}
+
+void AsioIpcConnection::armPartialTimer() {
+    if (partialTimerArmed_ || !frameBegan_) {
+        return;
+    }
+    partialTimerArmed_ = true;
+    partialTimer_.expires_at(*frameBegan_ + limits_.partialFrameTimeout);
+    partialTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+        self->onPartialTimer(error);
+    });
+}
+
+void AsioIpcConnection::onPartialTimer(const asio::error_code& error) {
+    partialTimerArmed_ = false;
+    if (error || ended_ || !frameBegan_) {
+        return;
+    }
+    if (std::chrono::steady_clock::now() - *frameBegan_ >= limits_.partialFrameTimeout) {
+        return refuse(fmt::format("a frame begun was not finished within {} ms",
+                                  limits_.partialFrameTimeout.count()));
+    }
+    armPartialTimer(); // another frame began since
+}
+
+// Makes room for more of a frame of `frameBytes` starting at the unread
+// input. The buffer grows with the bytes that arrive, doubling, never to
+// the announced length at once: announcing costs a client nothing.
 void AsioIpcConnection::prepareBufferFor(std::size_t frameBytes) {
     const std::size_t unread = readEnd_ - readStart_;
     if (unread == 0) {
@@ -236,20 +316,23 @@ void AsioIpcConnection::prepareBufferFor(std::size_t frameBytes) {
         if (readBuffer_.size() > kKeptReadBuffer) {
             readBuffer_.resize(kInitialReadBuffer);
             readBuffer_.shrink_to_fit();
+            core_->trimMemory();
         }
-    } else if (readStart_ + frameBytes > readBuffer_.size()) {
+    } else if (readStart_ > 0 && readStart_ + frameBytes > readBuffer_.size()) {
         std::memmove(readBuffer_.data(), readBuffer_.data() + readStart_, unread);
         readStart_ = 0;
         readEnd_ = unread;
     }
-    if (readBuffer_.size() < frameBytes) {
-        readBuffer_.resize(frameBytes);
+    if (readEnd_ == readBuffer_.size() && readBuffer_.size() < frameBytes) {
+        readBuffer_.resize(
+            std::min(frameBytes, std::max(readBuffer_.size() * 2, kInitialReadBuffer)));
     }
 }
 
 bool AsioIpcConnection::deliverFrame(std::span<const std::uint8_t> body, bool expectsReply) {
     auto decoded =
-        CborCodec::decode(body, CborCodec::Limits{limits_.maxFrameBytes, limits_.maxNesting});
+        CborCodec::decode(body, CborCodec::Limits{limits_.maxFrameBytes, limits_.maxNesting,
+                                                  limits_.maxDecodedItems});
     if (!decoded) {
         refuse(fmt::format("the message does not decode: {}", decoded.error().message));
         return false;
@@ -258,16 +341,30 @@ bool AsioIpcConnection::deliverFrame(std::span<const std::uint8_t> body, bool ex
         refuse(fmt::format("the message is a {}, not a dictionary", decoded->kindName()));
         return false;
     }
-    Event event;
-    event.kind = Event::Kind::Message;
-    event.body = std::move(*decoded);
-    event.expectsReply = expectsReply;
-    try {
-        handler_(shared_from_this(), event);
-    } catch (const std::exception& e) {
-        QRN_LOG_FAULT(LogCategory::Vell, "The handler of a message of pid {} threw: {}",
-                      peer_.pid(), e.what());
-        end();
+    // Checked last before the handler: an identity settled for one program
+    // must not answer for another the process has exec'd since.
+    if (!program_.matches()) {
+        refuse("its process has exited or runs another program than when it connected");
+        return false;
+    }
+    if (expectsReply) {
+        awaitingReplies_.fetch_add(1, std::memory_order_relaxed);
+    }
+    {
+        Event event;
+        event.kind = Event::Kind::Message;
+        event.body = std::move(*decoded);
+        event.expectsReply = expectsReply;
+        try {
+            handler_(shared_from_this(), event);
+        } catch (const std::exception& e) {
+            QRN_LOG_FAULT(LogCategory::Vell, "The handler of a message of pid {} threw: {}",
+                          peer_.pid(), e.what());
+            end();
+        }
+    }
+    if (body.size() > kKeptReadBuffer) {
+        core_->trimMemory();
     }
     return !ended_;
 }
@@ -280,13 +377,29 @@ void AsioIpcConnection::refuse(const std::string& why) {
 // Sends from the calling thread: the reply of a request goes out on the
 // thread that ran it, without a hand-over to the connection's context.
 void AsioIpcConnection::sendReply(const Value& reply) {
+    int awaiting = awaitingReplies_.load(std::memory_order_relaxed);
+    while (awaiting > 0 && !awaitingReplies_.compare_exchange_weak(awaiting, awaiting - 1,
+                                                                   std::memory_order_relaxed)) {
+    }
+    sendFrame(reply);
+}
+
+void AsioIpcConnection::sendFrame(const Value& message) {
     std::lock_guard lock(writeMutex_);
     if (writeClosed_ || writeFailed_) {
         return;
     }
+    noteActivity();
     encodeBuffer_.clear();
-    if (!IpcFrame::appendMessage(reply, false, encodeBuffer_)) {
-        return;
+    const bool encoded = IpcFrame::appendMessage(message, false, encodeBuffer_);
+    if (!encoded || encodeBuffer_.size() - IpcFrame::kHeaderSize > limits_.maxFrameBytes) {
+        // The client could not read it: it learns why instead of waiting.
+        QRN_LOG_ERROR(LogCategory::Vell,
+                      "A reply to pid {} of {} bytes is over the limit of {}; an error goes "
+                      "instead",
+                      peer_.pid(), encodeBuffer_.size(), limits_.maxFrameBytes);
+        encodeBuffer_.clear();
+        IpcFrame::appendMessage(IpcFrame::oversizedReply(), false, encodeBuffer_);
     }
     if (!writeQueue_.empty() || awaitingWrite_) {
         // Behind earlier replies, which the context is writing.
@@ -398,11 +511,22 @@ void AsioIpcConnection::onWritable(const asio::error_code& error) {
     readMore(); // in case a backlog of replies had stopped reading
 }
 
+bool AsioIpcConnection::idleSince(std::chrono::steady_clock::time_point cutoff) {
+    if (awaitingReplies_.load(std::memory_order_relaxed) > 0 ||
+        unreadBytes_.load(std::memory_order_relaxed) > 0 ||
+        lastActivity_.load(std::memory_order_relaxed) >= cutoff.time_since_epoch().count()) {
+        return false;
+    }
+    std::lock_guard lock(writeMutex_);
+    return writeQueue_.empty() && !awaitingWrite_;
+}
+
 void AsioIpcConnection::end() {
     if (ended_) {
         return;
     }
     ended_ = true;
+    partialTimer_.cancel();
     {
         std::lock_guard lock(writeMutex_);
         writeClosed_ = true;

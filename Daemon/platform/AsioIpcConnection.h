@@ -8,13 +8,23 @@
 // with a non-blocking send while nothing waits in the queue, else queued
 // and written by the context once the socket takes more.
 //
+// Resuming sends the greeting, unless the client wrote first. Every read
+// must carry the credentials of the pinned process (its pid and the real
+// ids it had at accept) and every message is handed over only while that
+// process runs the program it ran at accept. A frame begun is finished
+// within the partial-frame timeout, or the connection is closed.
+//
 // Pending asynchronous operations hold the connection alive.
 
 #include "Daemon/platform/IpcConnection.h"
+#include "Daemon/platform/IpcExecFingerprint.h"
 #include "Daemon/platform/IpcServiceCore.h"
 
 #include <asio/local/stream_protocol.hpp>
+#include <asio/steady_timer.hpp>
 
+#include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <deque>
 #include <mutex>
@@ -33,17 +43,20 @@ public:
     struct Limits {
         std::size_t maxFrameBytes = 0;
         std::size_t maxNesting = 0;
+        std::size_t maxDecodedItems = 0;
+        std::chrono::milliseconds partialFrameTimeout{0};
     };
 
-    // `socket` asks for its writers' credentials (SO_PASSCRED).
+    // `socket` asks for its writers' credentials (SO_PASSCRED); `program`
+    // was taken of the peer's process at accept.
     AsioIpcConnection(std::shared_ptr<IpcServiceCore> core, Socket socket, IpcPeer peer,
-                      Limits limits);
+                      IpcExecFingerprint program, Limits limits);
     ~AsioIpcConnection() override;
 
     const IpcPeer& peer() const override { return peer_; }
-    // The writer of the unread input, which is the message being handled
-    // while its handler runs.
-    std::optional<Sender> messageSender() const override { return unreadSender_; }
+    // Always the pinned process: bytes of any other close the connection.
+    std::optional<Sender> messageSender() const override { return pinned_; }
+    bool runsSameProgram() const override { return program_.matches(); }
     void setEventHandler(EventHandler handler) override;
     void resume() override;
     void sendReply(const Value& reply) override;
@@ -52,20 +65,28 @@ public:
     // Ends the connection on behalf of the listener's stop, which calls it
     // after refusing other work and before joining the pool.
     void shutDown();
+    // Whether nothing is in flight (no request awaiting its reply, nothing
+    // buffered in either direction) and nothing happened since `cutoff`.
+    bool idleSince(std::chrono::steady_clock::time_point cutoff);
 
 private:
     enum class Received { Bytes, Again, Ended };
 
     void onResume();
+    bool greet();
     void readMore();
     void onReadable(const asio::error_code& error);
     Received receive();
-    bool acceptSender(const Sender& sender);
+    void notePartialFrame(bool frameConsumed);
+    void armPartialTimer();
+    void onPartialTimer(const asio::error_code& error);
+    void noteActivity();
     void deliverBufferedFrames();
     bool deliverFrame(std::span<const std::uint8_t> body, bool expectsReply);
     void prepareBufferFor(std::size_t frameBytes);
     void refuse(const std::string& why);
     bool readingPaused();
+    void sendFrame(const Value& message);
 
     bool flushLocked();
     bool startWrite(std::vector<std::uint8_t>& frame);
@@ -81,6 +102,8 @@ private:
     const Executor executor_; // the socket's, kept apart for calls from other threads
     const int fd_;            // the socket's; written to only under writeMutex_
     const IpcPeer peer_;
+    const IpcExecFingerprint program_;
+    const Sender pinned_; // pid, real uid and real gid at accept
     const Limits limits_;
 
     std::mutex pendingHandlerMutex_; // guards pendingHandler_
@@ -95,8 +118,15 @@ private:
     std::vector<std::uint8_t> readBuffer_; // [readStart_, readEnd_) is unread input
     std::size_t readStart_ = 0;
     std::size_t readEnd_ = 0;
-    // The writer of the unread input; a frame is one writer's bytes.
-    Sender unreadSender_;
+    asio::steady_timer partialTimer_;
+    bool partialTimerArmed_ = false;
+    // When the unread frame began, while one has.
+    std::optional<std::chrono::steady_clock::time_point> frameBegan_;
+
+    // Read by the listener from any thread for idle connections.
+    std::atomic<std::size_t> unreadBytes_{0};
+    std::atomic<int> awaitingReplies_{0};
+    std::atomic<std::chrono::steady_clock::rep> lastActivity_{0};
 
     // Guards the fields below and every write to the socket: replies come
     // from any thread, and the bytes of two frames must not interleave.

@@ -8,6 +8,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <limits>
 #include <span>
 #include <vector>
 
@@ -21,6 +22,9 @@ public:
     struct Limits {
         std::size_t maxBytes = 1024 * 1024;
         std::size_t maxNesting = 32; // arrays and maps inside each other
+        // Items decoded in all (scalars, map keys, arrays and maps): a Value
+        // costs tens of bytes where its CBOR took one.
+        std::size_t maxItems = std::numeric_limits<std::size_t>::max();
     };
 
     // A none Value encodes as CBOR null.
@@ -28,7 +32,7 @@ public:
 
     // Refuses, with a message saying why: malformed or truncated input,
     // trailing bytes, input over the limits, declared lengths longer than
-    // the input, map keys that are not text, duplicate keys, tags other
+    // the input, more items than the budget, map keys that are not text, duplicate keys, tags other
     // than 1 and 37, a tag 37 not over 16 bytes, indefinite lengths,
     // undefined and other simple values. Null decodes as none.
     static Result<Value> decode(std::span<const std::uint8_t> bytes, const Limits& limits);

@@ -2,6 +2,8 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
+
 #include <cmath>
 #include <limits>
 
@@ -61,6 +63,10 @@ void CborDecoder::fail(std::string why) {
 // container; the content of a tag uses the slot the tag took.
 bool CborDecoder::beginItem() {
     if (!failure_.empty()) {
+        return false;
+    }
+    if (++decodedItems_ > limits_.maxItems) {
+        fail(fmt::format("the message holds more than {} items", limits_.maxItems));
         return false;
     }
     if (tag_ != Tag::None || stack_.empty()) {
@@ -138,6 +144,12 @@ void CborDecoder::openContainer(std::uint64_t count, bool isMap) {
     if (count > available || (isMap && count > available / 2)) {
         return fail(fmt::format("a {} declares {} entries but {} bytes remain",
                                 isMap ? "map" : "array", count, after));
+    }
+    // Refused before anything is reserved for them.
+    const std::size_t budget = limits_.maxItems - std::min(limits_.maxItems, decodedItems_);
+    if (count > budget || (isMap && count > budget / 2)) {
+        return fail(fmt::format("a {} of {} entries is over the budget of {} items",
+                                isMap ? "map" : "array", count, limits_.maxItems));
     }
     Frame frame;
     frame.isMap = isMap;

@@ -36,6 +36,7 @@ private:
     std::size_t inputSize_ = 0;
     std::size_t offset_ = 0;       // where the item being decoded starts
     std::size_t pendingItems_ = 0; // `remaining` summed over `stack_`
+    std::size_t decodedItems_ = 0; // counted against limits_.maxItems
     std::vector<Frame> stack_;
     std::optional<Value> root_;
     Tag tag_ = Tag::None;

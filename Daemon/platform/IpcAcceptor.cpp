@@ -36,9 +36,11 @@ bool isResourceShortage(const asio::error_code& error) {
 
 } // namespace
 
-IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
-                         std::size_t maxConnections, IpcListener::ConnectionHandler handler)
-    : core_(std::move(core)), limits_(limits), maxConnections_(maxConnections),
+IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, const IpcListener::Options& options,
+                         IpcListener::ConnectionHandler handler)
+    : core_(std::move(core)), limits_{options.maxFrameBytes, options.maxNesting,
+                                      options.maxDecodedItems, options.partialFrameTimeout},
+      reapIdleAbove_(options.reapIdleAbove), idleTimeout_(options.idleTimeout),
       handler_(std::move(handler)), acceptor_(core_->io(0)), backOffTimer_(core_->io(0)) {}
 
 Status IpcAcceptor::adopt(int listeningFd) {
@@ -96,38 +98,76 @@ void IpcAcceptor::onAccepted(const asio::error_code& error, AsioIpcConnection::S
 }
 
 void IpcAcceptor::handOver(AsioIpcConnection::Socket socket) {
+    closeIdleConnections();
     // Checked before the peer is read from /proc: a flood of connections
-    // costs the daemon an accept and a close each, nothing more.
-    if (core_->openCount() >= maxConnections_) {
-        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: {} connections are open",
-                      maxConnections_);
+    // costs the daemon an accept, a getsockopt and a close each.
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (::getsockopt(socket.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: no peer credentials: {}",
+                      std::strerror(errno));
         return;
     }
+    if (!core_->hasSlotFor(credentials.uid)) {
+        QRN_LOG_ERROR(LogCategory::Vell,
+                      "Refusing a connection of pid {} (uid {}): no slot is free for it; {} open",
+                      credentials.pid, credentials.uid, core_->openCount());
+        return;
+    }
+    auto connection = connectionFor(std::move(socket));
+    if (!connection) {
+        return;
+    }
+    // The slot is taken only now; another connection may have got it since.
+    const std::size_t open = core_->add(connection);
+    if (open == 0) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection of pid {}: no slot is free for it",
+                      connection->peer().pid());
+        return;
+    }
+    QRN_LOG_DEBUG(LogCategory::Vell, "Accepted a connection of pid {}; {} open",
+                  connection->peer().pid(), open);
+    try {
+        handler_(std::move(connection));
+    } catch (const std::exception& e) {
+        QRN_LOG_FAULT(LogCategory::Vell, "The connection handler threw: {}", e.what());
+    }
+}
+
+// The connection with its peer pinned: pidfd, token and program.
+std::shared_ptr<AsioIpcConnection> IpcAcceptor::connectionFor(AsioIpcConnection::Socket socket) {
     ::fcntl(socket.native_handle(), F_SETFD, FD_CLOEXEC);
     if (!passCredentials(socket.native_handle())) {
         QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: no credentials: {}",
                       std::strerror(errno));
-        return;
+        return nullptr;
     }
     auto peer = IpcPeer::fromSocket(socket.native_handle());
     if (!peer) {
         QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection whose client is unknown: {}",
                       peer.error().message);
+        return nullptr;
+    }
+    auto program = IpcExecFingerprint::of(peer->pid(), peer->pidfd());
+    if (!program) {
+        QRN_LOG_ERROR(LogCategory::Vell, "Refusing a connection: {}", program.error().message);
+        return nullptr;
+    }
+    return std::make_shared<AsioIpcConnection>(core_, std::move(socket), std::move(*peer),
+                                               std::move(*program), limits_);
+}
+
+// Slots running short: connections idle past the timeout make room.
+void IpcAcceptor::closeIdleConnections() {
+    if (core_->openCount() <= reapIdleAbove_) {
         return;
     }
-    const pid_t pid = peer->pid();
-    auto connection =
-        std::make_shared<AsioIpcConnection>(core_, std::move(socket), std::move(*peer), limits_);
-    // Only this acceptor adds, so the count checked above still holds.
-    const std::size_t open = core_->add(connection, maxConnections_);
-    if (open == 0) {
-        return;
-    }
-    QRN_LOG_DEBUG(LogCategory::Vell, "Accepted a connection of pid {}; {} open", pid, open);
-    try {
-        handler_(std::move(connection));
-    } catch (const std::exception& e) {
-        QRN_LOG_FAULT(LogCategory::Vell, "The connection handler threw: {}", e.what());
+    const auto cutoff = std::chrono::steady_clock::now() - idleTimeout_;
+    for (const auto& idle : core_->idleConnections(cutoff, reapIdleAbove_)) {
+        QRN_LOG_NOTICE(LogCategory::Vell,
+                       "Closing the idle connection of pid {} (uid {}): slots run short",
+                       idle->peer().pid(), idle->peer().uid());
+        idle->shutDown();
     }
 }
 

@@ -1,8 +1,9 @@
 #pragma once
 // The listening side of the request service: accepts one connection at a
-// time on the first context, identifies its peer, pins it to a context of
-// the pool and hands it, not yet resumed, to the listener's connection
-// handler.
+// time on the first context, gives it a slot of its uid's share, identifies
+// and pins its peer (pidfd and program), pins it to a context of the pool
+// and hands it, not yet resumed, to the listener's connection handler.
+// Once slots run short, idle connections are closed to make room.
 
 #include "Daemon/platform/AsioIpcConnection.h"
 #include "Daemon/platform/IpcListener.h"
@@ -15,9 +16,9 @@ namespace quarn {
 
 class IpcAcceptor : public std::enable_shared_from_this<IpcAcceptor> {
 public:
-    // Connections past `maxConnections` open ones are closed as accepted.
-    IpcAcceptor(std::shared_ptr<IpcServiceCore> core, AsioIpcConnection::Limits limits,
-                std::size_t maxConnections, IpcListener::ConnectionHandler handler);
+    // Connections that get no slot are closed as accepted.
+    IpcAcceptor(std::shared_ptr<IpcServiceCore> core, const IpcListener::Options& options,
+                IpcListener::ConnectionHandler handler);
 
     // Takes ownership of `listeningFd`, closing it on failure.
     Status adopt(int listeningFd);
@@ -29,12 +30,15 @@ private:
     void acceptNext();
     void onAccepted(const asio::error_code& error, AsioIpcConnection::Socket socket);
     void handOver(AsioIpcConnection::Socket socket);
+    std::shared_ptr<AsioIpcConnection> connectionFor(AsioIpcConnection::Socket socket);
+    void closeIdleConnections();
     void backOff();
 
     // Declared first so that it outlives the acceptor and timer it runs.
     std::shared_ptr<IpcServiceCore> core_;
     const AsioIpcConnection::Limits limits_;
-    const std::size_t maxConnections_;
+    const std::size_t reapIdleAbove_;
+    const std::chrono::milliseconds idleTimeout_;
     const IpcListener::ConnectionHandler handler_;
     // Guards acceptor_, backOffTimer_ and closed_: asio objects are not safe
     // to use from two threads at once, and close() comes from any thread.

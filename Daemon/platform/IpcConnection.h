@@ -47,13 +47,20 @@ public:
     // only; none when the transport cannot tell, and then the connection's
     // peer is taken as the writer.
     virtual std::optional<Sender> messageSender() const { return std::nullopt; }
+    // Whether the peer's process still runs the program it ran when it
+    // connected (and is alive); asked again after anything was read about
+    // it from /proc, which an execve in between would have changed.
+    virtual bool runsSameProgram() const { return true; }
 
     // Both before resume(); a connection never resumed reads nothing.
+    // resume() greets the client, which writes nothing before that.
     virtual void setEventHandler(EventHandler handler) = 0;
     virtual void resume() = 0;
 
     // Sends one reply frame. Safe from any thread, also after the handler
     // returned (asynchronous replies); dropped once the connection ended.
+    // A reply over the frame limit is logged and replaced by a small one
+    // whose "ReplyError" is kQRNErrorException.
     virtual void sendReply(const Value& reply) = 0;
     // Ends the connection; pending replies are dropped.
     virtual void cancel() = 0;

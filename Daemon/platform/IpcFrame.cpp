@@ -2,6 +2,7 @@
 
 #include "Daemon/platform/CborEncoder.h"
 #include "Daemon/support/Log.h"
+#include "Daemon/support/QRNError.h"
 
 #include <algorithm>
 #include <limits>
@@ -48,6 +49,18 @@ std::vector<std::uint8_t> IpcFrame::encodeMessage(const Value& message, bool exp
     std::vector<std::uint8_t> out;
     appendMessage(message, expectsReply, out);
     return out;
+}
+
+Value IpcFrame::greeting() {
+    return Value(Value::Dictionary{{"QuarnProtocol", Value(kProtocolVersion)}});
+}
+
+bool IpcFrame::isGreeting(const Value& message) {
+    return message == greeting();
+}
+
+Value IpcFrame::oversizedReply() {
+    return Value(Value::Dictionary{{"ReplyError", Value(std::uint64_t{kQRNErrorException})}});
 }
 
 } // namespace quarn

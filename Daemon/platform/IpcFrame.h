@@ -19,6 +19,7 @@ class IpcFrame {
 public:
     static constexpr std::size_t kHeaderSize = 5;
     static constexpr std::uint8_t kExpectsReply = 0x01;
+    static constexpr std::uint64_t kProtocolVersion = 1;
 
     struct Header {
         std::uint32_t length = 0;
@@ -35,6 +36,14 @@ public:
     // False (and `out` unchanged) for a message too long for a frame.
     static bool appendMessage(const Value& message, bool expectsReply,
                               std::vector<std::uint8_t>& out);
+
+    // The first frame on every connection, sent by the daemon (flag byte 0):
+    // {"QuarnProtocol": 1}.
+    static Value greeting();
+    // Whether `message` is a greeting of this protocol version.
+    static bool isGreeting(const Value& message);
+    // What goes out instead of a reply over the frame limit.
+    static Value oversizedReply();
 };
 
 } // namespace quarn

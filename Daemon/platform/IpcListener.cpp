@@ -35,8 +35,11 @@ struct IpcListener::Impl {
     const Options options;
     // The pool threads hold the core too, so that it is never destroyed
     // from inside its own run().
-    const std::shared_ptr<IpcServiceCore> core =
-        std::make_shared<IpcServiceCore>(std::max<std::size_t>(1, options.workerThreads));
+    const std::shared_ptr<IpcServiceCore> core = std::make_shared<IpcServiceCore>(
+        std::max<std::size_t>(1, options.workerThreads),
+        IpcConnectionSlots::Quota{options.maxConnections, options.maxConnectionsPerUID,
+                                  options.rootReservedConnections},
+        options.memoryTrimInterval);
 
     std::mutex mutex; // guards the fields below: start and stop may come from any thread
     std::shared_ptr<IpcAcceptor> acceptor;
@@ -74,9 +77,8 @@ Status IpcListener::start(ConnectionHandler onConnection) {
     if (!fd) {
         return QRN_UNEXPECTED(fd.error());
     }
-    const AsioIpcConnection::Limits limits{impl_->options.maxFrameBytes, impl_->options.maxNesting};
-    auto acceptor = std::make_shared<IpcAcceptor>(
-        impl_->core, limits, impl_->options.maxConnections, std::move(onConnection));
+    auto acceptor =
+        std::make_shared<IpcAcceptor>(impl_->core, impl_->options, std::move(onConnection));
     if (auto adopted = acceptor->adopt(*fd); !adopted) {
         return adopted;
     }

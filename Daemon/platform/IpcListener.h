@@ -3,7 +3,16 @@
 // accepting client connections, and a pool of worker threads on which the
 // requests of one connection run one at a time while different connections
 // run concurrently. Each connection stays on one worker thread, given round
-// robin; each message carries the credentials of the process that wrote it.
+// robin.
+//
+// Who the client is gets settled before it may write: the connecting
+// process is pinned at accept, the handler identifies it, and resume()
+// sends the greeting (a frame with flag byte 0 holding {"QuarnProtocol": 1});
+// a byte that arrived before it closes the connection, since it may have
+// been written by the program the process ran before an execve. Every
+// message must then come from the pinned process with the real uid and gid
+// it had at accept, still running the same program, else the connection is
+// closed with a log line.
 //
 // Frame: a 4-byte little-endian length N, one flag byte (bit 0: the sender
 // expects a reply; other bits must be clear), then N bytes holding one CBOR
@@ -13,6 +22,7 @@
 #include "Daemon/platform/IpcConnection.h"
 #include "Daemon/support/QRNError.h"
 
+#include <chrono>
 #include <cstddef>
 #include <filesystem>
 #include <functional>
@@ -31,11 +41,31 @@ public:
         std::size_t workerThreads = 4;
         std::size_t maxFrameBytes = 1024 * 1024;
         std::size_t maxNesting = 32;
-        // Each open connection holds a socket, a pidfd per writer and up to
-        // a frame of buffer; past this many, new ones are closed at once with
-        // a log line instead of exhausting the daemon's descriptors (the soft
+        // Decoded items (scalars, keys, containers) one message may hold; far
+        // above what any request carries (command 3's three parallel arrays
+        // of a few thousand containers), and met long before 1 MiB of
+        // one-byte items has cost a Value each.
+        std::size_t maxDecodedItems = 64 * 1024;
+        // Each open connection holds a socket, a pidfd, a /proc directory and
+        // a read buffer; past this many, new ones are closed at once with a
+        // log line instead of exhausting the daemon's descriptors (the soft
         // limit is 1024, and tree walks need theirs) or memory.
         std::size_t maxConnections = 256;
+        // No uid other than root holds more than this many of them...
+        std::size_t maxConnectionsPerUID = 64;
+        // ...and the last ones are root's alone.
+        std::size_t rootReservedConnections = 16;
+        // A frame begun and not finished within this closes its connection.
+        std::chrono::milliseconds partialFrameTimeout{10000};
+        // Once more than this many connections are open, those idle (no
+        // request in flight, nothing buffered either way) for longer than
+        // `idleTimeout` are closed at the next accept, the uid holding most
+        // slots first.
+        std::size_t reapIdleAbove = 192;
+        std::chrono::milliseconds idleTimeout{30000};
+        // After a large frame or message has been freed, the heap is given
+        // back to the system at most this often.
+        std::chrono::milliseconds memoryTrimInterval{1000};
     };
     // Called on a pool thread for each accepted connection, which reads
     // nothing until it is resumed.

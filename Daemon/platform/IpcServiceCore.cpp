@@ -1,10 +1,16 @@
 #include "Daemon/platform/IpcServiceCore.h"
 
+#include "Daemon/platform/AsioIpcConnection.h"
+
+#include <malloc.h>
+
 #include <algorithm>
 
 namespace quarn {
 
-IpcServiceCore::IpcServiceCore(std::size_t contexts) {
+IpcServiceCore::IpcServiceCore(std::size_t contexts, IpcConnectionSlots::Quota quota,
+                               std::chrono::milliseconds memoryTrimInterval)
+    : slots_(quota), memoryTrimInterval_(memoryTrimInterval) {
     contexts_.reserve(std::max<std::size_t>(1, contexts));
     for (std::size_t i = 0; i < std::max<std::size_t>(1, contexts); ++i) {
         // One thread runs each context.
@@ -27,20 +33,77 @@ void IpcServiceCore::closeGate() {
     gateClosed_ = true;
 }
 
-std::size_t IpcServiceCore::add(const std::shared_ptr<AsioIpcConnection>& connection,
-                                std::size_t maxOpen) {
+bool IpcServiceCore::hasSlotFor(uid_t uid) const {
     std::lock_guard lock(connectionsMutex_);
-    if (connections_.size() >= maxOpen) {
+    return slots_.mayTake(uid);
+}
+
+std::size_t IpcServiceCore::add(const std::shared_ptr<AsioIpcConnection>& connection) {
+    const uid_t uid = connection->peer().uid();
+    std::lock_guard lock(connectionsMutex_);
+    if (!slots_.take(uid)) {
         return 0;
     }
-    connections_.emplace(connection.get(), connection);
+    connections_.emplace(connection.get(), Entry{connection, uid});
     return connections_.size();
 }
 
 std::size_t IpcServiceCore::remove(const AsioIpcConnection* connection) {
     std::lock_guard lock(connectionsMutex_);
-    connections_.erase(connection);
+    const auto found = connections_.find(connection);
+    if (found != connections_.end()) {
+        slots_.release(found->second.uid);
+        connections_.erase(found);
+    }
     return connections_.size();
+}
+
+std::vector<std::shared_ptr<AsioIpcConnection>>
+IpcServiceCore::idleConnections(std::chrono::steady_clock::time_point cutoff,
+                                std::size_t keep) const {
+    // Looked at outside the lock: a connection whose last holder is this
+    // call would remove itself from the set when released.
+    std::vector<std::pair<std::shared_ptr<AsioIpcConnection>, uid_t>> open;
+    std::vector<uid_t> uids;
+    {
+        std::lock_guard lock(connectionsMutex_);
+        if (connections_.size() <= keep) {
+            return {};
+        }
+        uids = slots_.uidsByUse();
+        for (const auto& [key, entry] : connections_) {
+            if (auto connection = entry.connection.lock()) {
+                open.emplace_back(std::move(connection), entry.uid);
+            }
+        }
+    }
+    const std::size_t wanted = open.size() > keep ? open.size() - keep : 0;
+    std::vector<std::shared_ptr<AsioIpcConnection>> idle;
+    for (const uid_t uid : uids) {
+        for (auto& [connection, owner] : open) {
+            if (idle.size() == wanted) {
+                return idle;
+            }
+            if (owner == uid && connection->idleSince(cutoff)) {
+                idle.push_back(connection);
+            }
+        }
+    }
+    return idle;
+}
+
+void IpcServiceCore::trimMemory() {
+    const auto now = std::chrono::steady_clock::now().time_since_epoch().count();
+    auto last = lastTrim_.load(std::memory_order_relaxed);
+    const auto interval =
+        std::chrono::duration_cast<std::chrono::steady_clock::duration>(memoryTrimInterval_)
+            .count();
+    if (last != 0 && now - last < interval) {
+        return;
+    }
+    if (lastTrim_.compare_exchange_strong(last, now, std::memory_order_relaxed)) {
+        ::malloc_trim(0);
+    }
 }
 
 std::size_t IpcServiceCore::openCount() const {
@@ -52,8 +115,8 @@ std::vector<std::shared_ptr<AsioIpcConnection>> IpcServiceCore::connections() co
     std::vector<std::shared_ptr<AsioIpcConnection>> open;
     std::lock_guard lock(connectionsMutex_);
     open.reserve(connections_.size());
-    for (const auto& [key, weak] : connections_) {
-        if (auto connection = weak.lock()) {
+    for (const auto& [key, entry] : connections_) {
+        if (auto connection = entry.connection.lock()) {
             open.push_back(std::move(connection));
         }
     }

@@ -10,13 +10,19 @@
 // with few cores cost more than the request itself. The price is that a
 // slow request delays the other connections pinned to the same thread.
 //
+// The connection slots are shared out by uid (IpcConnectionSlots); when
+// they run short, idle connections are closed, the uid holding most first.
+//
 // The gate matters because work posted after the pool has gone would never
 // run, and the connection it holds would never be released.
+
+#include "Daemon/platform/IpcConnectionSlots.h"
 
 #include <asio/io_context.hpp>
 #include <asio/post.hpp>
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <memory>
 #include <mutex>
@@ -31,7 +37,8 @@ class AsioIpcConnection;
 class IpcServiceCore {
 public:
     // At least one context.
-    explicit IpcServiceCore(std::size_t contexts);
+    IpcServiceCore(std::size_t contexts, IpcConnectionSlots::Quota quota,
+                   std::chrono::milliseconds memoryTrimInterval);
 
     std::size_t contextCount() const { return contexts_.size(); }
     asio::io_context& io(std::size_t index) { return *contexts_[index]; }
@@ -51,12 +58,22 @@ public:
     }
     void closeGate();
 
+    // Whether a connection of `uid` would get a slot now.
+    bool hasSlotFor(uid_t uid) const;
     // Both answer the number of connections open afterwards; `add` adds
-    // nothing and answers 0 when `maxOpen` are open already.
-    std::size_t add(const std::shared_ptr<AsioIpcConnection>& connection, std::size_t maxOpen);
+    // nothing and answers 0 when the connection's uid gets no slot.
+    std::size_t add(const std::shared_ptr<AsioIpcConnection>& connection);
     std::size_t remove(const AsioIpcConnection* connection);
     std::vector<std::shared_ptr<AsioIpcConnection>> connections() const;
     std::size_t openCount() const;
+    // Idle connections idle since before `cutoff`, enough to bring the open
+    // count down to `keep` if that many are idle, those of the uid holding
+    // most slots first.
+    std::vector<std::shared_ptr<AsioIpcConnection>>
+    idleConnections(std::chrono::steady_clock::time_point cutoff, std::size_t keep) const;
+
+    // Gives freed heap back to the system, at most once per trim interval.
+    void trimMemory();
 
 private:
     std::vector<std::unique_ptr<asio::io_context>> contexts_;
@@ -65,8 +82,15 @@ private:
     // between the check and the post.
     std::mutex gateMutex_;
     bool gateClosed_ = false;
-    mutable std::mutex connectionsMutex_; // guards connections_
-    std::unordered_map<const AsioIpcConnection*, std::weak_ptr<AsioIpcConnection>> connections_;
+    mutable std::mutex connectionsMutex_; // guards connections_ and slots_
+    struct Entry {
+        std::weak_ptr<AsioIpcConnection> connection;
+        uid_t uid = 0;
+    };
+    std::unordered_map<const AsioIpcConnection*, Entry> connections_;
+    IpcConnectionSlots slots_;
+    const std::chrono::milliseconds memoryTrimInterval_;
+    std::atomic<std::chrono::steady_clock::rep> lastTrim_{0};
 };
 
 } // namespace quarn

@@ -2,81 +2,51 @@
 
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/platform/CodeSigningRegistry.h"
+#include "Daemon/support/Log.h"
 #include "Daemon/support/QRNDaemonContext.h"
-
-#include <poll.h>
-
-#include <algorithm>
-#include <optional>
 
 namespace quarn {
 
-namespace {
-
-// The writer as a peer: the connecting process as described at accept, as
-// long as its ids are those it connected with; any other from its pid.
-std::optional<IpcPeer> peerOf(const IpcConnection& connection,
-                              const IpcConnection::Sender& sender) {
-    const IpcPeer& connected = connection.peer();
-    if (sender.pid == connected.pid() && sender.uid == connected.uid() &&
-        sender.gid == connected.gid()) {
-        return connected;
-    }
-    auto peer = IpcPeer::fromPID(sender.pid); // logs why it failed
-    return peer ? std::optional<IpcPeer>(std::move(*peer)) : std::nullopt;
+QRNClientIdentityCache::QRNClientIdentityCache(const IpcConnection& connection) {
+    settle(connection);
 }
 
-} // namespace
+void QRNClientIdentityCache::settle(const IpcConnection& connection) {
+    // Read before the identity is made: a reload during the making shows
+    // as a newer generation at the next request.
+    registryGeneration_ = QRNDaemonContext::current().instance<CodeSigningRegistry>().generation();
+    identity_ = QRNClientIdentity::clientIdentityWithPeer(connection.peer());
+    // The program was read from /proc: an execve since accept may have put
+    // another one there, whose identity this is not.
+    if (!connection.runsSameProgram()) {
+        QRN_LOG_ERROR(LogCategory::Vell,
+                      "pid {} runs another program than when it connected: no identity",
+                      connection.peer().pid());
+        identity_ = nullptr;
+    }
+}
 
-bool QRNClientIdentityCache::isStillValid(const Entry& entry, CodeSigningRegistry& registry,
-                                          std::uint64_t& registryGeneration) {
-    // Whether the writer has exited (its pidfd turns readable) is asked in
-    // the same system call as whether the registry changed: both are asked
-    // on every message. A process whose pidfd cannot be polled counts as
-    // gone: its pid might name another process by now.
-    pollfd exit{entry.peer.pidfd(), POLLIN, 0};
-    registryGeneration = registry.generationPolling(exit);
-    if (entry.peer.pidfd() < 0 || exit.revents != 0 ||
-        entry.registryGeneration != registryGeneration) {
+bool QRNClientIdentityCache::isStillValid(const IpcConnection& connection) const {
+    if (QRNDaemonContext::current().instance<CodeSigningRegistry>().generation() !=
+        registryGeneration_) {
         return false;
     }
-    if (!entry.identity) {
+    if (!identity_) {
         return true;
     }
     // The user identity follows the current mobile user and the personas.
+    const IpcPeer& peer = connection.peer();
     const QRNUserIdentityPtr now =
-        QRNUserIdentitySharedCache::sharedCache().userIdentityForCurrentContextWithUID(
-            entry.peer.uid(), entry.peer.gid());
-    return QRNUserIdentity::Equal()(now, entry.identity->userIdentity());
+        QRNUserIdentitySharedCache::sharedCache().userIdentityForCurrentContextWithUID(peer.uid(),
+                                                                                       peer.gid());
+    return QRNUserIdentity::Equal()(now, identity_->userIdentity());
 }
 
 QRNClientIdentityPtr QRNClientIdentityCache::identityFor(const IpcConnection& connection) {
-    const IpcPeer& connected = connection.peer();
-    const IpcConnection::Sender sender = connection.messageSender().value_or(
-        IpcConnection::Sender{connected.pid(), connected.uid(), connected.gid()});
-    auto& registry = QRNDaemonContext::current().instance<CodeSigningRegistry>();
-    // Read before the identity is made: a reload during the making shows
-    // as a newer generation at the next request.
-    std::uint64_t generation = 0;
-    const auto found = std::find_if(entries_.begin(), entries_.end(),
-                                    [&](const Entry& entry) { return entry.sender == sender; });
-    if (found == entries_.end()) {
-        generation = registry.generation();
-    } else if (isStillValid(*found, registry, generation)) {
-        return found->identity;
-    } else {
-        entries_.erase(found);
+    if (!isStillValid(connection)) {
+        settle(connection);
     }
-    std::optional<IpcPeer> peer = peerOf(connection, sender);
-    if (!peer) {
-        return nullptr;
-    }
-    QRNClientIdentityPtr identity = QRNClientIdentity::clientIdentityWithPeer(*peer);
-    if (entries_.size() >= kMaxWriters) {
-        entries_.erase(entries_.begin());
-    }
-    entries_.push_back(Entry{sender, generation, std::move(*peer), identity});
-    return identity;
+    return identity_;
 }
 
 } // namespace quarn

@@ -146,7 +146,7 @@ std::shared_ptr<QRNClientConnection> checkEntitlementsAndInitClientObject(
 
 void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
                          const IpcConnection::Event& event) {
-    QRNClientIdentityCache identities;
+    QRNClientIdentityCache identities(*connection);
     QRNProcessVellEvent(connection, event, identities);
 }
 

@@ -16,10 +16,10 @@ class QRNCommandQueue;
 struct QRNCommandTableEntry;
 
 // Called on the connection's thread for every event of a client connection.
-// `identities` is the connection's own cache of its writers' identities.
+// `identities` holds the identity of the connection's process.
 void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
                          const IpcConnection::Event& event, QRNClientIdentityCache& identities);
-// The same with the writer identified afresh.
+// The same with the connection's process identified afresh.
 void QRNProcessVellEvent(const std::shared_ptr<IpcConnection>& connection,
                          const IpcConnection::Event& event);
 

@@ -27,13 +27,14 @@ bool QRNVellService::start(const Paths& paths) {
         listener_->start([queue = listenerQueue_](std::shared_ptr<IpcConnection> connection) {
             // Behind initialisation on the listener queue.
             queue->async([connection = std::move(connection)] {
-                // The connection's events come one at a time, so its cache
-                // of writer identities needs no lock.
-                connection->setEventHandler(
-                    [identities = std::make_shared<QRNClientIdentityCache>()](
-                        const std::shared_ptr<IpcConnection>& c, const IpcConnection::Event& e) {
-                        QRNProcessVellEvent(c, e, *identities);
-                    });
+                // Who the client is is settled now, before the greeting lets
+                // it write. The connection's events come one at a time, so
+                // its identity needs no lock.
+                auto identity = std::make_shared<QRNClientIdentityCache>(*connection);
+                connection->setEventHandler([identity](const std::shared_ptr<IpcConnection>& c,
+                                                       const IpcConnection::Event& e) {
+                    QRNProcessVellEvent(c, e, *identity);
+                });
                 // Quality-of-service classes have no meaning here.
                 connection->resume();
             });

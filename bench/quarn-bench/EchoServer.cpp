@@ -31,7 +31,8 @@ void EchoServer::run() {
 
 void EchoServer::serve(int fd) const {
     std::vector<std::uint8_t> body;
-    while (auto frame = FrameSocket::readFrame(fd, body)) {
+    const bool greeted = FrameSocket::writeGreeting(fd);
+    while (auto frame = greeted ? FrameSocket::readFrame(fd, body) : std::nullopt) {
         if (!frame->message || !frame->message->isDictionary()) {
             break;
         }

@@ -15,7 +15,7 @@ namespace quarn::loadbench {
 using test::FrameSocket;
 
 FrameClient::FrameClient(const std::filesystem::path& socket)
-    : fd_(FrameSocket::connectTo(socket)) {
+    : fd_(FrameSocket::connectGreeted(socket)) {
     if (fd_ < 0) {
         fail("cannot connect to {}: {}", socket.string(), std::strerror(errno));
     }

@@ -1,6 +1,6 @@
 #pragma once
 // A stand-in for quarnd in client tests: listens at a socket of its own,
-// records each request frame with its reply flag and writes back whatever
+// greets each client, records each request frame with its reply flag and writes back whatever
 // bytes the test wants (a good reply frame or a broken one), one connection
 // after the other.
 
@@ -48,7 +48,8 @@ private:
     std::thread thread_{[this] {
         FrameSocket::acceptEach(listener_, [this](int fd) {
             std::vector<std::uint8_t> body;
-            while (auto frame = FrameSocket::readFrame(fd, body)) {
+            const bool greeted = FrameSocket::writeGreeting(fd);
+            while (auto frame = greeted ? FrameSocket::readFrame(fd, body) : std::nullopt) {
                 const Value request = frame->message ? *frame->message : Value();
                 {
                     std::lock_guard lock(mutex_);

@@ -30,6 +30,7 @@ public:
     explicit FakeIpcConnection(IpcPeer peer) : peer_(std::move(peer)) {}
     const IpcPeer& peer() const override { return peer_; }
     std::optional<Sender> messageSender() const override { return sender; }
+    bool runsSameProgram() const override { return sameProgram; }
     void setEventHandler(EventHandler) override {}
     void resume() override {}
     void sendReply(const Value& reply) override {
@@ -43,6 +44,7 @@ public:
     }
     std::atomic<bool> cancelled{false};
     std::optional<Sender> sender;
+    std::atomic<bool> sameProgram{true};
 
 private:
     IpcPeer peer_{

@@ -65,6 +65,26 @@ int FrameSocket::connectTo(const std::filesystem::path& socketPath) {
     return fd >= 0 && ::connect(fd, generic(address), sizeof address) != 0 ? closed(fd) : fd;
 }
 
+int FrameSocket::connectGreeted(const std::filesystem::path& socketPath) {
+    const int fd = connectTo(socketPath);
+    if (fd < 0 || readGreeting(fd)) {
+        return fd;
+    }
+    errno = EPROTO;
+    return closed(fd);
+}
+
+bool FrameSocket::readGreeting(int fd) {
+    std::vector<std::uint8_t> body;
+    const auto greeting = readFrame(fd, body);
+    return greeting && !greeting->header.expectsReply && greeting->message &&
+           IpcFrame::isGreeting(*greeting->message);
+}
+
+bool FrameSocket::writeGreeting(int fd) {
+    return writeAll(fd, IpcFrame::encodeMessage(IpcFrame::greeting(), false));
+}
+
 bool FrameSocket::accepts(const std::filesystem::path& socketPath) {
     return Descriptor(connectTo(socketPath)).valid();
 }

@@ -30,6 +30,14 @@ public:
     // A connected stream socket for the caller to own; -1 (errno set)
     // when nothing accepts.
     static int connectTo(const std::filesystem::path& socketPath);
+    // The same once the daemon's greeting has been read from it; -1 (errno
+    // EPROTO for a missing or wrong greeting) otherwise.
+    static int connectGreeted(const std::filesystem::path& socketPath);
+    // Reads the greeting a server sends first; false when the next frame
+    // is not one.
+    static bool readGreeting(int fd);
+    // What a stand-in server sends first.
+    static bool writeGreeting(int fd);
     // Whether something accepts on `socketPath` now.
     static bool accepts(const std::filesystem::path& socketPath);
     // A listening stream socket at `socketPath` (a stale one replaced) for
