@@ -107,6 +107,8 @@ public:
                daemon_->isRunning();
     }
     bool isRunning() const { return daemon_ && daemon_->isRunning(); }
+    // The daemon's pid, -1 when none was started.
+    pid_t pid() const { return daemon_ ? daemon_->pid() : -1; }
     // SIGTERM to a running daemon, which must then exit with status 0.
     void expectCleanStop() {
         if (!isRunning()) {

@@ -101,7 +101,7 @@ TEST_F(Serving, HostileFramesEndOnlyTheirOwnConnection) {
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
-        Descriptor connection(FrameSocket::connectTo(daemon().socketPath()));
+        Descriptor connection(FrameSocket::connectGreeted(daemon().socketPath()));
         // Every read ends by the limit: a silent daemon fails the test, not hangs it.
         const timeval limit{.tv_sec = kWaitLimit.count(), .tv_usec = 0};
         ASSERT_EQ(::setsockopt(connection.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit), 0);

@@ -2,6 +2,8 @@
 // and who wrote each message (the credentials the kernel stamps on every write).
 
 #include "Daemon/platform/CborCodec.h"
+#include "Daemon/platform/IpcConnectionSlots.h"
+#include "Daemon/platform/IpcExecFingerprint.h"
 #include "Daemon/platform/IpcListener.h"
 #include "Daemon/platform/IpcPeer.h"
 #include "Daemon/platform/Paths.h"
@@ -19,12 +21,14 @@
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <condition_variable>
 #include <csignal>
+#include <fstream>
 #include <limits>
 #include <mutex>
 #include <set>
@@ -83,10 +87,12 @@ struct Client {
         std::uint8_t byte;
         return ::recv(fd.get(), &byte, 1, MSG_PEEK | MSG_DONTWAIT) > 0;
     }
-    // End of file from the service, not the guard running out.
+    // End of file from the service (a reset when it left bytes unread),
+    // not the guard running out.
     bool closedByService() {
         std::uint8_t byte;
-        return ::recv(fd.get(), &byte, 1, 0) == 0;
+        const ssize_t n = ::recv(fd.get(), &byte, 1, 0);
+        return n == 0 || (n < 0 && errno == ECONNRESET);
     }
     Descriptor fd;
 };
@@ -272,6 +278,10 @@ protected:
             met_.notify_all();
             const bool sawOther = met_.wait_for(lock, kGuard, [&] { return meeting_.size() == 2; });
             c->sendReply(message(sawOther ? 1 : 0));
+        } else if (has("Hold")) {
+            // Left unanswered: a request in flight.
+        } else if (has("Big")) {
+            c->sendReply(Value::Dictionary{{"Big", Value::Data(2 * bulk_.size())}});
         } else if (has("Bulk")) {
             // Each reply well over a socket buffer: most wait in the queue.
             for (std::uint64_t i = 0; i < 3; ++i) {
@@ -473,6 +483,9 @@ TEST_F(IpcListenerTest, AdoptsSystemdsSocketAndClosesOnlyHostileConnectionsAndTh
     ASSERT_EQ(IpcFrame::encodeMessage(exact, true).size(), 5 + 1024u);
     bystander.send(exact);
     EXPECT_EQ(bystander.receive(), exact);
+    // A reply over it is replaced by an error the client can read.
+    bystander.send(message(1, "Big"));
+    EXPECT_EQ(bystander.receive(), IpcFrame::oversizedReply());
     {
         Client second(socketPath());
         EXPECT_EQ(second.roundTrip(2), 2u);
@@ -586,4 +599,179 @@ TEST(CborCodecTest, MalformedOrTooDeepOrLargeInputIsRefusedForItsReason) {
         EXPECT_NE(decoded.error().message.find(c.reason), std::string::npos)
             << c.name << ": " << decoded.error().message;
     }
+}
+
+TEST(CborCodecTest, ItemsOverTheBudgetAreRefusedBeforeTheyAreBuilt) {
+    struct Case {
+        const char* name;
+        Bytes input;
+        std::size_t maxItems;
+        bool decodes;
+    };
+    const Case cases[] = {
+        {"array and its 3 items at 4", {0x83, 1, 2, 3}, 4, true},
+        {"array of 3 at 3", {0x83, 1, 2, 3}, 3, false},
+        {"map, key and value at 3", {0xa1, 0x61, 'a', 1}, 3, true},
+        {"map of 1 at 2", {0xa1, 0x61, 'a', 1}, 2, false},
+        {"siblings past the budget", {0x82, 0x81, 0x00, 0x81, 0x00}, 4, false},
+        {"tagged UUID counts tag and bytes", concat(Bytes({0xd8, 0x25, 0x50}), Bytes(16, 0)), 2,
+         true},
+    };
+    for (const auto& c : cases) {
+        const auto decoded = CborCodec::decode(c.input, {.maxItems = c.maxItems});
+        EXPECT_EQ(bool(decoded), c.decodes) << c.name;
+    }
+    // A megabyte of empty maps under the daemon's budget.
+    const std::size_t count = (1u << 20) - 16;
+    Bytes maps{0x9a, 0, 0x0f, 0xff, 0xf0};
+    maps.resize(maps.size() + count, 0xa0);
+    const auto refused = CborCodec::decode(
+        maps, {.maxBytes = maps.size(), .maxItems = IpcListener::Options{}.maxDecodedItems});
+    ASSERT_FALSE(refused);
+    EXPECT_NE(refused.error().message.find("budget"), std::string::npos) << refused.error().message;
+}
+
+TEST(IpcConnectionSlotsTest, EachUidHasItsShareAndRootItsReserve) {
+    struct Case {
+        const char* name;
+        std::vector<uid_t> held; // taken in this order, each must succeed
+        uid_t next;
+        bool granted;
+    };
+    const IpcConnectionSlots::Quota quota{.total = 8, .perUID = 2, .rootReserved = 2};
+    const Case cases[] = {
+        {"a first slot", {}, 501, true},
+        {"a second slot", {501}, 501, true},
+        {"past the uid's share", {501, 501}, 501, false},
+        {"another uid's share", {501, 501}, 502, true},
+        {"into root's reserve", {501, 501, 502, 502, 503, 503}, 504, false},
+        {"root in its reserve", {501, 501, 502, 502, 503, 503}, 0, true},
+        {"root past its share", {0, 0, 0, 0, 0, 0, 0}, 0, true},
+        {"nobody past the total", {0, 0, 0, 0, 0, 0, 0, 0}, 0, false},
+    };
+    for (const auto& c : cases) {
+        IpcConnectionSlots slots(quota);
+        for (const uid_t uid : c.held) {
+            ASSERT_TRUE(slots.take(uid)) << c.name;
+        }
+        EXPECT_EQ(slots.take(c.next), c.granted) << c.name;
+    }
+    IpcConnectionSlots slots(quota);
+    for (const uid_t uid : {501u, 502u, 502u}) {
+        slots.take(uid);
+    }
+    EXPECT_EQ(slots.uidsByUse(), (std::vector<uid_t>{502, 501}));
+    slots.release(502);
+    slots.release(502);
+    slots.release(502); // not held any more: nothing changes
+    EXPECT_EQ(std::make_tuple(slots.used(), slots.heldBy(502)), std::make_tuple(1u, 0u));
+    EXPECT_TRUE(slots.take(502));
+}
+
+TEST(IpcExecFingerprintTest, AProcessMatchesUntilItExecsOrExits) {
+    // startcode .. env_end are fields 26-28 and 48-51, counted after "(comm)".
+    std::string stat = "42 (a) b) c) S";
+    for (int field = 4; field <= 52; ++field) {
+        stat += " " + std::to_string(field);
+    }
+    const auto layout = IpcExecFingerprint::parseLayout(stat + "\n");
+    ASSERT_TRUE(layout);
+    EXPECT_EQ(*layout, (IpcExecFingerprint::Layout{26, 27, 28, 48, 49, 50, 51}));
+    std::string notANumber = stat;
+    notANumber.replace(notANumber.find(" 27 "), 4, " x7 ");
+    for (const std::string& bad :
+         {std::string("42 (a S 1 2"), stat.substr(0, stat.find(" 50 ")), notANumber}) {
+        EXPECT_FALSE(IpcExecFingerprint::parseLayout(bad)) << bad;
+    }
+
+    int go[2];
+    ASSERT_EQ(::pipe(go), 0);
+    const pid_t child = ::fork();
+    if (child == 0) {
+        char c;
+        if (::read(go[0], &c, 1) == 1) {
+            ::execl("/bin/sleep", "sleep", "60", nullptr);
+        }
+        ::_exit(1);
+    }
+    ::close(go[0]);
+    Descriptor pidfd(static_cast<int>(::syscall(SYS_pidfd_open, child, 0)));
+    auto program = IpcExecFingerprint::of(child, pidfd.get());
+    ASSERT_TRUE(program) << program.error().message;
+    EXPECT_TRUE(program->matches());
+    ASSERT_EQ(::write(go[1], "x", 1), 1);
+    const auto deadline = std::chrono::steady_clock::now() + kGuard;
+    while (program->matches() && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    EXPECT_FALSE(program->matches()) << "the exec is seen";
+    auto execd = IpcExecFingerprint::of(child, pidfd.get());
+    ASSERT_TRUE(execd);
+    EXPECT_TRUE(execd->matches());
+    ::kill(child, SIGKILL);
+    ::waitpid(child, nullptr, 0);
+    ::close(go[1]);
+    EXPECT_FALSE(execd->matches()) << "an exited process matches nothing";
+    EXPECT_FALSE(IpcExecFingerprint::of(child, pidfd.get()));
+}
+
+namespace {
+
+// The peak resident size of this process, in KiB.
+std::size_t peakKiB() {
+    std::ifstream status("/proc/self/status");
+    for (std::string line; std::getline(status, line);) {
+        if (line.starts_with("VmHWM:")) {
+            return std::stoul(line.substr(6));
+        }
+    }
+    return 0;
+}
+
+} // namespace
+
+TEST_F(IpcListenerTest, EarlyBytesAndHalfFramesCloseTheirConnectionBuffersFollowTheBytes) {
+    constexpr std::size_t kLarge = 64u << 20;
+    ASSERT_TRUE(start({.socketPath = socketPath(),
+                       .workerThreads = 2,
+                       .maxFrameBytes = kLarge,
+                       .partialFrameTimeout = std::chrono::milliseconds(50)},
+                      {0}));
+    // 0 writes before it was greeted: maybe another program's bytes.
+    Client early(socketPath(), false);
+    early.send(message(1));
+    resume(0);
+    EXPECT_TRUE(early.closedByService());
+    EXPECT_TRUE(record(0).writers.empty());
+
+    // 1..8 announce large frames and stop after a few bytes: the buffers
+    // follow what arrives, and the half frames are closed in time.
+    const std::size_t peak = peakKiB();
+    std::vector<std::unique_ptr<Client>> announcers;
+    for (int i = 0; i < 8; ++i) {
+        announcers.push_back(std::make_unique<Client>(socketPath()));
+        announcers.back()->write(FrameSocket::rawFrame(kLarge, 1, Bytes{0xa1, 0x61}));
+    }
+    for (auto& announcer : announcers) {
+        EXPECT_TRUE(announcer->closedByService());
+    }
+    EXPECT_LT(peakKiB() - peak, kLarge / 1024) << "buffers allocated on the announced length";
+    // Whole frames are not timed.
+    Client whole(socketPath());
+    EXPECT_EQ(whole.roundTrip(2), 2u);
+}
+
+TEST_F(IpcListenerTest, WhenSlotsRunShortAnIdleConnectionMakesRoomNotABusyOne) {
+    ASSERT_TRUE(start({.socketPath = socketPath(),
+                       .reapIdleAbove = 1,
+                       .idleTimeout = std::chrono::milliseconds(0)}));
+    Client waiting(socketPath());
+    waiting.send(message(1, "Hold"));
+    ASSERT_TRUE(waitUntil([&] { return !records_.empty() && records_[0].writers.size() == 1; }));
+    Client idle(socketPath()); // the second: nothing is closed yet
+    Client newcomer(socketPath());
+    EXPECT_TRUE(idle.closedByService());
+    record(0).connection->sendReply(message(1));
+    EXPECT_EQ(seqOf(waiting.receive()), 1u);
+    EXPECT_EQ(newcomer.roundTrip(3), 3u);
 }
