@@ -29,6 +29,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <ostream>
 #include <span>
 #include <string>
 #include <string_view>
@@ -60,16 +61,38 @@ public:
         bool isDirectory = false;
     };
 
+    // The path of a traversal entry: a view of the walk's own buffer, valid
+    // during the visit only. Copying a deep tree's long paths once per entry
+    // would cost the square of its depth.
+    class TraversalPath {
+    public:
+        TraversalPath() = default;
+        explicit TraversalPath(const std::string* buffer) : buffer_(buffer) {}
+        const std::string& string() const { return buffer_ ? *buffer_ : empty(); }
+        const char* c_str() const { return string().c_str(); }
+        operator std::filesystem::path() const { return string(); }
+        friend std::ostream& operator<<(std::ostream& out, const TraversalPath& path) {
+            return out << path.string();
+        }
+
+    private:
+        static const std::string& empty() {
+            static const std::string none;
+            return none;
+        }
+        const std::string* buffer_ = nullptr;
+    };
+
     // One entry of a traversal, in walk order. Directories come twice: before
     // their contents (DirectoryPreOrder) and after (DirectoryPostOrder).
     // Mount points of other file systems are reported but not entered.
     struct TraversalEntry {
         enum class Kind { DirectoryPreOrder, DirectoryPostOrder, File, Symlink, Other };
         Kind kind = Kind::File;
-        std::filesystem::path path; // full path
-        std::string name;           // last component
-        int level = 0;              // 0 for the root of the walk
-        struct stat status {};      // lstat of the entry
+        TraversalPath path;    // full path
+        std::string name;      // last component
+        int level = 0;         // 0 for the root of the walk
+        struct stat status {}; // lstat of the entry
         // Open directory holding the entry (AT_FDCWD for the root, whose
         // `path` is then used): calls by (parentFd, name) never follow a link.
         int parentFd = AT_FDCWD;

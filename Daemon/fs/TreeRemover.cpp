@@ -1,6 +1,5 @@
 #include "Daemon/fs/TreeRemover.h"
 
-#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 #include "Daemon/support/Log.h"
 
@@ -25,120 +24,90 @@ std::string childPath(const std::string& parent, const char* name) {
 } // namespace
 
 void TreeRemover::removeTree(int parentFd, const std::string& parentPath, const char* name) {
-    removeEntry(Place{parentFd, parentPath, false}, name, DT_UNKNOWN);
+    rootParentFd_ = parentFd;
+    DirectoryStack stack(env_, parentPath, openLevels_);
+    removeEntry(stack, name, DT_UNKNOWN);
+    while (!stack.empty()) {
+        auto next = stack.next();
+        if (!next) {
+            QRN_LOG_ERROR(LogCategory::Fs, "remove hit error for {} : {}", stack.path(),
+                          std::strerror(next.error()));
+            record(next.error());
+            finishDirectory(stack);
+        } else if (*next == nullptr) {
+            finishDirectory(stack);
+        } else {
+            removeEntry(stack, (*next)->name.c_str(), (*next)->type);
+        }
+    }
 }
 
-void TreeRemover::removeEntry(const Place& place, const char* name, unsigned char type) {
-    const std::string path = childPath(place.parentPath, name);
+TreeRemover::Place TreeRemover::placeIn(const DirectoryStack& stack) const {
+    return stack.empty() ? Place{rootParentFd_, false} : Place{stack.fd(), true};
+}
+
+void TreeRemover::removeEntry(DirectoryStack& stack, const char* name, unsigned char type) {
+    const Place place = placeIn(stack);
     if (type == DT_UNKNOWN) {
         auto st = env_.fstatat(place.parentFd, name, AT_SYMLINK_NOFOLLOW);
         if (!st) {
-            handleFailure(place, name, path, false, st.error());
+            handleFailure(stack, name, false, st.error());
             return;
         }
         type = S_ISDIR(st->st_mode) ? DT_DIR : DT_REG;
     }
     if (type == DT_DIR) {
-        removeDirectory(place, name, path);
+        enterDirectory(stack, name);
         return;
     }
     if (auto unlinked = env_.unlinkat(place.parentFd, name, 0); !unlinked) {
-        handleFailure(place, name, path, false, unlinked.error());
+        handleFailure(stack, name, false, unlinked.error());
     }
 }
 
-void TreeRemover::removeDirectory(const Place& place, const char* name, const std::string& path) {
-    auto opened =
-        env_.openat(place.parentFd, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK);
-    if (!opened) {
-        if (opened.error() == ENOTDIR || opened.error() == ELOOP) {
-            // Replaced by a file or a link since it was read: remove that.
-            removeEntry(place, name, DT_REG);
-        } else {
-            handleFailure(place, name, path, true, opened.error());
-        }
+void TreeRemover::enterDirectory(DirectoryStack& stack, const char* name) {
+    auto pushed = stack.push(placeIn(stack).parentFd, name);
+    if (pushed) {
         return;
     }
-    removeChildren(*opened, path);
-    if (auto removed = env_.unlinkat(place.parentFd, name, AT_REMOVEDIR); !removed) {
-        handleFailure(place, name, path, true, removed.error());
+    if (pushed.error() == ENOTDIR || pushed.error() == ELOOP) {
+        // Replaced by a file or a link since it was read: remove that.
+        removeEntry(stack, name, DT_REG);
+    } else {
+        handleFailure(stack, name, true, pushed.error());
     }
 }
 
-void TreeRemover::removeChildren(int dirFd, const std::string& path) {
-    EnvFd dir(env_, dirFd);
-    if (auto stream = dir.openDirectoryStream(); !stream) {
-        QRN_LOG_ERROR(LogCategory::Fs, "remove hit error for {} : {}", path,
-                      std::strerror(stream.error()));
-        record(stream.error());
-        return;
+void TreeRemover::finishDirectory(DirectoryStack& stack) {
+    const std::string name = stack.name();
+    if (auto popped = stack.pop(); !popped) {
+        QRN_LOG_ERROR(LogCategory::Fs, "remove of {} stopped: {}", stack.path(),
+                      std::strerror(popped.error()));
+        record(popped.error());
+        return; // every level is dropped: the removal ends here
     }
-    for (;;) {
-        auto entry = env_.readdir(dir.dir());
-        if (!entry) {
-            QRN_LOG_ERROR(LogCategory::Fs, "remove hit error for {} : {}", path,
-                          std::strerror(entry.error()));
-            record(entry.error());
-            break;
-        }
-        if (*entry == nullptr) {
-            break;
-        }
-        if (!DirectoryEntryName::isDot((*entry)->d_name)) {
-            removeEntry(Place{dirfd(dir.dir()), path, true}, (*entry)->d_name, (*entry)->d_type);
-        }
+    const Place place = placeIn(stack);
+    if (auto removed = env_.unlinkat(place.parentFd, name.c_str(), AT_REMOVEDIR); !removed) {
+        handleFailure(stack, name.c_str(), true, removed.error());
     }
 }
 
-void TreeRemover::handleFailure(const Place& place, const char* name, const std::string& path,
-                                bool isDirectory, int err) {
+void TreeRemover::handleFailure(DirectoryStack& stack, const char* name, bool isDirectory,
+                                int err) {
     if (err == ENOENT) {
         return; // already gone: that is what was wanted
     }
+    const std::string path = childPath(stack.path(), name);
     QRN_LOG_ERROR(LogCategory::Fs, "remove hit error for {} : {}", path, std::strerror(err));
-    if (err != EPERM) {
+    if (err != EPERM || !clearBlockingFlags(stack, name, path)) {
         record(err);
         return;
     }
-    auto st = env_.fstatat(place.parentFd, name, AT_SYMLINK_NOFOLLOW);
-    if (!st) {
-        QRN_LOG_ERROR(LogCategory::Fs, "Failed to stat {} before unsetting the immutable flag: {}",
-                      path, std::strerror(st.error()));
-        record(err);
-        return;
-    }
-    // Either the entry itself is immutable, or the directory holding it is
-    // (which forbids removing anything inside). Only a directory inside the
-    // tree is changed: the parent of the tree's root is not ours.
-    bool cleared = false;
-    if (S_ISREG(st->st_mode) || S_ISDIR(st->st_mode)) {
-        auto opened = env_.openat(place.parentFd, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
-        if (opened) {
-            EnvFd entry(env_, *opened);
-            if (isImmutable(entry.get())) {
-                if (!clearImmutable(entry.get(), path)) {
-                    record(err);
-                    return;
-                }
-                cleared = true;
-            }
-        }
-    }
-    if (place.parentInTree && isImmutable(place.parentFd)) {
-        if (!clearImmutable(place.parentFd, place.parentPath)) {
-            record(err);
-            return;
-        }
-        cleared = true;
-    }
-    if (!cleared) {
-        record(err);
-        return;
-    }
+    const Place place = placeIn(stack);
     auto unlinked = env_.unlinkat(place.parentFd, name, isDirectory ? AT_REMOVEDIR : 0);
     if (!unlinked && isDirectory && unlinked.error() == ENOTEMPTY) {
         // Its children could not go while it was immutable: now they can.
-        removeDirectory(place, name, path);
+        enterDirectory(stack, name);
         return;
     }
     if (!unlinked && unlinked.error() != ENOENT) {
@@ -146,6 +115,41 @@ void TreeRemover::handleFailure(const Place& place, const char* name, const std:
                       std::strerror(unlinked.error()));
         record(unlinked.error());
     }
+}
+
+// Either the entry itself is immutable, or the directory holding it is
+// (which forbids removing anything inside). Only a directory inside the
+// tree is changed: the parent of the tree's root is not ours. True when a
+// flag was cleared and the removal is worth retrying.
+bool TreeRemover::clearBlockingFlags(DirectoryStack& stack, const char* name,
+                                     const std::string& path) {
+    const Place place = placeIn(stack);
+    auto st = env_.fstatat(place.parentFd, name, AT_SYMLINK_NOFOLLOW);
+    if (!st) {
+        QRN_LOG_ERROR(LogCategory::Fs, "Failed to stat {} before unsetting the immutable flag: {}",
+                      path, std::strerror(st.error()));
+        return false;
+    }
+    bool cleared = false;
+    if (S_ISREG(st->st_mode) || S_ISDIR(st->st_mode)) {
+        auto opened = env_.openat(place.parentFd, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK);
+        if (opened) {
+            EnvFd entry(env_, *opened);
+            if (isImmutable(entry.get())) {
+                if (!clearImmutable(entry.get(), path)) {
+                    return false;
+                }
+                cleared = true;
+            }
+        }
+    }
+    if (place.parentInTree && isImmutable(place.parentFd)) {
+        if (!clearImmutable(place.parentFd, stack.path())) {
+            return false;
+        }
+        cleared = true;
+    }
+    return cleared;
 }
 
 bool TreeRemover::isImmutable(int fd) {

@@ -1,8 +1,5 @@
 #include "Daemon/fs/TreeWalker.h"
 
-#include "Daemon/fs/DirectoryEntryName.h"
-#include "Daemon/fs/EnvFd.h"
-
 #include <fcntl.h>
 
 namespace quarn {
@@ -32,7 +29,6 @@ std::optional<TreeWalker::Failure> TreeWalker::walk(const std::filesystem::path&
     nodes_ = 0;
     stopped_ = false;
     failure_.reset();
-    closeFailure_.reset();
     if (root.empty()) {
         return Failure{Failure::Stage::Open, ENOENT, root};
     }
@@ -42,83 +38,97 @@ std::optional<TreeWalker::Failure> TreeWalker::walk(const std::filesystem::path&
     }
     rootDev_ = st->st_dev;
     Entry entry;
-    entry.path = root;
+    entry.path = QRNFileManager::TraversalPath(&root.native());
     entry.name = root.filename().string();
-    entry.level = 0;
     entry.status = *st;
-    entry.parentFd = AT_FDCWD;
-    visitEntry(AT_FDCWD, root.c_str(), entry);
-    if (failure_) {
+    entry.kind = kindOf(st->st_mode);
+    if (!report(entry) || entry.kind != Entry::Kind::DirectoryPreOrder) {
+        return std::nullopt;
+    }
+    DirectoryStack stack(env_, std::string(), openLevels_);
+    if (auto pushed = stack.push(AT_FDCWD, root.c_str()); !pushed) {
+        return Failure{Failure::Stage::Entry, pushed.error(), root};
+    }
+    walkBelow(stack);
+    stack.clear();
+    if (failure_ || stopped_) {
         return failure_;
     }
-    return stopped_ ? std::nullopt : closeFailure_;
+    if (stack.closeError() != 0) {
+        return Failure{Failure::Stage::Close, stack.closeError(), root};
+    }
+    return std::nullopt;
 }
 
-void TreeWalker::visitEntry(int parentFd, const char* openName, Entry& entry) {
-    entry.kind = kindOf(entry.status.st_mode);
-    if (entry.kind == Entry::Kind::DirectoryPreOrder) {
-        visitDirectory(parentFd, openName, entry);
-    } else {
-        report(entry);
+void TreeWalker::walkBelow(DirectoryStack& stack) {
+    while (!stack.empty() && !done()) {
+        auto next = stack.next();
+        if (!next) {
+            fail(Failure::Stage::Entry, next.error(), stack.path());
+        } else if (*next == nullptr) {
+            leaveDirectory(stack);
+        } else {
+            visitChild(stack, (*next)->name);
+        }
     }
 }
 
-void TreeWalker::visitDirectory(int parentFd, const char* openName, Entry& entry) {
-    if (!report(entry)) {
+void TreeWalker::visitChild(DirectoryStack& stack, const std::string& name) {
+    const int dirFd = stack.fd();
+    const std::size_t mark = stack.appendToPath(name);
+    auto st = env_.fstatat(dirFd, name.c_str(), AT_SYMLINK_NOFOLLOW);
+    if (!st) {
+        fail(Failure::Stage::Entry, st.error(), stack.path());
+        stack.truncatePath(mark);
         return;
     }
-    if (entry.status.st_dev == rootDev_) {
-        auto opened =
-            env_.openat(parentFd, openName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK);
-        if (!opened) {
-            fail(Failure::Stage::Entry, opened.error(), entry.path);
-            return;
-        }
-        EnvFd dir(env_, *opened);
-        if (auto stream = dir.openDirectoryStream(); !stream) {
-            fail(Failure::Stage::Entry, stream.error(), entry.path);
-            return;
-        }
-        visitChildren(dir.dir(), entry);
-        if (auto closed = dir.close(); !closed && !closeFailure_) {
-            closeFailure_ = Failure{Failure::Stage::Close, closed.error(), entry.path};
-        }
-        if (done()) {
-            return;
-        }
+    Entry entry;
+    entry.path = QRNFileManager::TraversalPath(&stack.path());
+    entry.name = name;
+    entry.level = static_cast<int>(stack.depth());
+    entry.status = *st;
+    entry.parentFd = dirFd;
+    entry.kind = kindOf(st->st_mode);
+    if (!report(entry) || entry.kind != Entry::Kind::DirectoryPreOrder) {
+        stack.truncatePath(mark);
+        return;
     }
-    entry.kind = Entry::Kind::DirectoryPostOrder;
-    report(entry);
+    if (st->st_dev != rootDev_) {
+        entry.kind = Entry::Kind::DirectoryPostOrder;
+        report(entry);
+        stack.truncatePath(mark);
+        return;
+    }
+    stack.truncatePath(mark);
+    if (auto pushed = stack.push(dirFd, name.c_str()); !pushed) {
+        stack.appendToPath(name);
+        fail(Failure::Stage::Entry, pushed.error(), stack.path());
+        stack.truncatePath(mark);
+    }
 }
 
-void TreeWalker::visitChildren(DIR* dir, const Entry& parent) {
-    const int dirFd = dirfd(dir);
-    while (!done()) {
-        auto read = env_.readdir(dir);
-        if (!read) {
-            fail(Failure::Stage::Entry, read.error(), parent.path);
-            return;
-        }
-        if (*read == nullptr) {
-            return;
-        }
-        const char* name = (*read)->d_name;
-        if (DirectoryEntryName::isDot(name)) {
-            continue;
-        }
-        auto st = env_.fstatat(dirFd, name, AT_SYMLINK_NOFOLLOW);
-        if (!st) {
-            fail(Failure::Stage::Entry, st.error(), parent.path / name);
-            return;
-        }
-        Entry child;
-        child.path = parent.path / name;
-        child.name = name;
-        child.level = parent.level + 1;
-        child.status = *st;
-        child.parentFd = dirFd;
-        visitEntry(dirFd, name, child);
+void TreeWalker::leaveDirectory(DirectoryStack& stack) {
+    auto st = env_.fstat(stack.fd());
+    if (!st) {
+        fail(Failure::Stage::Entry, st.error(), stack.path());
+        return;
     }
+    const std::string name = stack.name();
+    const int level = static_cast<int>(stack.depth()) - 1;
+    if (auto popped = stack.pop(); !popped) {
+        fail(Failure::Stage::Entry, popped.error(), stack.path());
+        return;
+    }
+    const std::size_t mark = stack.appendToPath(name);
+    Entry entry;
+    entry.kind = Entry::Kind::DirectoryPostOrder;
+    entry.path = QRNFileManager::TraversalPath(&stack.path());
+    entry.name = level == 0 ? std::filesystem::path(name).filename().string() : name;
+    entry.level = level;
+    entry.status = *st;
+    entry.parentFd = stack.empty() ? AT_FDCWD : stack.fd();
+    report(entry);
+    stack.truncatePath(mark);
 }
 
 bool TreeWalker::report(const Entry& entry) {
@@ -130,7 +140,7 @@ bool TreeWalker::report(const Entry& entry) {
     return true;
 }
 
-void TreeWalker::fail(Failure::Stage stage, int err, const std::filesystem::path& path) {
+void TreeWalker::fail(Failure::Stage stage, int err, const std::string& path) {
     if (!failure_) {
         failure_ = Failure{stage, err, path};
     }
