@@ -1,6 +1,5 @@
 #include "Daemon/fs/TreeCopier.h"
 
-#include "Daemon/fs/DirectoryEntryName.h"
 #include "Daemon/fs/EnvFd.h"
 
 #include <cerrno>
@@ -30,33 +29,64 @@ bool tryAnotherWay(int err) {
 int TreeCopier::copy(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName) {
     depth0_ = true;
     madeDestination_ = false;
-    return copyEntry(srcParentFd, srcName, dstParentFd, dstName);
-}
-
-int TreeCopier::copyEntry(int srcParentFd, const char* srcName, int dstParentFd,
-                          const char* dstName) {
     auto st = env_.fstatat(srcParentFd, srcName, AT_SYMLINK_NOFOLLOW);
     if (!st) {
         return st.error();
     }
-    if (!depth0_ && S_ISDIR(st->st_mode) && st->st_dev == dstRootDev_ &&
-        st->st_ino == dstRootIno_) {
+    if (!S_ISDIR(st->st_mode)) {
+        return copyLeaf(srcParentFd, srcName, dstParentFd, dstName, *st);
+    }
+    Stacks stacks{DirectoryStack(env_, std::string()), DirectoryStack(env_, std::string())};
+    if (int err = enterDirectory(stacks, srcParentFd, srcName, dstParentFd, dstName)) {
+        return err;
+    }
+    return copyBelow(stacks);
+}
+
+int TreeCopier::copyBelow(Stacks& stacks) {
+    while (!stacks.src.empty()) {
+        auto next = stacks.src.next();
+        if (!next) {
+            return next.error();
+        }
+        const int err =
+            *next == nullptr ? leaveDirectory(stacks) : copyChild(stacks, (*next)->name.c_str());
+        if (err != 0) {
+            return err;
+        }
+    }
+    return stacks.src.closeError();
+}
+
+int TreeCopier::copyChild(Stacks& stacks, const char* name) {
+    const int srcFd = stacks.src.fd();
+    auto st = env_.fstatat(srcFd, name, AT_SYMLINK_NOFOLLOW);
+    if (!st) {
+        return st.error();
+    }
+    if (!S_ISDIR(st->st_mode)) {
+        return copyLeaf(srcFd, name, stacks.dst.fd(), name, *st);
+    }
+    if (st->st_dev == dstRootDev_ && st->st_ino == dstRootIno_) {
         return 0; // the copy itself, inside its own source
     }
-    switch (st->st_mode & S_IFMT) {
-    case S_IFDIR:
-        return copyDirectory(srcParentFd, srcName, dstParentFd, dstName, *st);
+    return enterDirectory(stacks, srcFd, name, stacks.dst.fd(), name);
+}
+
+int TreeCopier::copyLeaf(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,
+                         const struct stat& st) {
+    switch (st.st_mode & S_IFMT) {
     case S_IFREG:
-        return copyFile(srcParentFd, srcName, dstParentFd, dstName, *st);
+        return copyFile(srcParentFd, srcName, dstParentFd, dstName, st);
     case S_IFLNK:
-        return copySymlink(srcParentFd, srcName, dstParentFd, dstName, *st);
+        return copySymlink(srcParentFd, srcName, dstParentFd, dstName, st);
     default:
-        return copyNode(dstParentFd, dstName, *st);
+        return copyNode(dstParentFd, dstName, st);
     }
 }
 
-int TreeCopier::copyDirectory(int srcParentFd, const char* srcName, int dstParentFd,
-                              const char* dstName, const struct stat& st) {
+int TreeCopier::enterDirectory(Stacks& stacks, int srcParentFd, const char* srcName,
+                               int dstParentFd, const char* dstName) {
     // Made private first: the real mode comes after the contents.
     if (auto made = env_.mkdirat(dstParentFd, dstName, 0700); !made) {
         return made.error();
@@ -64,62 +94,34 @@ int TreeCopier::copyDirectory(int srcParentFd, const char* srcName, int dstParen
     const bool root = depth0_;
     madeDestination_ = madeDestination_ || root;
     depth0_ = false;
-    auto src = env_.openat(srcParentFd, srcName, kReadFlags | O_DIRECTORY);
-    if (!src) {
+    if (auto src = stacks.src.push(srcParentFd, srcName); !src) {
         return src.error();
     }
-    EnvFd srcDir(env_, *src);
-    auto dst = env_.openat(dstParentFd, dstName, kReadFlags | O_DIRECTORY);
+    auto dst = stacks.dst.push(dstParentFd, dstName, false);
     if (!dst) {
         return dst.error();
     }
-    EnvFd dstDir(env_, *dst);
     if (root) {
-        auto dstStat = env_.fstat(dstDir.get());
-        if (!dstStat) {
-            return dstStat.error();
-        }
-        dstRootDev_ = dstStat->st_dev;
-        dstRootIno_ = dstStat->st_ino;
+        dstRootDev_ = dst->st_dev;
+        dstRootIno_ = dst->st_ino;
     }
-    if (int err = copyChildren(srcDir.get(), dstDir.get())) {
-        return err;
-    }
-    if (int err = copyExtendedAttributes(srcDir.get(), dstDir.get())) {
-        return err;
-    }
-    return applyOwnerModeTimes(dstDir.get(), st);
+    return 0;
 }
 
-int TreeCopier::copyChildren(int srcFd, int dstFd) {
-    // A second descriptor for the stream: the first stays usable for
-    // attribute reads after the stream is closed.
-    auto listFd = env_.openat(srcFd, ".", O_RDONLY | O_DIRECTORY);
-    if (!listFd) {
-        return listFd.error();
+int TreeCopier::leaveDirectory(Stacks& stacks) {
+    auto st = env_.fstat(stacks.src.fd());
+    if (!st) {
+        return st.error();
     }
-    EnvFd list(env_, *listFd);
-    if (auto stream = list.openDirectoryStream(); !stream) {
-        return stream.error();
+    if (int err = copyExtendedAttributes(stacks.src.fd(), stacks.dst.fd())) {
+        return err;
     }
-    for (;;) {
-        auto entry = env_.readdir(list.dir());
-        if (!entry) {
-            return entry.error();
-        }
-        if (*entry == nullptr) {
-            break;
-        }
-        const char* name = (*entry)->d_name;
-        if (DirectoryEntryName::isDot(name)) {
-            continue;
-        }
-        if (int err = copyEntry(srcFd, name, dstFd, name)) {
-            return err;
-        }
+    if (int err = applyOwnerModeTimes(stacks.dst.fd(), *st)) {
+        return err;
     }
-    auto closed = list.close();
-    return closed ? 0 : closed.error();
+    auto src = stacks.src.pop();
+    auto dst = stacks.dst.pop();
+    return !src ? src.error() : !dst ? dst.error() : 0;
 }
 
 int TreeCopier::copyFile(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,

@@ -5,8 +5,11 @@
 // after their contents. Links are copied as links; nothing is followed at
 // the source or the destination. Hard links are copied as separate files.
 //
-// The first failure stops the copy; the caller removes what was made.
+// Iterative, with a bounded number of open descriptors whatever the depth
+// (DirectoryStack). The first failure stops the copy; the caller removes
+// what was made.
 
+#include "Daemon/fs/DirectoryStack.h"
 #include "Daemon/fs/Env.h"
 
 #include <sys/stat.h>
@@ -28,10 +31,22 @@ public:
     bool madeDestination() const { return madeDestination_; }
 
 private:
-    int copyEntry(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName);
-    int copyDirectory(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,
-                      const struct stat& st);
-    int copyChildren(int srcFd, int dstFd);
+    // Source and destination directories, level for level.
+    struct Stacks {
+        DirectoryStack src;
+        DirectoryStack dst;
+    };
+
+    int copyBelow(Stacks& stacks);
+    int copyChild(Stacks& stacks, const char* name);
+    int copyLeaf(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,
+                 const struct stat& st);
+    // Makes the destination directory and enters both.
+    int enterDirectory(Stacks& stacks, int srcParentFd, const char* srcName, int dstParentFd,
+                       const char* dstName);
+    // Gives the finished destination directory its attributes, then climbs
+    // out of both.
+    int leaveDirectory(Stacks& stacks);
     int copyFile(int srcParentFd, const char* srcName, int dstParentFd, const char* dstName,
                  const struct stat& st);
     int copyData(int srcFd, int dstFd);
