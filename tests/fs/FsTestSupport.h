@@ -117,11 +117,11 @@ inline long countEntries(const fs::path& dir) {
 
 // A chain of `depth` nested directories with long names and a file at the
 // bottom, made by descriptor: its full path is longer than PATH_MAX.
-inline void makeDeepTree(const fs::path& top, int depth) {
+inline void makeDeepTree(const fs::path& top, int depth, std::size_t nameLength = 40) {
     fs::create_directories(top);
     int fd = ::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     ASSERT_GE(fd, 0);
-    const std::string name(40, 'n');
+    const std::string name(nameLength, 'n');
     for (int i = 0; i < depth; ++i) {
         ASSERT_EQ(::mkdirat(fd, name.c_str(), 0755), 0) << "level " << i;
         int next = ::openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
