@@ -1,9 +1,11 @@
 // Reading and validating a container's metadata file. Nothing is repaired
 // here: an invalid file gives a code and the caller decides what to do.
 
+#include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/model/QRNContainerClass.h"
 #include "Daemon/model/QRNGlobalConfiguration.h"
 #include "Daemon/model/QRNMetadata.h"
+#include "Daemon/model/QRNMetadataFile.h"
 #include "Daemon/model/QRNUserIdentitySharedCache.h"
 #include "Daemon/support/PropertyList.h"
 
@@ -148,6 +150,7 @@ struct MetadataReader {
     std::optional<std::string> dirName;
 
     std::uint64_t readIdentifierUUIDAndClass();
+    std::uint64_t checkDirectoryName();
     std::uint64_t readClass();
     std::uint64_t checkLegacyOwner();
     std::uint64_t readUserIdentity();
@@ -177,6 +180,24 @@ std::uint64_t MetadataReader::readIdentifierUUIDAndClass() {
     }
     uuid = *parsed;
     return readClass();
+}
+
+// A container directory named by a UUID holds only its own record: a file
+// copied from another container does not make this one that container.
+// System containers named by identifier have no name to compare.
+std::uint64_t MetadataReader::checkDirectoryName() {
+    const std::size_t slash = url.rfind('/');
+    const std::size_t before = slash == std::string::npos ? 0 : url.rfind('/', slash - 1);
+    if (slash == std::string::npos || slash == 0 || before == std::string::npos) {
+        return kQRNErrorNone;
+    }
+    auto named = UUID::parse(std::string_view(url).substr(before + 1, slash - before - 1));
+    if (named && *named != uuid) {
+        QRN_LOG_ERROR(LogCategory::Metadata, "Metadata UUID {} does not match its directory at {}",
+                      uuid.string(), url);
+        return kQRNErrorInvalidMetadata;
+    }
+    return kQRNErrorNone;
 }
 
 // Any number is a class's type; only an integer in the classes' range is one.
@@ -338,15 +359,15 @@ QRNMetadata::readAndValidateMetadataAtFilePath(const std::string& url,
         QRN_LOG_ERROR(LogCategory::Metadata, "Can't act on an invalid object: identity: (null)");
         return QRN_CODE(kQRNErrorInvalidArgument);
     }
-    auto read = QRN_dictionaryNodeWithContentsOfFile(url);
+    auto read = QRNMetadataFile::readTrusted(QRNFileManager::defaultManager().env(), url);
     if (!read) {
         QRN_LOG_ERROR(LogCategory::Metadata, "Failed to read metadata at URL {}", url);
         return QRN_CODE(kQRNErrorReadPlistFailed);
     }
     MetadataReader reader(url, userIdentity, read->get(), memo);
-    for (auto step :
-         {&MetadataReader::readIdentifierUUIDAndClass, &MetadataReader::checkLegacyOwner,
-          &MetadataReader::readUserIdentity, &MetadataReader::readOptionalEntries}) {
+    for (auto step : {&MetadataReader::readIdentifierUUIDAndClass,
+                      &MetadataReader::checkDirectoryName, &MetadataReader::checkLegacyOwner,
+                      &MetadataReader::readUserIdentity, &MetadataReader::readOptionalEntries}) {
         if (std::uint64_t code = (reader.*step)(); code != kQRNErrorNone) {
             return QRN_CODE(code);
         }
