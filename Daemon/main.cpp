@@ -10,9 +10,45 @@
 #include "Daemon/support/Log.h"
 #include "Daemon/support/QRNDaemonContext.h"
 
+#include <sys/resource.h>
+
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <memory>
+
+namespace {
+
+// Every request may hold descriptors for its walks and the connections
+// their own; the common default soft limit (1024) is soon reached. The soft
+// limit goes up to the hard one (a kernel's own bound when that is
+// unlimited).
+void raiseDescriptorLimit() {
+    using namespace quarn;
+    constexpr rlim_t kUnlimitedCap = rlim_t{1} << 20;
+    struct rlimit limit {};
+    if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) {
+        QRN_LOG_ERROR(LogCategory::Unspecified, "Could not read the descriptor limit: {}",
+                      std::strerror(errno));
+        return;
+    }
+    const rlim_t wanted = limit.rlim_max == RLIM_INFINITY ? kUnlimitedCap : limit.rlim_max;
+    if (wanted > limit.rlim_cur) {
+        const rlim_t before = limit.rlim_cur;
+        limit.rlim_cur = wanted;
+        if (::setrlimit(RLIMIT_NOFILE, &limit) != 0) {
+            QRN_LOG_ERROR(LogCategory::Unspecified,
+                          "Could not raise the descriptor limit from {} to {}: {}", before, wanted,
+                          std::strerror(errno));
+            return;
+        }
+    }
+    QRN_LOG_NOTICE(LogCategory::Unspecified, "Descriptor limit: {}{}", limit.rlim_cur,
+                   limit.rlim_cur < 65536 ? " (the hard limit allows no more than this)" : "");
+}
+
+} // namespace
 
 int main(int argc, char** argv) {
     using namespace quarn;
@@ -28,6 +64,7 @@ int main(int argc, char** argv) {
     if (options.foreground) {
         Log::addStderr();
     }
+    raiseDescriptorLimit();
     // Error descriptions keep paths as they are: nothing here localises them.
 
     auto context = std::make_shared<QRNDaemonContext>(options.root);
