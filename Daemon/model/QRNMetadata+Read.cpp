@@ -184,8 +184,14 @@ std::uint64_t MetadataReader::readIdentifierUUIDAndClass() {
 
 // A container directory named by a UUID holds only its own record: a file
 // copied from another container does not make this one that container.
-// System containers named by identifier have no name to compare.
+// System containers are left out: some are named by identifier, the others
+// get a fresh directory UUID at every regeneration while their record keeps
+// its own, and all lie in root-owned directories users cannot plant in.
 std::uint64_t MetadataReader::checkDirectoryName() {
+    if (containerClass == kQRNContainerClassSystemData ||
+        containerClass == kQRNContainerClassSystemGroup) {
+        return kQRNErrorNone;
+    }
     const std::size_t slash = url.rfind('/');
     const std::size_t before = slash == std::string::npos ? 0 : url.rfind('/', slash - 1);
     if (slash == std::string::npos || slash == 0 || before == std::string::npos) {
