@@ -13,6 +13,9 @@
 
 #include <algorithm>
 #include <fstream>
+#include <functional>
+#include <sys/stat.h>
+#include <unistd.h>
 
 using namespace quarn;
 
@@ -345,6 +348,57 @@ TEST_F(QRNContainerCacheTest, TheUserIdentityCacheTellsTheCacheWhomItDroppedWhil
     }
     dropEnterprise();
     EXPECT_EQ(notificationsPosted(), 1u);
+}
+
+} // namespace
+
+namespace {
+
+// A metadata file counts only as the daemon writes it; anything a user can
+// plant in a directory of theirs is reported and stays out of the cache.
+TEST_F(QRNContainerCacheTest, MetadataFilesUsersCouldPlantAreReportedAndNeverCached) {
+    namespace fs = std::filesystem;
+    struct Case {
+        const char* name;
+        std::function<void(const fs::path& dir, const fs::path& file)> plant;
+        const char* reason; // in the report
+    };
+    const Case cases[] = {
+        {"not root-owned", [](auto&, auto& file) { ASSERT_EQ(::chown(file.c_str(), 501, 501), 0); },
+         "owned by uid 501"},
+        {"two links",
+         [](auto& dir, auto& file) { ASSERT_EQ(::link(file.c_str(), (dir / "x").c_str()), 0); },
+         "2 links"},
+        {"too big",
+         [](auto&, auto& file) { std::ofstream(file, std::ios::app) << std::string(70000, ' '); },
+         "bytes"},
+        {"symlink",
+         [](auto& dir, auto& file) {
+             fs::rename(file, dir / "real");
+             fs::create_symlink(dir / "real", file);
+         },
+         "not a regular file (mode 120000)"},
+        {"not regular",
+         [](auto&, auto& file) {
+             fs::remove(file);
+             ASSERT_EQ(::mkfifo(file.c_str(), 0600), 0);
+         },
+         "not a regular file (mode 10000)"},
+        {"UUID mismatch",
+         [](auto& dir, auto&) { fs::rename(dir, dir.parent_path() / UUID::random().string()); },
+         "does not match its directory"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        auto made = makeContainer(kData, "com.example.planted");
+        c.plant(made->url(), made->url() / QRNMetadata::kFileName);
+        cache().invalidateUserIdentity(mobile());
+        log_.clear();
+        EXPECT_EQ(identifiersOf(kData), Ids{}) << log_.all();
+        EXPECT_TRUE(log_.contains(c.reason)) << log_.all();
+        EXPECT_TRUE(log_.contains("INCONSISTENT"));
+        std::filesystem::remove_all(classDirectory(kData));
+    }
 }
 
 } // namespace
