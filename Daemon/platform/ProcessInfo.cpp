@@ -162,6 +162,11 @@ Expected<std::string, int> ProcessInfo::loaderInjection() const {
     if (environ->size() > kMaxEnvironmentBytes) {
         return Unexpected<int>(EFBIG);
     }
+    // During an execve the new executable shows before its environment is
+    // in place: that process cannot be told clean, and is asked again later.
+    if (environ->empty()) {
+        return Unexpected<int>(EAGAIN);
+    }
     return findLoaderInjection(*environ);
 }
 

@@ -51,7 +51,8 @@ public:
     // The first variable of the initial environment that makes the dynamic
     // loader run code the program did not name ("LD_PRELOAD=..."), or ""
     // when there is none. An environment too large to read whole counts as
-    // one (EFBIG).
+    // one (EFBIG), an empty one as unreadable (EAGAIN: a process in the
+    // middle of an execve shows none).
     Expected<std::string, int> loaderInjection() const;
 
     // Parsers of the file contents; none for anything malformed.

@@ -72,14 +72,19 @@ protected:
 };
 
 // Whether the child `pid` runs `program`, by the kernel's account, within a
-// few seconds.
+// few seconds, its execve complete (its environment in place).
 bool runs(pid_t pid, const std::filesystem::path& program) {
-    const auto exe = "/proc/" + std::to_string(pid) + "/exe";
-    std::error_code error;
-    for (int i = 0; i < 5000 && std::filesystem::read_symlink(exe, error) != program; ++i) {
+    const auto proc = "/proc/" + std::to_string(pid);
+    const auto settled = [&] {
+        std::error_code error;
+        std::ifstream environ(proc + "/environ");
+        return std::filesystem::read_symlink(proc + "/exe", error) == program &&
+               environ.peek() != std::char_traits<char>::eof();
+    };
+    for (int i = 0; i < 5000 && !settled(); ++i) {
         ::usleep(1000);
     }
-    return std::filesystem::read_symlink(exe, error) == program;
+    return settled();
 }
 
 } // namespace
