@@ -7,6 +7,7 @@
 #include "Daemon/fs/TreeWalker.h"
 
 #include <cstdio>
+#include <cstdlib>
 
 namespace quarn::test {
 namespace {
@@ -23,15 +24,39 @@ protected:
     fs::path dir() const { return root_.path(); }
 };
 
+// Where a hundred thousand directories are quick to make: a tmpfs when there
+// is one (on a journaled disk the mkdirs alone take most of a minute).
+class DeepScratch {
+public:
+    DeepScratch() {
+        std::string pattern =
+            (fs::exists("/dev/shm") ? "/dev/shm" : "/tmp") + std::string("/quarn-deep-XXXXXX");
+        path_ = ::mkdtemp(pattern.data()) ? fs::path(pattern) : fs::path();
+    }
+    ~DeepScratch() {
+        std::error_code ignored;
+        fs::remove(path_ / "deep", ignored);
+        fs::remove(path_, ignored);
+    }
+    const fs::path& path() const { return path_; }
+
+private:
+    fs::path path_;
+};
+
 TEST_F(DeepTreeTest, AHundredThousandLevelsAreWalkedMeasuredAndRemovedWithFewDescriptors) {
     constexpr int kDepth = 100000;
-    const fs::path top = dir() / "deep";
+    const DeepScratch scratch;
+    ASSERT_FALSE(scratch.path().empty());
+    const fs::path top = scratch.path() / "deep";
     makeDeepTree(top, kDepth, 1);
     const long before = openDescriptors();
 
-    // Every level counts at least what the top does (nothing on a tmpfs).
+    // Every level counts at least what the top does (nothing on a tmpfs), and
+    // the walk reached the bottom: every directory and the file were counted.
     const std::int64_t perLevel = lstatOf(top).st_blocks * 512;
     EXPECT_GE(manager_.diskUsageForURL(top), perLevel * kDepth);
+    EXPECT_TRUE(log_.contains(fmt::format("descendants: {},", kDepth + 1))) << log_.all();
 
     long atBottom = -1;
     env_->setHook([&](EnvCall call, std::uint64_t) {
