@@ -83,9 +83,24 @@ struct Pipe {
     int fds[2] = {-1, -1};
 };
 
-// Resumes a stopped daemon however the test ends.
+// Stops the daemon, every thread of it, and resumes it however the test ends.
 struct Stopped {
-    explicit Stopped(pid_t pid) : pid(pid) { ::kill(pid, SIGSTOP); }
+    explicit Stopped(pid_t pid) : pid(pid) {
+        ::kill(pid, SIGSTOP);
+        const auto task = std::filesystem::path("/proc") / std::to_string(pid) / "task";
+        EXPECT_TRUE(waitUntil([&] {
+            std::error_code error;
+            for (const auto& thread : std::filesystem::directory_iterator(task, error)) {
+                std::ifstream stat(thread.path() / "stat");
+                const std::string text(std::istreambuf_iterator<char>(stat), {});
+                const std::size_t state = text.rfind(") ");
+                if (state == std::string::npos || text.substr(state + 2, 1) != "T") {
+                    return false;
+                }
+            }
+            return !error;
+        }));
+    }
     ~Stopped() { ::kill(pid, SIGCONT); }
     pid_t pid;
 };
