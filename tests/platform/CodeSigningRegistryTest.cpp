@@ -177,7 +177,7 @@ TEST_F(CodeSigningRegistryTest, BadEntriesAreSkippedAndTheLaterFileWins) {
     write("c-short-digest.plist", with(entry("/bin/c", "c"), "SHA256", std::string(63, 'a')));
     write("d-bad-digest.plist", with(entry("/bin/d", "d"), "SHA256", std::string(64, 'g')));
     write("e-entitlements.plist", with(entry("/bin/e", "e"), "Entitlements", Value::array()));
-    write("e-holders.plist", with(entry("/bin/e2", "e2"), "EntitledUsers", "root"));
+    write("e-holders.plist", with(entry("/bin/holders", "holders"), "EntitledUsers", "root"));
     write("f-sandboxed.plist", with(entry("/bin/f", "f"), "Sandboxed", "true"));
     write("g-group-writable.plist", entry("/bin/g", "g"));
     ::chmod((directory_ / "g-group-writable.plist").c_str(), 0664);
