@@ -119,7 +119,9 @@ Status QRNFileManager::setTopLevelSystemContainerACLAtURL(const fs::path& url) {
     if (!list) {
         return QRN_UNEXPECTED(list.error());
     }
-    auto item = openItem(*env_, AT_FDCWD, url.c_str());
+    auto parent = resolver().openParent(url);
+    auto item = parent ? openItem(*env_, parent->directory.get(), parent->name.c_str())
+                       : SysResult<OpenedItem>(SysError(parent.error()));
     SysStatus set = item ? applyList(*env_, *list, *item) : SysError(item.error());
     if (!set) {
         return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorSetACLFailed, "Failed to set ACL on {}: {}",

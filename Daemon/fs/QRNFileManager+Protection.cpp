@@ -1,6 +1,7 @@
 // Reading and setting an item's data protection class.
 
 #include "Daemon/fs/EnvFd.h"
+#include "Daemon/fs/PathResolver.h"
 #include "Daemon/fs/QRNFileManager.h"
 #include "Daemon/platform/LockState.h"
 #include "Daemon/support/ProtectionClassAttribute.h"
@@ -25,12 +26,12 @@ constexpr int kClassUnavailableWhileLocked = 1;
 // hold a class: those are reopened for reading through the descriptor's
 // /proc entry (the same inode, never a link); anything else keeps its O_PATH
 // descriptor, on which the attribute calls answer EBADF.
-SysResult<EnvFd> openItem(Env& env, const fs::path& url) {
-    auto opened = env.openat(AT_FDCWD, url.c_str(), O_PATH | O_NOFOLLOW);
+SysResult<EnvFd> openItem(Env& env, const PathResolver& resolver, const fs::path& url) {
+    auto opened = resolver.open(url, O_PATH | O_NOFOLLOW);
     if (!opened) {
         return SysError(opened.error());
     }
-    EnvFd item(env, *opened);
+    EnvFd item = std::move(*opened);
     auto st = env.fstat(item.get());
     if (!st) {
         return SysError(st.error());
@@ -63,7 +64,7 @@ Error setClassError(const fs::path& url, int protectionClass, int err) {
 } // namespace
 
 Result<int> QRNFileManager::dataProtectionClassOfItemAtURL(const fs::path& url) {
-    auto item = openItem(*env_, url);
+    auto item = openItem(*env_, resolver(), url);
     if (!item) {
         return QRN_UNEXPECTED(openError(url, item.error()));
     }
@@ -76,7 +77,7 @@ Result<int> QRNFileManager::dataProtectionClassOfItemAtURL(const fs::path& url) 
 
 Status QRNFileManager::setDataProtectionClassOfItemAtURL(const fs::path& url, int protectionClass,
                                                          std::function<bool(int)> predicate) {
-    auto item = openItem(*env_, url);
+    auto item = openItem(*env_, resolver(), url);
     if (!item) {
         return QRN_UNEXPECTED(openError(url, item.error()));
     }

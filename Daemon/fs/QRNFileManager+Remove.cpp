@@ -17,11 +17,13 @@ Status QRNFileManager::removeItemAtURL(const std::filesystem::path& url) {
     }
     int err = 0;
     if (auto parts = ParentAndName::of(url)) {
-        auto parent = env_->openat(AT_FDCWD, parts->parent.c_str(), O_PATH | O_DIRECTORY);
+        // Opened without links below the root prefix: what is removed is
+        // what the path names, never what a link leads to.
+        auto parent = resolver().openParent(url);
         if (parent) {
-            EnvFd parentFd(*env_, *parent);
             TreeRemover remover(*env_);
-            remover.removeTree(parentFd.get(), parts->parent.string(), parts->name.c_str());
+            remover.removeTree(parent->directory.get(), parts->parent.string(),
+                               parts->name.c_str());
             err = remover.firstError();
         } else {
             err = parent.error();

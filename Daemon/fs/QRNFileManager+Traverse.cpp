@@ -16,14 +16,26 @@ Status QRNFileManager::_traverseDirectory(const std::filesystem::path& url,
     Signpost signpost(LogCategory::Fs, "TraversingDirectory", url.string());
     std::optional<Error> blockError;
     TreeWalker walker(*env_);
-    auto failure = walker.walk(url, [&](const TraversalEntry& entry) {
+    const auto visit = [&](const TraversalEntry& entry) {
         auto status = block(entry);
         if (!status) {
             blockError = status.error();
             return false;
         }
         return true;
-    });
+    };
+    // The root's parent is opened without links below the root prefix, so
+    // the walk starts in the directory the path names, not where a link leads.
+    // ("/" has no parent to open: it is walked as it is.)
+    auto parent = resolver().openParent(url);
+    std::optional<TreeWalker::Failure> failure;
+    if (parent) {
+        failure = walker.walk(parent->directory.get(), parent->name.c_str(), url, visit);
+    } else if (parent.error() == EINVAL) {
+        failure = walker.walk(url, visit);
+    } else {
+        failure = TreeWalker::Failure{TreeWalker::Failure::Stage::Open, parent.error(), url};
+    }
     signpost.end(fmt::format("{} nodes", walker.nodeCount()));
     if (blockError) {
         return QRN_UNEXPECTED(*blockError);

@@ -25,6 +25,12 @@ Entry::Kind kindOf(mode_t mode) {
 
 std::optional<TreeWalker::Failure> TreeWalker::walk(const std::filesystem::path& root,
                                                     const Visit& visit) {
+    return walk(AT_FDCWD, root.c_str(), root, visit);
+}
+
+std::optional<TreeWalker::Failure> TreeWalker::walk(int parentFd, const char* name,
+                                                    const std::filesystem::path& root,
+                                                    const Visit& visit) {
     visit_ = &visit;
     nodes_ = 0;
     stopped_ = false;
@@ -32,7 +38,7 @@ std::optional<TreeWalker::Failure> TreeWalker::walk(const std::filesystem::path&
     if (root.empty()) {
         return Failure{Failure::Stage::Open, ENOENT, root};
     }
-    auto st = env_.fstatat(AT_FDCWD, root.c_str(), AT_SYMLINK_NOFOLLOW);
+    auto st = env_.fstatat(parentFd, name, AT_SYMLINK_NOFOLLOW);
     if (!st) {
         return Failure{Failure::Stage::Entry, st.error(), root};
     }
@@ -42,11 +48,15 @@ std::optional<TreeWalker::Failure> TreeWalker::walk(const std::filesystem::path&
     entry.name = root.filename().string();
     entry.status = *st;
     entry.kind = kindOf(st->st_mode);
+    rootParentFd_ = parentFd;
+    entry.parentFd = parentFd;
     if (!report(entry) || entry.kind != Entry::Kind::DirectoryPreOrder) {
         return std::nullopt;
     }
-    DirectoryStack stack(env_, std::string(), openLevels_);
-    if (auto pushed = stack.push(AT_FDCWD, root.c_str()); !pushed) {
+    // From an opened parent only the last name is walked; the path is for messages.
+    DirectoryStack stack(env_, parentFd == AT_FDCWD ? std::string() : root.parent_path().string(),
+                         openLevels_);
+    if (auto pushed = stack.push(parentFd, name); !pushed) {
         return Failure{Failure::Stage::Entry, pushed.error(), root};
     }
     walkBelow(stack);
@@ -126,7 +136,7 @@ void TreeWalker::leaveDirectory(DirectoryStack& stack) {
     entry.name = level == 0 ? std::filesystem::path(name).filename().string() : name;
     entry.level = level;
     entry.status = *st;
-    entry.parentFd = stack.empty() ? AT_FDCWD : stack.fd();
+    entry.parentFd = stack.empty() ? rootParentFd_ : stack.fd();
     report(entry);
     stack.truncatePath(mark);
 }

@@ -36,6 +36,11 @@ public:
 
     // Nothing when the walk ran to its end or the visitor stopped it.
     std::optional<Failure> walk(const std::filesystem::path& root, const Visit& visit);
+    // The same for the item `name` of the open directory `parentFd`, which
+    // `root` names in messages and entries: no link on the way to it is
+    // followed again.
+    std::optional<Failure> walk(int parentFd, const char* name, const std::filesystem::path& root,
+                                const Visit& visit);
 
     std::uint64_t nodeCount() const { return nodes_; }
     bool stopped() const { return stopped_; }
@@ -53,6 +58,7 @@ private:
     std::size_t openLevels_;
     const Visit* visit_ = nullptr;
     dev_t rootDev_ = 0;
+    int rootParentFd_ = AT_FDCWD; // the open parent of the walk's root
     std::uint64_t nodes_ = 0;
     bool stopped_ = false;
     std::optional<Failure> failure_;

@@ -365,7 +365,8 @@ QRNMetadata::readAndValidateMetadataAtFilePath(const std::string& url,
         QRN_LOG_ERROR(LogCategory::Metadata, "Can't act on an invalid object: identity: (null)");
         return QRN_CODE(kQRNErrorInvalidArgument);
     }
-    auto read = QRNMetadataFile::readTrusted(QRNFileManager::defaultManager().env(), url);
+    auto& manager = QRNFileManager::defaultManager();
+    auto read = QRNMetadataFile::readTrusted(manager.env(), manager.resolver(), url);
     if (!read) {
         QRN_LOG_ERROR(LogCategory::Metadata, "Failed to read metadata at URL {}", url);
         return QRN_CODE(kQRNErrorReadPlistFailed);

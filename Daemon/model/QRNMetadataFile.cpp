@@ -22,8 +22,9 @@ Error failed(const std::string& path, const char* what, int err) {
 
 } // namespace
 
-Result<PropertyListPtr> QRNMetadataFile::readTrusted(Env& env, const std::string& path) {
-    auto bytes = readBytes(env, path);
+Result<PropertyListPtr> QRNMetadataFile::readTrusted(Env& env, const PathResolver& resolver,
+                                                     const std::string& path) {
+    auto bytes = readBytes(env, resolver, path);
     if (!bytes) {
         return QRN_UNEXPECTED(bytes.error());
     }
@@ -41,18 +42,19 @@ Result<PropertyListPtr> QRNMetadataFile::readTrusted(Env& env, const std::string
     return root;
 }
 
-Result<std::string> QRNMetadataFile::readBytes(Env& env, const std::string& path) {
+Result<std::string> QRNMetadataFile::readBytes(Env& env, const PathResolver& resolver,
+                                               const std::string& path) {
     const std::size_t slash = path.rfind('/');
     if (slash == std::string::npos || slash + 1 == path.size()) {
         return QRN_UNEXPECTED(untrusted(path, "not a file path"));
     }
     const std::string directory = slash == 0 ? "/" : path.substr(0, slash);
     const std::string name = path.substr(slash + 1);
-    auto dir = env.openat(AT_FDCWD, directory.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    auto dir = resolver.open(directory, O_PATH | O_DIRECTORY | O_NOFOLLOW);
     if (!dir) {
         return QRN_UNEXPECTED(failed(path, "opening its directory", dir.error()));
     }
-    EnvFd dirFd(env, *dir);
+    EnvFd dirFd = std::move(*dir);
     // Looked at before opening: opening a device or a fifo may act or block.
     auto before = env.fstatat(dirFd.get(), name.c_str(), AT_SYMLINK_NOFOLLOW);
     if (!before) {

@@ -8,6 +8,7 @@
 // huge one); none of that may name a container.
 
 #include "Daemon/fs/Env.h"
+#include "Daemon/fs/PathResolver.h"
 #include "Daemon/support/PropertyList.h"
 #include "Daemon/support/QRNError.h"
 
@@ -22,10 +23,14 @@ public:
 
     // The file's dictionary; an error (logged) when it is not to be trusted,
     // unreadable or not a dictionary.
-    static Result<PropertyListPtr> readTrusted(Env& env, const std::string& path);
+    // `resolver` opens the container directory (no link anywhere below the
+    // root prefix).
+    static Result<PropertyListPtr> readTrusted(Env& env, const PathResolver& resolver,
+                                               const std::string& path);
 
 private:
-    static Result<std::string> readBytes(Env& env, const std::string& path);
+    static Result<std::string> readBytes(Env& env, const PathResolver& resolver,
+                                         const std::string& path);
     static Status checkStatus(const struct stat& st, const std::string& path);
 };
 

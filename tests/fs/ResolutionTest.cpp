@@ -43,6 +43,12 @@ TEST_F(ResolutionTest, ALinkAtAnyLevelFailsEveryOperationAndTouchesNothingBehind
         EXPECT_TRUE(failedWith(manager_.moveItemAtURL(deep() / "item", root_ / "/moved"), ELOOP));
         EXPECT_TRUE(failedWith(manager_.moveItemAtURL(root_ / "/private", deep() / "p"), ELOOP));
         EXPECT_TRUE(failedWith(manager_.openDirectoryAtURL(deep()), ELOOP));
+        // Walks, removal and attribute changes start at the opened parent too.
+        EXPECT_LT(manager_.diskUsageForURL(deep() / "item"), 0);
+        EXPECT_TRUE(failedWith(manager_.removeItemAtURL(deep() / "item"), ELOOP));
+        EXPECT_TRUE(
+            failedWith(manager_.standardizeOwnershipAtURL(deep() / "item", 501, 501), ELOOP));
+        EXPECT_FALSE(manager_.setDataProtectionClassOfItemAtURL(deep() / "item", 3));
 
         EXPECT_EQ(countEntries(victim()), before);
         EXPECT_EQ(readFile(victim() / "Containers/Data/Application/item"), "victim");
