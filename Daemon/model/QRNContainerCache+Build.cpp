@@ -46,27 +46,94 @@ void QRNContainerCache::runRebuildGate(std::uint64_t cls) {
     }
 }
 
+// Registers a build of an entry for its scope. Whichever way the build ends
+// it leaves the register, is marked done and wakes the requests waiting for
+// it, so none waits for a build that is gone. Made and destroyed with the
+// cache's lock held.
+class QRNContainerCache::BuildRecord {
+public:
+    BuildRecord(QRNContainerCache& cache, std::string key)
+        : cache_(cache), key_(std::move(key)), build_(std::make_shared<Build>()) {
+        cache_.builds_.insert_or_assign(key_, build_);
+    }
+    ~BuildRecord() {
+        cache_.builds_.erase(key_);
+        build_->done = true;
+        cache_.buildDone_.notify_all();
+    }
+    BuildRecord(const BuildRecord&) = delete;
+    BuildRecord& operator=(const BuildRecord&) = delete;
+
+    Build* operator->() const { return build_.get(); }
+
+private:
+    QRNContainerCache& cache_;
+    std::string key_;
+    std::shared_ptr<Build> build_;
+};
+
+namespace {
+
+// Leaves a held lock for a scope.
+template <typename Lockable> class Unlocked {
+public:
+    explicit Unlocked(Lockable& locked) : locked_(locked) { locked_.unlock(); }
+    ~Unlocked() { locked_.lock(); }
+    Unlocked(const Unlocked&) = delete;
+    Unlocked& operator=(const Unlocked&) = delete;
+
+private:
+    Lockable& locked_;
+};
+
+} // namespace
+
 Result<QRNContainerCache::Entry*>
-QRNContainerCache::_lock_rebuild(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
-                                 bool transient, bool populateSandbox) {
+QRNContainerCache::_lock_rebuild(Locker& locked, const QRNUserIdentityPtr& userIdentity,
+                                 std::uint64_t cls, bool transient, bool populateSandbox) {
     _lock_assertOwned(__func__);
     const std::string key = cacheKey(*userIdentity, cls);
-    QRN_LOG_INFO(LogCategory::Cache, "Rebuilding container class cache: {}{}", key,
-                 transientSuffix(transient));
+    BuildRecord build(*this, buildKey(key, transient));
+    std::optional<Result<Entry>> scanned;
+    // An invalidation during the scan makes it stale: scanned again rather
+    // than merged, since it may stand for a user identity that is gone and
+    // what it dropped cannot be told apart from what the scan read. Adds and
+    // removals cannot overlap a scan: they wait for the build and change the
+    // published entry.
+    while (!scanned || build->stale) {
+        build->stale = false;
+        QRN_LOG_INFO(LogCategory::Cache, "Rebuilding container class cache: {}{}", key,
+                     transientSuffix(transient));
+        Unlocked unlocked(locked);
+        scanned.emplace(buildEntry(userIdentity, cls, transient));
+    }
+    Result<Entry>& built = *scanned;
+    if (!built) {
+        build->failure = built.error();
+        return QRN_UNEXPECTED(built.error());
+    }
+    EntryMap& entries = transient ? transient_ : permanent_;
+    auto [stored, inserted] = entries.insert_or_assign(key, std::move(*built));
+    if (populateSandbox && !transient) {
+        _lock_populateSandbox(stored->second, *userIdentity);
+    }
+    return &stored->second;
+}
+
+Result<QRNContainerCache::Entry>
+QRNContainerCache::buildEntry(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                              bool transient) {
     Signpost interval(LogCategory::Cache, "RebuildingCache", fmt::format("class: {}", cls));
-    runRebuildGate(cls);
     try {
-        auto built = _lock_scanClassDirectory(userIdentity, cls, transient, populateSandbox);
-        if (!built) {
-            return QRN_UNEXPECTED(built.error());
+        runRebuildGate(cls);
+        auto built = scanClassDirectory(userIdentity, cls, transient);
+        if (built) {
+            interval.end(fmt::format("{} containers", built->containers.size()));
         }
-        interval.end(fmt::format("{} containers", built->containers.size()));
-        EntryMap& entries = transient ? transient_ : permanent_;
-        auto [stored, inserted] = entries.insert_or_assign(key, std::move(*built));
         // The scan's reads leave freed memory behind (the listing, every
         // parsed file) that the allocator keeps resident unless told.
         ::malloc_trim(0);
-        return &stored->second;
+        return built;
     } catch (const std::exception& e) {
         return QRN_UNEXPECTED(
             QRN_ERROR(kQRNErrorException, "Got exception: {} : {}", typeid(e).name(), e.what()));
@@ -74,10 +141,8 @@ QRNContainerCache::_lock_rebuild(const QRNUserIdentityPtr& userIdentity, std::ui
 }
 
 Result<QRNContainerCache::Entry>
-QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdentity,
-                                            std::uint64_t cls, bool transient,
-                                            bool populateSandbox) {
-    _lock_assertOwned(__func__);
+QRNContainerCache::scanClassDirectory(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                                      bool transient) {
     const std::string key = cacheKey(*userIdentity, cls);
     const char* suffix = transientSuffix(transient);
     auto failed = [&](std::optional<Error> underlying) {
@@ -99,7 +164,6 @@ QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdenti
         return QRN_UNEXPECTED(failed(items.error()));
     }
     Entry entry;
-    entry.sandboxPopulated = populateSandbox && !transient;
     // By reference: a conditional with a temporary on one side would copy
     // the whole listing.
     static const std::vector<QRNFileManager::Item> kNoItems;
@@ -137,17 +201,7 @@ QRNContainerCache::_lock_scanClassDirectory(const QRNUserIdentityPtr& userIdenti
             continue;
         }
         // A later record with the same identifier replaces the earlier.
-        Slot& slot = storeRecord(entry, std::move(*metadata));
-        const std::string& identifier = slot.record->identifier();
-        if (entry.sandboxPopulated &&
-            shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, cls)) {
-            if (int err = _lock_mapContainer(slot, *userIdentity); err != 0) {
-                QRN_LOG_ERROR(LogCategory::Sandbox,
-                              "Failed to set container mapping during create/lookup operation "
-                              "of {}, {}",
-                              identifier, err);
-            }
-        }
+        storeRecord(entry, std::move(*metadata));
     }
     return entry;
 }

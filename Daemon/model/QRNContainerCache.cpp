@@ -100,19 +100,43 @@ void QRNContainerCache::assertNotOwned(const char* function) const {
 }
 
 Result<QRNContainerCache::Entry*>
-QRNContainerCache::_lock_entryFor(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
-                                  bool transient, bool populateSandbox) {
+QRNContainerCache::_lock_entryFor(Locker& locked, const QRNUserIdentityPtr& userIdentity,
+                                  std::uint64_t cls, bool transient, bool populateSandbox) {
     _lock_assertOwned(__func__);
     EntryMap& entries = transient ? transient_ : permanent_;
-    auto found = entries.find(cacheKey(*userIdentity, cls));
-    if (found == entries.end()) {
-        return _lock_rebuild(userIdentity, cls, transient, populateSandbox);
+    const std::string key = cacheKey(*userIdentity, cls);
+    // Looped: an entry published by the build waited for may be invalidated
+    // again before this thread has the lock back.
+    for (;;) {
+        if (auto found = entries.find(key); found != entries.end()) {
+            Entry& entry = found->second;
+            if (populateSandbox && !transient && !entry.sandboxPopulated) {
+                _lock_populateSandbox(entry, *userIdentity);
+            }
+            return &entry;
+        }
+        auto waited = _lock_awaitBuild(locked, key, transient);
+        if (!waited) {
+            return _lock_rebuild(locked, userIdentity, cls, transient, populateSandbox);
+        }
+        if (waited->failure) {
+            return QRN_UNEXPECTED(*waited->failure);
+        }
     }
-    Entry& entry = found->second;
-    if (populateSandbox && !transient && !entry.sandboxPopulated) {
-        _lock_populateSandbox(entry, *userIdentity);
+}
+
+std::shared_ptr<QRNContainerCache::Build>
+QRNContainerCache::_lock_awaitBuild(Locker& locked, const std::string& key, bool transient) {
+    _lock_assertOwned(__func__);
+    std::shared_ptr<Build> waited;
+    for (auto found = builds_.find(buildKey(key, transient)); found != builds_.end();
+         found = builds_.find(buildKey(key, transient))) {
+        waited = found->second;
+        QRN_LOG_DEBUG(LogCategory::Cache, "Cache: {}{}: waiting for its rebuild", key,
+                      transientSuffix(transient));
+        buildDone_.wait(locked, [&] { return waited->done; });
     }
-    return &entry;
+    return waited;
 }
 
 QRNContainerCache::MetadataPtr
@@ -171,7 +195,7 @@ QRNContainerCache::containerForContainerIdentity(const QRNContainerIdentityPtr& 
             return fromKernel;
         }
     }
-    auto entry = _lock_entryFor(user, cls, transient, updateSandbox);
+    auto entry = _lock_entryFor(locked, user, cls, transient, updateSandbox);
     if (!entry) {
         return QRN_UNEXPECTED(entry.error());
     }
@@ -199,7 +223,8 @@ QRNContainerCache::allContainersForUserIdentity(const QRNUserIdentityPtr& userId
             QRN_ERROR(kQRNErrorInvalidCacheInput, "Invalid Content Class: {}", contentClass));
     }
     Locker locked(*this);
-    auto entry = _lock_entryFor(userIdentity, contentClass, transient, populateSandboxCache);
+    auto entry =
+        _lock_entryFor(locked, userIdentity, contentClass, transient, populateSandboxCache);
     if (!entry) {
         return QRN_UNEXPECTED(entry.error());
     }
@@ -236,7 +261,7 @@ Status QRNContainerCache::addContainerMetadata(const MetadataPtr& metadata,
     const auto& user = record->userIdentity();
     const std::uint64_t cls = record->containerClass();
     Locker locked(*this);
-    auto entry = _lock_entryFor(user, cls, transient, false);
+    auto entry = _lock_entryFor(locked, user, cls, transient, false);
     if (!entry) {
         return QRN_UNEXPECTED(entry.error());
     }
@@ -267,6 +292,10 @@ Status QRNContainerCache::removeContainerForUserIdentity(const QRNUserIdentityPt
     }
     const std::string key = cacheKey(*userIdentity, contentClass);
     Locker locked(*this);
+    // A scan under way may have listed the container before it left its
+    // class directory: the removal applies to the entry that build
+    // publishes, not to none.
+    _lock_awaitBuild(locked, key, transient);
     EntryMap& entries = transient ? transient_ : permanent_;
     std::optional<Slot> removed;
     if (auto found = entries.find(key); found != entries.end()) {
@@ -306,6 +335,13 @@ void QRNContainerCache::invalidateUserIdentity(const QRNUserIdentityPtr& userIde
                 permanent_.erase(found);
             }
             transient_.erase(key);
+            // A scan under way may have read what the invalidation drops.
+            for (bool transient : {false, true}) {
+                if (auto building = builds_.find(buildKey(key, transient));
+                    building != builds_.end()) {
+                    building->second->stale = true;
+                }
+            }
         }
     }
     if (auto posted = notifications_->post(Notifications::kUserInvalidated); !posted) {

@@ -16,6 +16,11 @@
 // The operations are spread over files by concern: QRNContainerCache.cpp
 // (lookups, insertion, removal, invalidation), +Build (scanning a class
 // directory), +Sandbox (the kernel sandbox mapping and its read-back).
+//
+// A class directory is scanned without the cache's lock: a user chooses how
+// much their own directories hold, so one entry's build must not hold up
+// requests for any other entry. Requests for the entry being built wait for
+// that build and share its result.
 
 #include "Daemon/model/QRNContainerIdentity.h"
 #include "Daemon/model/QRNMetadata.h"
@@ -24,6 +29,7 @@
 #include "Daemon/support/QRNError.h"
 
 #include <atomic>
+#include <condition_variable>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
@@ -49,8 +55,8 @@ class QRNWhitelist;
 class QRNContainerCache {
 public:
     using MetadataPtr = std::shared_ptr<const QRNMetadata>;
-    // Runs just before a class directory is scanned, with the cache's lock
-    // held; test facilities use it to hold a rebuild at that point.
+    // Runs just before a class directory is scanned, without the cache's
+    // lock; test facilities use it to hold a rebuild at that point.
     using RebuildGate = std::function<void(std::uint64_t containerClass)>;
 
     // With the context's shared user identity cache.
@@ -139,7 +145,17 @@ private:
         bool sandboxPopulated = false;
     };
     using EntryMap = std::unordered_map<std::string, Entry>;
+    // An entry's build under way. Other requests for the entry wait until
+    // `done` and then use the published entry, or fail with `failure`.
+    struct Build {
+        bool done = false;
+        // Set when the user was invalidated during the scan: the scan may
+        // predate the invalidation and is redone before publishing.
+        bool stale = false;
+        std::optional<Error> failure;
+    };
     class Observer;
+    class BuildRecord;
 
     // Holds the lock for a scope and records the owner for the `_lock_`
     // assertions.
@@ -149,6 +165,9 @@ private:
         ~Locker() { cache_.unlock(); }
         Locker(const Locker&) = delete;
         Locker& operator=(const Locker&) = delete;
+        // For condition waits and for leaving the lock during a scan.
+        void lock() { cache_.lock(); }
+        void unlock() { cache_.unlock(); }
 
     private:
         QRNContainerCache& cache_;
@@ -161,8 +180,13 @@ private:
     static const char* transientSuffix(bool transient) { return transient ? "(transient)" : ""; }
 
     // --- Entries (QRNContainerCache.cpp) ---
-    Result<Entry*> _lock_entryFor(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
-                                  bool transient, bool populateSandbox);
+    // The entry, built first if need be; waits for a build of it that is
+    // under way (leaving the lock meanwhile).
+    Result<Entry*> _lock_entryFor(Locker& locked, const QRNUserIdentityPtr& userIdentity,
+                                  std::uint64_t cls, bool transient, bool populateSandbox);
+    // Waits until no build of the entry is under way; the last one waited
+    // for, if any.
+    std::shared_ptr<Build> _lock_awaitBuild(Locker& locked, const std::string& key, bool transient);
     MetadataPtr _lock_find(const Entry& entry, const QRNContainerIdentity& identity) const;
     // Inserts or replaces the identifier's record; the slot of the record.
     static Slot& storeRecord(Entry& entry, MetadataPtr record);
@@ -170,11 +194,20 @@ private:
     static bool uuidMatches(const QRNContainerIdentity& identity, const QRNMetadata& metadata);
 
     // --- Building (+Build) ---
-    Result<Entry*> _lock_rebuild(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
-                                 bool transient, bool populateSandbox);
-    Result<Entry> _lock_scanClassDirectory(const QRNUserIdentityPtr& userIdentity,
-                                           std::uint64_t cls, bool transient, bool populateSandbox);
+    // Scans with the lock left, then publishes the entry (mapping it into
+    // the sandbox if asked) under the lock.
+    Result<Entry*> _lock_rebuild(Locker& locked, const QRNUserIdentityPtr& userIdentity,
+                                 std::uint64_t cls, bool transient, bool populateSandbox);
+    // Runs the gate and scans; takes no lock of the cache's.
+    Result<Entry> buildEntry(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                             bool transient);
+    Result<Entry> scanClassDirectory(const QRNUserIdentityPtr& userIdentity, std::uint64_t cls,
+                                     bool transient);
     void runRebuildGate(std::uint64_t cls);
+    // Builds are keyed apart for permanent and transient entries.
+    static std::string buildKey(const std::string& key, bool transient) {
+        return key + transientSuffix(transient);
+    }
     // containerURL for an item's last component.
     bool containerName(std::string_view name, std::uint64_t cls) const;
 
@@ -210,14 +243,18 @@ private:
     std::shared_ptr<Notifications> notifications_;
     std::shared_ptr<Observer> observer_; // registered (weakly) with the user identity cache
 
-    // Guards permanent_ and transient_; owned by this cache. Building an
-    // entry (disk reads included) happens under it.
+    // Guards permanent_, transient_ and builds_; owned by this cache. Never
+    // held while a class directory is scanned.
     std::mutex mutex_;
     std::atomic<std::thread::id> owner_;
     EntryMap permanent_;
     EntryMap transient_;
+    // Builds under way, by buildKey; a request that finds one waits on
+    // buildDone_ instead of scanning again.
+    std::unordered_map<std::string, std::shared_ptr<Build>> builds_;
+    std::condition_variable_any buildDone_;
 
-    // Guards gate_ only; taken inside mutex_, never the other way round.
+    // Guards gate_ only; never taken around mutex_.
     std::mutex gateMutex_;
     RebuildGate gate_;
 };

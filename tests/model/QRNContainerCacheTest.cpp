@@ -14,7 +14,10 @@
 #include <algorithm>
 #include <fstream>
 #include <functional>
+#include <future>
+#include <latch>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 using namespace quarn;
@@ -88,6 +91,15 @@ protected:
         const auto wanted = fmt::format("Rebuilding container class cache: {}", key);
         const auto lines = log_.messages();
         return static_cast<std::size_t>(std::count(lines.begin(), lines.end(), wanted));
+    }
+
+    // Until `n` requests have logged that they wait for a rebuild, or the
+    // request has finished without waiting (the fault the caller looks for).
+    template <typename T> void untilWaiting(std::size_t n, const std::future<T>& request) {
+        while (log_.count("waiting for its rebuild") < n &&
+               request.wait_for(std::chrono::seconds(0)) != std::future_status::ready) {
+            std::this_thread::yield();
+        }
     }
 
     std::size_t notificationsPosted() {
@@ -219,6 +231,74 @@ TEST_F(QRNContainerCacheTest, LookupsAnswerFromTheKernelOrOneBuildPerEntry) {
     auto beyond = cache().allContainersForUserIdentity(mobile(), kQRNContainerClassMax, false);
     ASSERT_FALSE(beyond);
     EXPECT_TRUE(beyond.error().isQRN(kQRNErrorInvalidCacheInput));
+}
+
+// --- Builds running beside other requests -----------------------------------------------
+
+// While one entry's scan is held, requests for other classes and users are
+// answered; a lookup of the held entry and a removal from it wait, then the
+// lookup gets the one build's record and the removal applies to the built
+// entry (its container was still listed by the scan) and its mapping.
+TEST_F(QRNContainerCacheTest, ARebuildStallsOnlyRequestsForItsOwnEntry) {
+    auto held = makeContainer(kData, "com.example.held");
+    makeContainer(kData, "com.example.gone");
+    makeContainer(kGroup, "group.example");
+    makeContainer(kSystem, "com.orvex.devicesettings", "com.orvex.devicesettings");
+    std::promise<void> entered;
+    std::latch release(1);
+    std::atomic<int> dataScans = 0;
+    cache().setRebuildGate([&](std::uint64_t cls) {
+        if (cls == kData && dataScans++ == 0) {
+            entered.set_value();
+            release.wait();
+        }
+    });
+    auto lookUp = [&](bool updateSandbox) {
+        return std::async(std::launch::async, [this, updateSandbox] {
+            return cache().containerForContainerIdentity(identity(kData, "com.example.held"), false,
+                                                         updateSandbox);
+        });
+    };
+    auto first = lookUp(false);
+    entered.get_future().wait();
+    EXPECT_EQ(identifiersOf(kGroup), Ids{"group.example"});
+    EXPECT_EQ(identifiersOf(kSystem), Ids{"com.orvex.devicesettings"});
+    EXPECT_TRUE(cache().allContainersForUserIdentity(guest(), kData, false));
+    auto second = lookUp(true);
+    untilWaiting(1, second);
+    auto removal = std::async(std::launch::async, [this] {
+        return cache().removeContainerForUserIdentity(mobile(), kData, "com.example.gone", false);
+    });
+    untilWaiting(2, removal);
+    release.count_down();
+
+    auto firstFound = first.get(), secondFound = second.get();
+    ASSERT_TRUE(firstFound && secondFound) << log_.all();
+    EXPECT_EQ((*firstFound)->uuid(), held->uuid());
+    EXPECT_EQ(firstFound->get(), secondFound->get()); // the one record, not a second scan's
+    EXPECT_TRUE(removal.get());
+    cache().setRebuildGate({});
+    EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.held"});
+    auto items = mapped(501);
+    ASSERT_EQ(items.size(), 1u) << log_.all();
+    EXPECT_EQ(items[0].identifier, "com.example.held");
+}
+
+// An invalidation of the user while the entry is scanned makes the scan
+// stale: it is redone, not published.
+TEST_F(QRNContainerCacheTest, AnInvalidationDuringAScanHasItRedone) {
+    makeContainer(kData, "com.example.app");
+    int scans = 0;
+    cache().setRebuildGate([&](std::uint64_t) {
+        if (scans++ == 0) {
+            cache().invalidateUserIdentity(mobile());
+        }
+    });
+    EXPECT_EQ(identifiersOf(kData), Ids{"com.example.app"});
+    cache().setRebuildGate({});
+    EXPECT_EQ(scans, 2);
+    EXPECT_EQ(rebuilds("[501]-appData"), 2u);
 }
 
 // --- The kernel sandbox mapping -------------------------------------------------------------
