@@ -214,6 +214,26 @@ QRNContainerCache::containerForContainerIdentity(const QRNContainerIdentityPtr& 
     return metadata;
 }
 
+Status QRNContainerCache::prepareEntryForContainerIdentity(const QRNContainerIdentityPtr& identity,
+                                                           bool transient, bool allowKernelLookup) {
+    if (!identity || !identity->userIdentity()) {
+        return QRN_UNEXPECTED(QRN_ERROR(kQRNErrorInvalidCacheInput, "Invalid Identifier: {}",
+                                        identity ? identity->identifier() : "(null)"));
+    }
+    const auto& user = identity->userIdentity();
+    const std::uint64_t cls = identity->containerClass();
+    Locker locked(*this);
+    const bool built = (transient ? transient_ : permanent_).count(cacheKey(*user, cls)) != 0;
+    if (built || (!transient && allowKernelLookup && _lock_containerFromKernelSandbox(*identity))) {
+        return {};
+    }
+    auto entry = _lock_entryFor(locked, user, cls, transient, false);
+    if (!entry) {
+        return QRN_UNEXPECTED(entry.error());
+    }
+    return {};
+}
+
 Result<std::vector<QRNContainerCache::MetadataPtr>>
 QRNContainerCache::allContainersForUserIdentity(const QRNUserIdentityPtr& userIdentity,
                                                 std::uint64_t contentClass, bool transient,

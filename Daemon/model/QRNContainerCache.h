@@ -84,6 +84,12 @@ public:
                                                       bool updateSandbox = false,
                                                       bool allowKernelLookup = false);
 
+    // Builds the identity's entry if it is not built yet and the lookup
+    // would not be answered from the kernel's mapping; waits for a build
+    // under way. Lets a caller scan before taking locks others wait for.
+    Status prepareEntryForContainerIdentity(const QRNContainerIdentityPtr& identity, bool transient,
+                                            bool allowKernelLookup);
+
     Result<std::vector<MetadataPtr>>
     allContainersForUserIdentity(const QRNUserIdentityPtr& userIdentity, std::uint64_t contentClass,
                                  bool transient, bool populateSandboxCache = false);

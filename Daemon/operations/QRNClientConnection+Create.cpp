@@ -80,6 +80,12 @@ QRNClientConnection::_createOrLookup(const QRNContainerIdentityPtr& identity,
     if (auto allowed = _checkSystemContainerAccess(*identity); !allowed) {
         return QRN_CODE(allowed.error());
     }
+    // The entry is built before any global lock is taken: a scan lasts as
+    // long as the class directory's owner makes it, and a global hold meanwhile
+    // would keep every creator waiting. A failure is met again under the lock.
+    const bool isKernel = clientIdentity_ && clientIdentity_->isKernel();
+    (void)QRNContainerCache::sharedInstance().prepareEntryForContainerIdentity(identity, transient,
+                                                                               !isKernel);
     if (!transient) {
         auto found = _lookupUnderReadLock(identity, useLocking);
         if (found || found.error() != kQRNErrorContainerNotFound) {

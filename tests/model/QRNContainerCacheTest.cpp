@@ -301,6 +301,22 @@ TEST_F(QRNContainerCacheTest, AnInvalidationDuringAScanHasItRedone) {
     EXPECT_EQ(rebuilds("[501]-appData"), 2u);
 }
 
+// Preparing builds an entry once, and not at all when the kernel's mapping
+// would answer the lookup (never for a transient entry).
+TEST_F(QRNContainerCacheTest, PreparingBuildsOnceUnlessTheKernelAnswers) {
+    auto made = makeContainer(kData, "com.example.app");
+    sandbox().setContainerMapping(501, {1, "com.example.app", kData, 501, made->url().string()});
+    const auto id = identity(kData, "com.example.app");
+    ASSERT_TRUE(cache().prepareEntryForContainerIdentity(id, false, true));
+    EXPECT_EQ(rebuilds("[501]-appData"), 0u);
+    for (int i = 0; i < 2; ++i) {
+        ASSERT_TRUE(cache().prepareEntryForContainerIdentity(id, false, false));
+        ASSERT_TRUE(cache().prepareEntryForContainerIdentity(id, true, true));
+    }
+    EXPECT_EQ(rebuilds("[501]-appData"), 1u);
+    EXPECT_EQ(rebuilds("[501]-appData(transient)"), 1u);
+}
+
 // --- The kernel sandbox mapping -------------------------------------------------------------
 
 // A replaced record takes its key with it: lookups and the removal of the
