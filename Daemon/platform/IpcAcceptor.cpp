@@ -41,7 +41,8 @@ IpcAcceptor::IpcAcceptor(std::shared_ptr<IpcServiceCore> core, const IpcListener
     : core_(std::move(core)), limits_{options.maxFrameBytes, options.maxNesting,
                                       options.maxDecodedItems, options.partialFrameTimeout},
       reapIdleAbove_(options.reapIdleAbove), idleTimeout_(options.idleTimeout),
-      handler_(std::move(handler)), acceptor_(core_->io(0)), backOffTimer_(core_->io(0)) {}
+      handler_(std::move(handler)), acceptor_(core_->io(IpcServiceCore::kAcceptorContext)),
+      backOffTimer_(core_->io(IpcServiceCore::kAcceptorContext)) {}
 
 Status IpcAcceptor::adopt(int listeningFd) {
     std::lock_guard lock(mutex_);

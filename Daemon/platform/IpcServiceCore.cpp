@@ -11,15 +11,17 @@ namespace quarn {
 IpcServiceCore::IpcServiceCore(std::size_t contexts, IpcConnectionSlots::Quota quota,
                                std::chrono::milliseconds memoryTrimInterval)
     : slots_(quota), memoryTrimInterval_(memoryTrimInterval) {
-    contexts_.reserve(std::max<std::size_t>(1, contexts));
-    for (std::size_t i = 0; i < std::max<std::size_t>(1, contexts); ++i) {
+    const std::size_t count = 1 + std::max<std::size_t>(1, contexts);
+    contexts_.reserve(count);
+    for (std::size_t i = 0; i < count; ++i) {
         // One thread runs each context.
         contexts_.push_back(std::make_unique<asio::io_context>(1));
     }
 }
 
 asio::io_context& IpcServiceCore::nextContext() {
-    return *contexts_[nextContext_.fetch_add(1, std::memory_order_relaxed) % contexts_.size()];
+    const std::size_t turn = nextContext_.fetch_add(1, std::memory_order_relaxed);
+    return *contexts_[kAcceptorContext + 1 + turn % (contexts_.size() - 1)];
 }
 
 bool IpcServiceCore::runningOnPool() const {

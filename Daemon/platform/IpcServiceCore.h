@@ -8,7 +8,9 @@
 // one thread without a strand, and a request is handled on the thread that
 // saw its bytes arrive: no hand-over between threads, which on a machine
 // with few cores cost more than the request itself. The price is that a
-// slow request delays the other connections pinned to the same thread.
+// slow request delays the other connections pinned to the same thread. The
+// acceptor has a context of its own (index 0) that no connection is pinned
+// to, so a slow request never holds up accepting new connections.
 //
 // The connection slots are shared out by uid (IpcConnectionSlots); when
 // they run short, idle connections are closed, the uid holding most first.
@@ -36,13 +38,16 @@ class AsioIpcConnection;
 
 class IpcServiceCore {
 public:
-    // At least one context.
+    // At least one context for connections, and the acceptor's.
     IpcServiceCore(std::size_t contexts, IpcConnectionSlots::Quota quota,
                    std::chrono::milliseconds memoryTrimInterval);
 
     std::size_t contextCount() const { return contexts_.size(); }
     asio::io_context& io(std::size_t index) { return *contexts_[index]; }
-    // The context for the next connection, round robin.
+    // The acceptor's context.
+    static constexpr std::size_t kAcceptorContext = 0;
+    // The context for the next connection, round robin over all but the
+    // acceptor's.
     asio::io_context& nextContext();
     // Whether the calling thread is running one of the contexts.
     bool runningOnPool() const;

@@ -29,6 +29,7 @@
 #include <condition_variable>
 #include <csignal>
 #include <fstream>
+#include <future>
 #include <limits>
 #include <mutex>
 #include <set>
@@ -280,6 +281,11 @@ protected:
             c->sendReply(message(sawOther ? 1 : 0));
         } else if (has("Hold")) {
             // Left unanswered: a request in flight.
+        } else if (has("Block")) {
+            // Keeps its thread busy until the test lets it go.
+            changed_.notify_all();
+            EXPECT_EQ(unblocked_.wait_for(kGuard), std::future_status::ready);
+            c->sendReply(event.body);
         } else if (has("Big")) {
             c->sendReply(Value::Dictionary{{"Big", Value::Data(2 * bulk_.size())}});
         } else if (has("Bulk")) {
@@ -323,6 +329,8 @@ protected:
     std::mutex meetMutex_; // guards meeting_
     std::condition_variable met_;
     std::set<std::uint64_t> meeting_;
+    std::promise<void> unblock_;
+    std::shared_future<void> unblocked_ = unblock_.get_future().share();
     const std::string bulk_ = std::string(300 * 1024, 'q');
     std::mutex mutex_; // guards records_
     std::condition_variable changed_;
@@ -418,6 +426,29 @@ TEST_F(IpcListenerTest, ServesInOrderConcurrentlyHeldOnesLaterAndHearsEachEndOnc
     EXPECT_EQ((std::vector{record(0).ends, record(1).ends, record(2).ends, record(3).ends,
                            record(4).ends, record(5).ends}),
               (std::vector{1, 1, 1, 1, 1, 0}));
+}
+
+// A request that keeps its thread busy holds up neither accepting nor the
+// connections pinned to other threads (a connection is greeted on its own).
+TEST_F(IpcListenerTest, ABusyRequestHoldsUpNeitherAcceptingNorOtherThreads) {
+    for (std::size_t threads : {2u, 4u}) {
+        SCOPED_TRACE(threads);
+        unblock_ = {};
+        unblocked_ = unblock_.get_future().share();
+        ASSERT_TRUE(start({.socketPath = socketPath(), .workerThreads = threads}));
+        Client busy(socketPath());
+        busy.send(message(7, "Block"));
+        ASSERT_TRUE(
+            waitUntil([&] { return !records_.empty() && !records_.back().writers.empty(); }));
+        Client next(socketPath());
+        EXPECT_EQ(next.roundTrip(8), 8u);
+        unblock_.set_value();
+        EXPECT_EQ(seqOf(busy.receive()), 7u);
+        EXPECT_EQ(next.roundTrip(9), 9u);
+        listener_->stop();
+        listener_.reset();
+        records_.clear();
+    }
 }
 
 // Also the ways start() fails without harm.
