@@ -23,9 +23,11 @@ public:
         std::size_t maxBytes = 1024 * 1024;
         std::size_t maxNesting = 32; // arrays and maps inside each other
         // Items decoded in all (scalars, map keys, arrays and maps): a Value
-        // costs tens of bytes where its CBOR took one.
+        // costs tens of bytes where its CBOR took one. An array or a map
+        // counts kContainerCost items: it holds an allocation of its own.
         std::size_t maxItems = std::numeric_limits<std::size_t>::max();
     };
+    static constexpr std::size_t kContainerCost = 8;
 
     // A none Value encodes as CBOR null.
     static std::vector<std::uint8_t> encode(const Value& value);

@@ -135,6 +135,10 @@ void CborDecoder::openContainer(std::uint64_t count, bool isMap) {
     if (stack_.size() >= limits_.maxNesting) {
         return fail(fmt::format("arrays and maps nest deeper than {}", limits_.maxNesting));
     }
+    decodedItems_ += CborCodec::kContainerCost - 1; // beginItem counted one
+    if (decodedItems_ > limits_.maxItems) {
+        return fail(fmt::format("the message holds more than {} items", limits_.maxItems));
+    }
     if (count == 0) {
         return finishItem(isMap ? Value::dictionary() : Value::array());
     }

@@ -31,7 +31,9 @@ FirstBootMarker::FirstBootMarker(const std::filesystem::path& rootPrefix) {
     const Paths paths(rootPrefix);
     name_ = std::string("/") + kBaseName;
     if (!paths.isSystemRoot()) {
-        name_ += "." + rootHash(paths.rootPrefix().string());
+        // Appended in two steps: gcc 12 warns (wrongly) about "." + a temporary.
+        name_ += '.';
+        name_ += rootHash(paths.rootPrefix().string());
     }
 }
 

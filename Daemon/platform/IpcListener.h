@@ -41,11 +41,12 @@ public:
         std::size_t workerThreads = 4;
         std::size_t maxFrameBytes = 1024 * 1024;
         std::size_t maxNesting = 32;
-        // Decoded items (scalars, keys, containers) one message may hold; far
-        // above what any request carries (command 3's three parallel arrays
-        // of a few thousand containers), and met long before 1 MiB of
-        // one-byte items has cost a Value each.
-        std::size_t maxDecodedItems = 64 * 1024;
+        // Decoded items (scalars and keys one each, arrays and maps
+        // CborCodec::kContainerCost) one message may hold: room for the
+        // largest request a frame carries (command 3's four parallel arrays
+        // of 25,000 containers each), and met long before 1 MiB of one-byte
+        // items or empty maps has cost a Value (and an allocation) each.
+        std::size_t maxDecodedItems = 256 * 1024;
         // Each open connection holds a socket, a pidfd, a /proc directory and
         // a read buffer; past this many, new ones are closed at once with a
         // log line instead of exhausting the daemon's descriptors (the soft

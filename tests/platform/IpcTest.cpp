@@ -9,6 +9,7 @@
 #include "Daemon/platform/Paths.h"
 #include "Daemon/platform/ProcessInfo.h"
 #include "Daemon/support/Descriptor.h"
+#include "Daemon/support/UUID.h"
 
 #include "common/TempRoot.h"
 #include "common/shared/ChildProcess.h"
@@ -639,12 +640,14 @@ TEST(CborCodecTest, ItemsOverTheBudgetAreRefusedBeforeTheyAreBuilt) {
         std::size_t maxItems;
         bool decodes;
     };
+    constexpr std::size_t kContainer = CborCodec::kContainerCost;
     const Case cases[] = {
-        {"array and its 3 items at 4", {0x83, 1, 2, 3}, 4, true},
-        {"array of 3 at 3", {0x83, 1, 2, 3}, 3, false},
-        {"map, key and value at 3", {0xa1, 0x61, 'a', 1}, 3, true},
-        {"map of 1 at 2", {0xa1, 0x61, 'a', 1}, 2, false},
-        {"siblings past the budget", {0x82, 0x81, 0x00, 0x81, 0x00}, 4, false},
+        {"array and its 3 items", {0x83, 1, 2, 3}, kContainer + 3, true},
+        {"array of 3 one short", {0x83, 1, 2, 3}, kContainer + 2, false},
+        {"map, key and value", {0xa1, 0x61, 'a', 1}, kContainer + 2, true},
+        {"map of 1 one short", {0xa1, 0x61, 'a', 1}, kContainer + 1, false},
+        {"empty maps cost their allocation", {0x82, 0xa0, 0xa0}, 3 * kContainer - 1, false},
+        {"siblings past the budget", {0x82, 0x81, 0x00, 0x81, 0x00}, 3 * kContainer + 1, false},
         {"tagged UUID counts tag and bytes", concat(Bytes({0xd8, 0x25, 0x50}), Bytes(16, 0)), 2,
          true},
     };
@@ -660,6 +663,23 @@ TEST(CborCodecTest, ItemsOverTheBudgetAreRefusedBeforeTheyAreBuilt) {
         maps, {.maxBytes = maps.size(), .maxItems = IpcListener::Options{}.maxDecodedItems});
     ASSERT_FALSE(refused);
     EXPECT_NE(refused.error().message.find("budget"), std::string::npos) << refused.error().message;
+    // The largest request a frame carries still decodes: command 3 with its
+    // four parallel arrays as long as 1 MiB allows.
+    Value::Array classes, uuids, identifiers, personas;
+    for (int i = 0; i < 25000; ++i) {
+        classes.emplace_back(2u);
+        uuids.emplace_back(UUID::random());
+        identifiers.emplace_back("com.example.x" + std::to_string(i));
+        personas.emplace_back("");
+    }
+    const auto largest =
+        CborCodec::encode(Value(Value::Dictionary{{"Command", 3u},
+                                                  {"ContainerClassesArray", classes},
+                                                  {"UUIDsArray", uuids},
+                                                  {"IdentifiersArray", identifiers},
+                                                  {"PersonaUniqueStringsArray", personas}}));
+    ASSERT_LE(largest.size(), IpcListener::Options{}.maxFrameBytes);
+    EXPECT_TRUE(CborCodec::decode(largest, {.maxItems = IpcListener::Options{}.maxDecodedItems}));
 }
 
 TEST(IpcConnectionSlotsTest, EachUidHasItsShareAndRootItsReserve) {
