@@ -10,6 +10,7 @@
 #include "Daemon/support/Log.h"
 #include "Daemon/support/QRNDaemonContext.h"
 
+#include <malloc.h>
 #include <sys/resource.h>
 
 #include <cerrno>
@@ -48,6 +49,20 @@ void raiseDescriptorLimit() {
                    limit.rlim_cur < 65536 ? " (the hard limit allows no more than this)" : "");
 }
 
+// A client may send large frames whose decoding takes many small blocks
+// at once. With its default adaptive thresholds the allocator then keeps
+// tens of megabytes for good after they are freed (a freed large block
+// raises its trim threshold up to 32 MiB); fixed ones hand memory back to
+// the system as soon as it is free.
+void boundRetainedHeap() {
+    constexpr int kMmapThreshold = 128 * 1024;
+    constexpr int kTrimThreshold = 256 * 1024;
+    if (::mallopt(M_MMAP_THRESHOLD, kMmapThreshold) != 1 ||
+        ::mallopt(M_TRIM_THRESHOLD, kTrimThreshold) != 1) {
+        QRN_LOG_ERROR(quarn::LogCategory::Unspecified, "Could not set the heap's trim thresholds");
+    }
+}
+
 } // namespace
 
 int main(int argc, char** argv) {
@@ -65,6 +80,7 @@ int main(int argc, char** argv) {
         Log::addStderr();
     }
     raiseDescriptorLimit();
+    boundRetainedHeap();
     // Error descriptions keep paths as they are: nothing here localises them.
 
     auto context = std::make_shared<QRNDaemonContext>(options.root);

@@ -17,6 +17,7 @@ IpcServiceCore::IpcServiceCore(std::size_t contexts, IpcConnectionSlots::Quota q
         // One thread runs each context.
         contexts_.push_back(std::make_unique<asio::io_context>(1));
     }
+    trimTimer_ = std::make_unique<asio::steady_timer>(*contexts_[kAcceptorContext]);
 }
 
 asio::io_context& IpcServiceCore::nextContext() {
@@ -31,8 +32,13 @@ bool IpcServiceCore::runningOnPool() const {
 }
 
 void IpcServiceCore::closeGate() {
-    std::lock_guard lock(gateMutex_);
-    gateClosed_ = true;
+    {
+        std::lock_guard lock(gateMutex_);
+        gateClosed_ = true;
+    }
+    // A trim still waiting would keep the stopping pool running until it is due.
+    std::lock_guard lock(trimMutex_);
+    trimTimer_->cancel();
 }
 
 bool IpcServiceCore::hasSlotFor(uid_t uid) const {
@@ -94,18 +100,39 @@ IpcServiceCore::idleConnections(std::chrono::steady_clock::time_point cutoff,
     return idle;
 }
 
+void IpcServiceCore::trimNow() {
+    lastTrim_.store(std::chrono::steady_clock::now().time_since_epoch().count(),
+                    std::memory_order_relaxed);
+    ::malloc_trim(0);
+}
+
 void IpcServiceCore::trimMemory() {
-    const auto now = std::chrono::steady_clock::now().time_since_epoch().count();
-    auto last = lastTrim_.load(std::memory_order_relaxed);
-    const auto interval =
-        std::chrono::duration_cast<std::chrono::steady_clock::duration>(memoryTrimInterval_)
-            .count();
-    if (last != 0 && now - last < interval) {
+    const auto now = std::chrono::steady_clock::now();
+    const auto last = std::chrono::steady_clock::time_point(
+        std::chrono::steady_clock::duration(lastTrim_.load(std::memory_order_relaxed)));
+    std::lock_guard lock(trimMutex_);
+    if (trimPending_) {
+        return; // the trim at the end of the interval frees this too
+    }
+    if (last.time_since_epoch().count() == 0 || now - last >= memoryTrimInterval_) {
+        trimNow();
         return;
     }
-    if (lastTrim_.compare_exchange_strong(last, now, std::memory_order_relaxed)) {
-        ::malloc_trim(0);
+    {
+        std::lock_guard gate(gateMutex_);
+        if (gateClosed_) {
+            return;
+        }
     }
+    trimPending_ = true;
+    trimTimer_->expires_at(last + memoryTrimInterval_);
+    trimTimer_->async_wait([this](const asio::error_code& error) {
+        std::lock_guard lock(trimMutex_);
+        trimPending_ = false;
+        if (!error) {
+            trimNow();
+        }
+    });
 }
 
 std::size_t IpcServiceCore::openCount() const {

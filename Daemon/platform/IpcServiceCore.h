@@ -22,6 +22,7 @@
 
 #include <asio/io_context.hpp>
 #include <asio/post.hpp>
+#include <asio/steady_timer.hpp>
 
 #include <atomic>
 #include <chrono>
@@ -77,7 +78,9 @@ public:
     std::vector<std::shared_ptr<AsioIpcConnection>>
     idleConnections(std::chrono::steady_clock::time_point cutoff, std::size_t keep) const;
 
-    // Gives freed heap back to the system, at most once per trim interval.
+    // Gives freed heap back to the system, at most once per trim interval:
+    // a call within the interval of the last trim has one made at its end,
+    // so memory freed by a burst of large frames does not stay with the daemon.
     void trimMemory();
 
 private:
@@ -96,6 +99,11 @@ private:
     IpcConnectionSlots slots_;
     const std::chrono::milliseconds memoryTrimInterval_;
     std::atomic<std::chrono::steady_clock::rep> lastTrim_{0};
+    // Guards trimTimer_ and trimPending_: any pool thread may ask for a trim.
+    std::mutex trimMutex_;
+    std::unique_ptr<asio::steady_timer> trimTimer_; // on the acceptor's context
+    bool trimPending_ = false;
+    void trimNow();
 };
 
 } // namespace quarn
