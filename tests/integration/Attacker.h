@@ -4,6 +4,9 @@
 // supplementary groups, and a record of a tree's owners and modes to show
 // that nothing outside a container changed.
 
+#include "Client/QRNClientRequests.h"
+#include "DaemonHarness.h"
+
 #include <sys/stat.h>
 #include <sys/types.h>
 #include <sys/wait.h>
@@ -64,5 +67,29 @@ inline TreeSnapshot snapshotOf(const std::filesystem::path& path) {
     }
     return out;
 }
+
+// A daemon of its own per test, on a root the attacker can reach (mkdtemp
+// made it 0700).
+class AttackTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::filesystem::permissions(daemon_.root(), std::filesystem::perms(0755));
+        ASSERT_TRUE(daemon_.start());
+    }
+
+    // The path of a container a privileged client made or found; empty
+    // (and the test failed) when there is none.
+    std::filesystem::path create(const std::string& identifier, std::uint64_t cls,
+                                 bool transient = false) {
+        const Value reply =
+            daemon_.request(QRNClientRequests::createOrLookup(identifier, cls, true, transient));
+        const Value* path = reply.get("ReplyPath");
+        EXPECT_TRUE(path && path->asString()) << reply.description();
+        return path && path->asString() ? std::filesystem::path(*path->asString())
+                                        : std::filesystem::path();
+    }
+
+    DaemonHarness daemon_;
+};
 
 } // namespace quarn::test

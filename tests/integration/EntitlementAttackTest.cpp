@@ -50,8 +50,8 @@ TEST_F(EntitlementAttack, OthersRunningAnEntitledProgramGetNoRights) {
     ASSERT_EQ(::chmod(daemon().root().c_str(), 0755), 0);
     const Value made = daemon().request(
         QRNClientRequests::createOrLookup("com.orvex.test.victim", 2, true, false));
-    const std::string victim = made.get("ReplyPath") ? *made.get("ReplyPath")->asString() : "";
-    ASSERT_FALSE(victim.empty()) << made.description();
+    ASSERT_TRUE(made.get("ReplyPath")) << made.description();
+    const std::string victim = *made.get("ReplyPath")->asString();
 
     const std::vector<Value> attempts{
         QRNClientRequests::containersOfClass(2, false),

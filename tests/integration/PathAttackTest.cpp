@@ -23,25 +23,10 @@ std::string contentsOf(const fs::path& path) {
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
-class PathAttackTest : public ::testing::Test {
+class PathAttackTest : public AttackTest {
 protected:
-    void SetUp() override {
-        // mkdtemp made the root 0700: the attacker must reach its home.
-        fs::permissions(daemon_.root(), fs::perms(0755));
-        ASSERT_TRUE(daemon_.start());
-    }
-
     fs::path containers() const { return daemon_ / "/private/var/mobile/Containers"; }
     fs::path victim() const { return daemon_ / "/private/var/victim"; }
-
-    // The path of a container made (or found) by a privileged client.
-    fs::path create(const std::string& identifier, std::uint64_t cls, bool transient = false) {
-        const Value reply =
-            daemon_.request(Requests::createOrLookup(identifier, cls, true, transient));
-        EXPECT_EQ(replyError(reply), kQRNErrorNone) << reply.description();
-        const Value* path = reply.get("ReplyPath");
-        return path && path->asString() ? fs::path(*path->asString()) : fs::path();
-    }
 
     // Root-owned files the attacker would like the daemon to destroy or change.
     void makeVictim(const std::vector<std::string>& directories) {
@@ -60,8 +45,6 @@ protected:
                    ::symlink(target.c_str(), at.c_str()) == 0;
         });
     }
-
-    DaemonHarness daemon_;
 };
 
 TEST_F(PathAttackTest, BootCleanUpsDoNotFollowLinkedStagingTransientOrClassDirectories) {

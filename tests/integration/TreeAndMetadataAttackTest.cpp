@@ -19,22 +19,8 @@ using Requests = QRNClientRequests;
 
 constexpr const char* kMetadata = ".com.orvex.quarn_store.metadata.plist";
 
-class TreeAndMetadataAttackTest : public ::testing::Test {
+class TreeAndMetadataAttackTest : public AttackTest {
 protected:
-    void SetUp() override {
-        // mkdtemp made the root 0700: the attacker must reach its home.
-        fs::permissions(daemon_.root(), fs::perms(0755));
-        ASSERT_TRUE(daemon_.start());
-    }
-
-    fs::path create(const std::string& identifier, bool transient = false) {
-        const Value reply =
-            daemon_.request(Requests::createOrLookup(identifier, 2, true, transient));
-        EXPECT_EQ(replyError(reply), kQRNErrorNone) << reply.description();
-        const Value* path = reply.get("ReplyPath");
-        return path && path->asString() ? fs::path(*path->asString()) : fs::path();
-    }
-
     // As the attacker: a chain of `depth` directories below `base`, made by
     // descriptor (its path is far longer than any the kernel takes).
     static bool buildDeepTree(const fs::path& base, int depth) {
@@ -50,12 +36,10 @@ protected:
             return fd >= 0 && ::close(fd) == 0;
         });
     }
-
-    DaemonHarness daemon_;
 };
 
 TEST_F(TreeAndMetadataAttackTest, PlantedMetadataNeverTakesAnotherAppsContainer) {
-    const fs::path real = create("com.orvex.test.victim");
+    const fs::path real = create("com.orvex.test.victim", 2);
     ASSERT_FALSE(real.empty());
     const fs::path metadata = real / kMetadata;
     auto plist = QRN_dictionaryWithContentsOfURL(metadata);
@@ -79,17 +63,14 @@ TEST_F(TreeAndMetadataAttackTest, PlantedMetadataNeverTakesAnotherAppsContainer)
     }));
     daemon_.expectCleanStop();
     ASSERT_TRUE(daemon_.start());
-    const Value reply =
-        daemon_.request(Requests::createOrLookup("com.orvex.test.victim", 2, true, false));
-    ASSERT_NE(reply.get("ReplyPath"), nullptr) << reply.description();
-    EXPECT_EQ(*reply.get("ReplyPath")->asString(), real.string());
+    EXPECT_EQ(create("com.orvex.test.victim", 2), real);
     EXPECT_NE(daemon_.log().find("INCONSISTENT"), std::string::npos);
 }
 
 TEST_F(TreeAndMetadataAttackTest, DeepTreesAreMeasuredAndDestroyedWithoutHarm) {
     constexpr int kDepth = 10000; // far past the usual descriptor limit of 1024
-    const fs::path transient = create("com.orvex.test.deep", true);
-    const fs::path permanent = create("com.orvex.test.deep");
+    const fs::path transient = create("com.orvex.test.deep", 2, true);
+    const fs::path permanent = create("com.orvex.test.deep", 2);
     ASSERT_FALSE(transient.empty() || permanent.empty());
     ASSERT_TRUE(buildDeepTree(transient / "tmp", kDepth));
     ASSERT_TRUE(buildDeepTree(permanent / "tmp", kDepth));
@@ -103,7 +84,7 @@ TEST_F(TreeAndMetadataAttackTest, DeepTreesAreMeasuredAndDestroyedWithoutHarm) {
     EXPECT_GE(*bytes->asUInt64(), static_cast<std::uint64_t>(top.st_blocks) * 512 * kDepth);
 
     // A new transient container sends the old one, tree and all, to death row.
-    const fs::path next = create("com.orvex.test.deep", true);
+    const fs::path next = create("com.orvex.test.deep", 2, true);
     EXPECT_NE(next, transient);
     ASSERT_TRUE(daemon_.request(Requests::deleteContainersOnDeathRow()).isDictionary());
     EXPECT_TRUE(waitUntil([&] { return !fs::exists(transient); }));
