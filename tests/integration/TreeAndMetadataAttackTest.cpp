@@ -59,12 +59,23 @@ TEST_F(TreeAndMetadataAttackTest, PlantedMetadataNeverTakesAnotherAppsContainer)
                 return false;
             }
         }
-        return true;
+        // And many links to one huge file, which would cost a parse each.
+        Value huge = *plist;
+        huge.set("QRNMetadataInfo", Value(Value::Dictionary{{"x", std::string(1 << 20, 'x')}}));
+        const fs::path big = real.parent_path() / ".big";
+        bool linked = QRN_writeToURL(huge, big).has_value();
+        for (int i = 0; linked && i < 50; ++i) {
+            const fs::path directory = real.parent_path() / UUID::random().string();
+            linked = fs::create_directory(directory) &&
+                     ::link(big.c_str(), (directory / kMetadata).c_str()) == 0;
+        }
+        return linked;
     }));
     daemon_.expectCleanStop();
     ASSERT_TRUE(daemon_.start());
     EXPECT_EQ(create("com.orvex.test.victim", 2), real);
     EXPECT_NE(daemon_.log().find("INCONSISTENT"), std::string::npos);
+    EXPECT_NE(daemon_.log().find("Untrusted metadata file"), std::string::npos);
 }
 
 TEST_F(TreeAndMetadataAttackTest, DeepTreesAreMeasuredAndDestroyedWithoutHarm) {
